@@ -1,0 +1,25 @@
+# Every target in the project compiles with the same strict warnings.
+add_compile_options(-Wall -Wextra -Werror -Wno-missing-field-initializers)
+if(CMAKE_BUILD_TYPE STREQUAL "Debug" OR QUORVEL_DCHECK OR QUORVEL_SANITIZE)
+  add_compile_definitions(QUORVEL_DCHECK_IS_ON=1)
+endif()
+
+# quorvel_add_library(NAME) builds every .cpp below the calling folder (except
+# those listed in EXCLUDE) into a static library whose headers are included as
+# "Folder/Header.h" from the repository root.
+function(quorvel_add_library name)
+  cmake_parse_arguments(ARG "" "" "EXCLUDE" ${ARGN})
+  file(GLOB_RECURSE sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp)
+  foreach(excluded IN LISTS ARG_EXCLUDE)
+    list(REMOVE_ITEM sources ${CMAKE_CURRENT_SOURCE_DIR}/${excluded})
+  endforeach()
+  if(sources)
+    add_library(${name} STATIC ${sources})
+    target_include_directories(${name} PUBLIC ${PROJECT_SOURCE_DIR})
+    set(QUORVEL_LIBRARY_SCOPE PUBLIC PARENT_SCOPE)
+  else()
+    add_library(${name} INTERFACE)
+    target_include_directories(${name} INTERFACE ${PROJECT_SOURCE_DIR})
+    set(QUORVEL_LIBRARY_SCOPE INTERFACE PARENT_SCOPE)
+  endif()
+endfunction()

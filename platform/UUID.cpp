@@ -1,0 +1,63 @@
+#include "platform/UUID.h"
+
+#include <sys/random.h>
+
+#include <cerrno>
+#include <cstdlib>
+
+namespace platform {
+
+UUID UUID::random() {
+  UUID uuid;
+  std::size_t filled = 0;
+  while (filled < uuid.bytes_.size()) {
+    ssize_t n = getrandom(uuid.bytes_.data() + filled, uuid.bytes_.size() - filled, 0);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      std::abort();  // no randomness at all: nothing sensible can go on
+    }
+    filled += static_cast<std::size_t>(n);
+  }
+  uuid.bytes_[6] = static_cast<std::uint8_t>((uuid.bytes_[6] & 0x0F) | 0x40);
+  uuid.bytes_[8] = static_cast<std::uint8_t>((uuid.bytes_[8] & 0x3F) | 0x80);
+  return uuid;
+}
+
+std::optional<UUID> UUID::fromString(std::string_view text) {
+  if (text.size() != 36) return std::nullopt;
+  UUID uuid;
+  std::size_t byte = 0;
+  for (std::size_t i = 0; i < text.size();) {
+    if (i == 8 || i == 13 || i == 18 || i == 23) {
+      if (text[i] != '-') return std::nullopt;
+      ++i;
+      continue;
+    }
+    auto hex = [](char c) -> int {
+      if (c >= '0' && c <= '9') return c - '0';
+      if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+      if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+      return -1;
+    };
+    int high = hex(text[i]);
+    int low = hex(text[i + 1]);
+    if (high < 0 || low < 0) return std::nullopt;
+    uuid.bytes_[byte++] = static_cast<std::uint8_t>(high * 16 + low);
+    i += 2;
+  }
+  return uuid;
+}
+
+std::string UUID::string() const {
+  static constexpr char kHex[] = "0123456789ABCDEF";
+  std::string out;
+  out.reserve(36);
+  for (std::size_t i = 0; i < bytes_.size(); ++i) {
+    if (i == 4 || i == 6 || i == 8 || i == 10) out.push_back('-');
+    out.push_back(kHex[bytes_[i] >> 4]);
+    out.push_back(kHex[bytes_[i] & 0xF]);
+  }
+  return out;
+}
+
+}  // namespace platform

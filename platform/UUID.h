@@ -1,0 +1,40 @@
+// UUID: a random (version 4) identifier. A value type, safe to share.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace platform {
+
+class UUID {
+ public:
+  // A fresh random UUID from the kernel's random source.
+  static UUID random();
+  // Parses the 36-character form, either case; nullopt otherwise.
+  static std::optional<UUID> fromString(std::string_view text);
+
+  // Upper-case 8-4-4-4-12 form, "E621E1F8-C36C-495A-93FC-0C247A3E6E5F".
+  std::string string() const;
+  const std::array<std::uint8_t, 16>& bytes() const { return bytes_; }
+
+  friend bool operator==(const UUID&, const UUID&) = default;
+  friend auto operator<=>(const UUID&, const UUID&) = default;
+
+ private:
+  std::array<std::uint8_t, 16> bytes_{};
+};
+
+}  // namespace platform
+
+template <>
+struct std::hash<platform::UUID> {
+  std::size_t operator()(const platform::UUID& uuid) const noexcept {
+    std::size_t h = 0;
+    for (auto b : uuid.bytes()) h = h * 131 + b;
+    return h;
+  }
+};
