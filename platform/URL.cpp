@@ -86,6 +86,7 @@ std::optional<std::string> percentDecode(std::string_view text) {
   std::string out;
   out.reserve(text.size());
   for (std::size_t i = 0; i < text.size(); ++i) {
+    if (text[i] == '\0') return std::nullopt;
     if (text[i] != '%') {
       out.push_back(text[i]);
       continue;
