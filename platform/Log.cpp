@@ -147,9 +147,9 @@ void setLogSinkForTesting(LogSink sink) {
 
 namespace detail {
 
-void writeLogLine(int level, std::string_view file, std::string_view function, int line,
-                  std::string_view message) {
-  std::string text = fmt::format("[{}] {}", logTagForFile(file), message);
+void writeLogLine(int level, std::string_view tag, std::string_view file, std::string_view function,
+                  int line, std::string_view message) {
+  std::string text = fmt::format("[{}] {}", tag, message);
   if (shouldLogToConsole(level, LogCategory::Default)) logToConsole(text);
   if (LoggingShouldLog(level, LogCategory::Default)) {
     LogInternal(level, LogCategory::Default, file, function, line, text);

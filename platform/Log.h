@@ -1,7 +1,8 @@
 // The log: one line per statement, "[<tag>] <message>", where the tag is the
 // name of the source file up to its first '.' (so SavedRecordingService.cpp
 // and SavedRecordingService.Connections.cpp both log as
-// "[SavedRecordingService] ").
+// "[SavedRecordingService] "). A file whose lines belong under another tag
+// defines QV_LOG_TAG ("RCSXPCTransaction") before its first #include.
 //
 // Levels are syslog's: 4 for errors and warnings, 6 for notable events, 7 for
 // tracing. A line goes to the console (stderr, human-readable) when the
@@ -63,21 +64,25 @@ using LogSink = std::function<void(int level, std::string_view text)>;
 void setLogSinkForTesting(LogSink sink);
 
 namespace detail {
-void writeLogLine(int level, std::string_view file, std::string_view function, int line,
-                  std::string_view message);
+void writeLogLine(int level, std::string_view tag, std::string_view file, std::string_view function,
+                  int line, std::string_view message);
 }  // namespace detail
 
 }  // namespace platform
 
+#ifndef QV_LOG_TAG
+#define QV_LOG_TAG ::platform::logTagForFile(__FILE__)
+#endif
+
 // QV_LOG(level, "format {}", args...): formats (fmt syntax) only when the line
 // goes somewhere.
-#define QV_LOG(level, ...)                                                                 \
-  do {                                                                                     \
-    ::platform::logInitialize();                                                           \
-    const int qv_log_level_ = (level);                                                     \
-    if (::platform::shouldLogToConsole(qv_log_level_, ::platform::LogCategory::Default) || \
-        ::platform::LoggingShouldLog(qv_log_level_, ::platform::LogCategory::Default)) {   \
-      ::platform::detail::writeLogLine(qv_log_level_, __FILE__, __func__, __LINE__,        \
-                                       ::fmt::format(__VA_ARGS__));                        \
-    }                                                                                      \
+#define QV_LOG(level, ...)                                                                      \
+  do {                                                                                          \
+    ::platform::logInitialize();                                                                \
+    const int qv_log_level_ = (level);                                                          \
+    if (::platform::shouldLogToConsole(qv_log_level_, ::platform::LogCategory::Default) ||      \
+        ::platform::LoggingShouldLog(qv_log_level_, ::platform::LogCategory::Default)) {        \
+      ::platform::detail::writeLogLine(qv_log_level_, QV_LOG_TAG, __FILE__, __func__, __LINE__, \
+                                       ::fmt::format(__VA_ARGS__));                             \
+    }                                                                                           \
   } while (0)
