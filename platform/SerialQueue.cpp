@@ -1,0 +1,147 @@
+// SerialQueue: one worker thread draining a FIFO of items under one mutex.
+//
+// async() appends a task and signals the worker: one lock, one deque slot,
+// no allocation beyond the task itself.
+//
+// sync() runs its task on the calling thread, not the worker, once the queue
+// is the caller's: the queue is "owned" by at most one thread at a time (the
+// worker running a task, or a sync caller). When the queue is idle (nothing
+// queued, no owner) the caller takes it at once without waking the worker.
+// Otherwise the caller queues a gate item and waits; when the worker reaches
+// the gate it hands ownership to the caller instead of running anything, and
+// waits until the caller gives it back. So FIFO order holds across async and
+// sync, the caller's thread-local state (the current connection, the queue
+// chain) stays visible inside the task, and an idle sync costs no thread hop.
+#include "platform/SerialQueue.h"
+
+#include <fmt/format.h>
+
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <deque>
+#include <mutex>
+#include <thread>
+#include <utility>
+
+namespace platform {
+namespace {
+
+struct SyncGate {
+  std::condition_variable granted_cv;
+  bool granted = false;
+};
+
+struct Item {
+  Task task;
+  SyncGate* gate = nullptr;  // set for a sync caller waiting for its turn
+};
+
+[[noreturn]] void fatal(const std::string& message) {
+  fmt::print(stderr, "{}\n", message);
+  std::fflush(stderr);
+  std::abort();
+}
+
+}  // namespace
+
+struct SerialQueue::State {
+  std::string label;
+  std::mutex mutex;
+  std::condition_variable wake;  // the worker: an item arrived, ownership returned, or stop
+  std::deque<Item> items;
+  bool owned = false;  // a thread (worker or sync caller) is running a task of this queue
+  bool stopping = false;
+  std::thread::id workerId;
+  std::thread worker;
+};
+
+SerialQueue::SerialQueue(std::string label) : state_(std::make_unique<State>()) {
+  state_->label = std::move(label);
+  State& state = *state_;
+  state_->worker = std::thread([this, &state] {
+    std::unique_lock lock(state.mutex);
+    for (;;) {
+      state.wake.wait(lock, [&] {
+        return (!state.items.empty() && !state.owned) ||
+               (state.stopping && state.items.empty() && !state.owned);
+      });
+      if (state.items.empty()) return;  // stopping and drained
+      Item item = std::move(state.items.front());
+      state.items.pop_front();
+      state.owned = true;
+      if (item.gate != nullptr) {
+        // Hand the queue to the waiting sync caller; it clears `owned`.
+        item.gate->granted = true;
+        item.gate->granted_cv.notify_one();
+        continue;
+      }
+      lock.unlock();
+      {
+        detail::ScopedCurrentQueue scope(*this);
+        item.task();
+        item.task = nullptr;  // destroy captures while still on the queue
+      }
+      lock.lock();
+      state.owned = false;
+    }
+  });
+  state_->workerId = state_->worker.get_id();
+}
+
+SerialQueue::~SerialQueue() {
+  if (std::this_thread::get_id() == state_->workerId || detail::isRunningOnQueue(*this)) {
+    fatal(fmt::format("SerialQueue '{}' destroyed from its own queue", state_->label));
+  }
+  {
+    std::lock_guard lock(state_->mutex);
+    state_->stopping = true;
+  }
+  state_->wake.notify_all();
+  state_->worker.join();
+}
+
+void SerialQueue::async(Task task) {
+  {
+    std::lock_guard lock(state_->mutex);
+    state_->items.push_back(Item{std::move(task), nullptr});
+  }
+  state_->wake.notify_one();
+}
+
+void SerialQueue::sync(Task task) {
+  if (detail::isRunningOnQueue(*this)) {
+    fatal(fmt::format("SerialQueue::sync called from the '{}' queue onto itself: it would deadlock",
+                      state_->label));
+  }
+  State& state = *state_;
+  {
+    std::unique_lock lock(state.mutex);
+    if (state.owned || !state.items.empty()) {
+      SyncGate gate;
+      state.items.push_back(Item{nullptr, &gate});
+      state.wake.notify_one();
+      gate.granted_cv.wait(lock, [&] { return gate.granted; });
+    } else {
+      state.owned = true;
+    }
+  }
+  struct Release {
+    State& state;
+    ~Release() {
+      {
+        std::lock_guard lock(state.mutex);
+        state.owned = false;
+      }
+      state.wake.notify_one();
+    }
+  } release{state};
+  detail::ScopedCurrentQueue scope(*this);
+  task();
+}
+
+bool SerialQueue::isCurrent() const { return detail::isRunningOnQueue(*this); }
+
+const std::string& SerialQueue::label() const { return state_->label; }
+
+}  // namespace platform

@@ -1,0 +1,279 @@
+// Serial queues, the global queue, the current-queue chain and the queue
+// assertion, driven through real worker threads.
+#include "platform/SerialQueue.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <barrier>
+#include <future>
+#include <latch>
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "platform/GlobalQueue.h"
+
+namespace platform {
+namespace {
+
+TEST(SerialQueueTest, RunsAsyncTasksInOrderOnOneThreadThatIsNotTheCaller) {
+  SerialQueue queue("test.order");
+  std::vector<int> seen;
+  std::vector<std::thread::id> threads;
+  for (int i = 0; i < 1000; ++i) {
+    queue.async([&, i] {
+      seen.push_back(i);
+      threads.push_back(std::this_thread::get_id());
+    });
+  }
+  queue.sync([] {});
+  ASSERT_EQ(seen.size(), 1000u);
+  for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[i], i);
+  for (auto id : threads) EXPECT_EQ(id, threads.front());
+  EXPECT_NE(threads.front(), std::this_thread::get_id());
+}
+
+TEST(SerialQueueTest, SyncWaitsBehindQueuedWorkAndKeepsFifoWithAsync) {
+  SerialQueue queue("test.sync-order");
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  std::vector<std::string> log;
+  queue.async([&, released] {
+    released.wait();
+    log.push_back("blocked task");
+  });
+  queue.async([&] { log.push_back("async 1"); });
+  auto syncDone =
+      std::async(std::launch::async, [&] { queue.sync([&] { log.push_back("sync"); }); });
+  // The sync cannot finish while the first task holds the queue.
+  EXPECT_EQ(syncDone.wait_for(std::chrono::milliseconds(0)), std::future_status::timeout);
+  release.set_value();
+  syncDone.get();
+  queue.async([&] { log.push_back("async 2"); });
+  queue.sync([] {});
+  EXPECT_EQ(log, (std::vector<std::string>{"blocked task", "async 1", "sync", "async 2"}));
+}
+
+TEST(SerialQueueTest, SyncRunsOnTheCallersThreadAndCountsAsTheQueue) {
+  SerialQueue queue("test.sync-thread");
+  std::thread::id ranOn;
+  bool current = false;
+  DispatchQueue* currentQueue = nullptr;
+  queue.sync([&] {
+    ranOn = std::this_thread::get_id();
+    current = queue.isCurrent();
+    currentQueue = DispatchQueue::current();
+  });
+  EXPECT_EQ(ranOn, std::this_thread::get_id());
+  EXPECT_TRUE(current);
+  EXPECT_EQ(currentQueue, &queue);
+  EXPECT_FALSE(queue.isCurrent());
+  EXPECT_EQ(DispatchQueue::current(), nullptr);
+}
+
+TEST(SerialQueueTest, CurrentQueueFollowsNestedSync) {
+  SerialQueue outer("test.outer");
+  SerialQueue inner("test.inner");
+  struct Seen {
+    DispatchQueue* before = nullptr;
+    DispatchQueue* insideInner = nullptr;
+    bool outerCurrentInsideInner = false;
+    bool innerCurrentInsideInner = false;
+    DispatchQueue* after = nullptr;
+  } seen;
+  outer.sync([&] {
+    seen.before = DispatchQueue::current();
+    inner.sync([&] {
+      seen.insideInner = DispatchQueue::current();
+      seen.outerCurrentInsideInner = outer.isCurrent();
+      seen.innerCurrentInsideInner = inner.isCurrent();
+    });
+    seen.after = DispatchQueue::current();
+  });
+  EXPECT_EQ(seen.before, &outer);
+  EXPECT_EQ(seen.insideInner, &inner);
+  EXPECT_TRUE(seen.outerCurrentInsideInner);
+  EXPECT_TRUE(seen.innerCurrentInsideInner);
+  EXPECT_EQ(seen.after, &outer);
+
+  // The same from the outer queue's own worker thread.
+  std::promise<bool> fromWorker;
+  outer.async([&] {
+    bool ok = DispatchQueue::current() == &outer && !inner.isCurrent();
+    inner.sync([&] { ok = ok && outer.isCurrent() && DispatchQueue::current() == &inner; });
+    fromWorker.set_value(ok && DispatchQueue::current() == &outer);
+  });
+  EXPECT_TRUE(fromWorker.get_future().get());
+}
+
+TEST(SerialQueueTest, DestructionRunsWhatIsQueuedIncludingWhatTasksQueue) {
+  std::atomic<int> ran{0};
+  {
+    SerialQueue queue("test.drain");
+    std::promise<void> release;
+    std::shared_future<void> released = release.get_future().share();
+    queue.async([released] { released.wait(); });
+    for (int i = 0; i < 100; ++i) {
+      queue.async([&] {
+        ++ran;
+        if (ran == 100) queue.async([&] { ++ran; });
+      });
+    }
+    release.set_value();
+  }
+  EXPECT_EQ(ran.load(), 101);
+}
+
+TEST(SerialQueueTest, TasksNeverOverlapUnderConcurrentAsyncAndSync) {
+  SerialQueue queue("test.exclusive");
+  int unguarded = 0;  // only touched on the queue; TSan flags any overlap
+  std::atomic<bool> inside{false};
+  std::atomic<int> overlaps{0};
+  auto body = [&] {
+    if (inside.exchange(true)) ++overlaps;
+    ++unguarded;
+    inside = false;
+  };
+  constexpr int kThreads = 4;
+  constexpr int kPerThread = 2000;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < kPerThread; ++i) {
+        if ((i + t) % 3 == 0) {
+          queue.sync(body);
+        } else {
+          queue.async(body);
+        }
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  int total = 0;
+  queue.sync([&] { total = unguarded; });
+  EXPECT_EQ(total, kThreads * kPerThread);
+  EXPECT_EQ(overlaps.load(), 0);
+}
+
+// 100,000 tasks from several producers across several queues: each
+// producer's tasks for a queue run in the order it queued them.
+TEST(SerialQueueStressTest, HundredThousandTasksAcrossQueuesRunInOrder) {
+  constexpr int kQueues = 8;
+  constexpr int kProducers = 4;
+  constexpr int kTasksPerProducer = 25000;
+  std::vector<std::unique_ptr<SerialQueue>> queues;
+  for (int q = 0; q < kQueues; ++q) queues.push_back(std::make_unique<SerialQueue>("stress"));
+  // next[q][p]: the sequence number queue q expects next from producer p;
+  // only touched on queue q.
+  std::vector<std::vector<int>> next(kQueues, std::vector<int>(kProducers, 0));
+  std::vector<int> outOfOrder(kQueues, 0);
+  std::latch start(kProducers);
+  std::vector<std::thread> producers;
+  for (int p = 0; p < kProducers; ++p) {
+    producers.emplace_back([&, p] {
+      start.arrive_and_wait();
+      std::vector<int> sequence(kQueues, 0);
+      for (int i = 0; i < kTasksPerProducer; ++i) {
+        const int q = (i * 7 + p) % kQueues;
+        const int n = sequence[q]++;
+        queues[q]->async([&, q, p, n] {
+          if (next[q][p] != n) ++outOfOrder[q];
+          next[q][p] = n + 1;
+        });
+      }
+    });
+  }
+  for (auto& producer : producers) producer.join();
+  int total = 0;
+  for (int q = 0; q < kQueues; ++q) {
+    queues[q]->sync([&] {
+      EXPECT_EQ(outOfOrder[q], 0) << "queue " << q;
+      for (int p = 0; p < kProducers; ++p) total += next[q][p];
+    });
+  }
+  EXPECT_EQ(total, kProducers * kTasksPerProducer);
+}
+
+TEST(GlobalQueueTest, RunsTasksConcurrentlyOnAtLeastTwoThreads) {
+  // Two tasks that each wait for the other can only finish when they run at
+  // the same time.
+  std::barrier meet(2);
+  std::promise<std::thread::id> a;
+  std::promise<std::thread::id> b;
+  globalQueue().async([&] {
+    meet.arrive_and_wait();
+    a.set_value(std::this_thread::get_id());
+  });
+  globalQueue().async([&] {
+    meet.arrive_and_wait();
+    b.set_value(std::this_thread::get_id());
+  });
+  EXPECT_NE(a.get_future().get(), b.get_future().get());
+}
+
+TEST(GlobalQueueTest, IsCurrentInsideItsTasksAndSyncRunsInline) {
+  std::promise<bool> inside;
+  globalQueue().async([&] {
+    inside.set_value(globalQueue().isCurrent() && DispatchQueue::current() == &globalQueue());
+  });
+  EXPECT_TRUE(inside.get_future().get());
+  EXPECT_FALSE(globalQueue().isCurrent());
+  bool ran = false;
+  globalQueue().sync([&] {
+    ran = globalQueue().isCurrent();
+    globalQueue().sync([&] {});  // allowed: a concurrent queue cannot deadlock
+  });
+  EXPECT_TRUE(ran);
+  EXPECT_EQ(&globalQueue(), &globalQueue());
+}
+
+class SerialQueueDeathTest : public ::testing::Test {
+ protected:
+  void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
+};
+
+TEST_F(SerialQueueDeathTest, SyncOntoTheQueueItselfAborts) {
+  EXPECT_DEATH(
+      {
+        SerialQueue queue("test.self");
+        queue.sync([&] { queue.sync([] {}); });
+      },
+      "sync called from the 'test.self' queue onto itself");
+}
+
+TEST_F(SerialQueueDeathTest, SyncBackOntoAnOuterQueueAborts) {
+  EXPECT_DEATH(
+      {
+        SerialQueue a("test.a");
+        SerialQueue b("test.b");
+        a.sync([&] { b.sync([&] { a.sync([] {}); }); });
+      },
+      "from the 'test.a' queue onto itself");
+}
+
+TEST_F(SerialQueueDeathTest, SyncFromTheWorkerThreadAborts) {
+  EXPECT_DEATH(
+      {
+        SerialQueue queue("test.worker");
+        queue.async([&] { queue.sync([] {}); });
+        queue.sync([] {});  // never returns: the process dies first
+        std::promise<void>().get_future().wait();
+      },
+      "test.worker");
+}
+
+#if defined(QUORVEL_DCHECK_IS_ON)
+TEST_F(SerialQueueDeathTest, QueueCheckAbortsOffTheQueueAndPassesOnIt) {
+  SerialQueue queue("test.checked");
+  queue.sync([&] { QV_DCHECK_ON_QUEUE(queue); });
+  SerialQueue other("test.other");
+  queue.sync([&] { other.sync([&] { QV_DCHECK_ON_QUEUE(queue); }); });
+  EXPECT_DEATH(QV_DCHECK_ON_QUEUE(queue), "must be called on the test.checked queue");
+  EXPECT_DEATH(other.sync([&] { QV_DCHECK_ON_QUEUE(queue); }),
+               "must be called on the test.checked queue");
+}
+#endif
+
+}  // namespace
+}  // namespace platform
