@@ -294,7 +294,10 @@ Bytes metaWithoutTitles(View buffer, const Child& meta) {
 
 platform::Result<Bytes> udtaWithTitle(View buffer, const Child* udta, const TitleEdit& edit) {
   Bytes payload;
-  std::optional<std::size_t> insertAt;
+  // The new entry takes the place of the one it replaces; a new language goes
+  // after the last title.
+  std::optional<std::size_t> replaceAt;
+  std::optional<std::size_t> afterLastTitle;
   View tailBytes;
   if (udta != nullptr) {
     auto children =
@@ -303,16 +306,18 @@ platform::Result<Bytes> udtaWithTitle(View buffer, const Child* udta, const Titl
     for (const Child& child : children->atoms) {
       View payloadView = child.payload(buffer);
       if (child.type == kTitleType && !isITunesStyle(payloadView)) {
-        if (!insertAt) insertAt = payload.size();
         // Every entry that stays gets an atom of its own: readers that only
         // look at an atom's first entry then still see each language.
         for (const TextEntry& entry : textEntries(payloadView)) {
-          if (!sameLanguage(entry.language, edit.language)) {
+          if (sameLanguage(entry.language, edit.language)) {
+            if (!replaceAt) replaceAt = payload.size();
+          } else {
             appendTitleAtom(payload, entry.code, entry.text);
           }
         }
+        afterLastTitle = payload.size();
       } else if (child.type == kTitleType && edit.language.empty()) {
-        if (!insertAt) insertAt = payload.size();
+        if (!replaceAt) replaceAt = payload.size();
       } else if (child.type == "meta" && edit.language.empty()) {
         Bytes meta = metaWithoutTitles(buffer, child);
         payload.insert(payload.end(), meta.begin(), meta.end());
@@ -327,8 +332,8 @@ platform::Result<Bytes> udtaWithTitle(View buffer, const Child* udta, const Titl
   appendTitleAtom(
       title, encodeLanguage(edit.language),
       View(reinterpret_cast<const std::uint8_t*>(edit.title.data()), edit.title.size()));
-  payload.insert(payload.begin() + std::ptrdiff_t(insertAt.value_or(payload.size())), title.begin(),
-                 title.end());
+  const std::size_t insertAt = replaceAt.value_or(afterLastTitle.value_or(payload.size()));
+  payload.insert(payload.begin() + std::ptrdiff_t(insertAt), title.begin(), title.end());
   payload.insert(payload.end(), tailBytes.begin(), tailBytes.end());
   Bytes out;
   appendAtom(out, "udta", payload);
