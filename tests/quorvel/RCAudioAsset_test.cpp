@@ -1,0 +1,252 @@
+// Audio assets over real files: durations per format, damaged and odd files
+// (no asset or a clear duration, never a crash, a hang or console chatter),
+// and the asynchronous metadata load with its exactly-once completion.
+#include "Quorvel/RCAudioAsset.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cmath>
+#include <condition_variable>
+#include <filesystem>
+#include <fstream>
+#include <future>
+#include <map>
+#include <mutex>
+#include <thread>
+
+#include "Quorvel/RCAssetMetadataLoader.h"
+#include "Quorvel/RCMP4Atoms.h"
+#include "platform/Log.h"
+#include "tests/support/AudioFixtures.h"
+
+namespace quorvel {
+
+void PrintTo(const RCMetadataItem& item, std::ostream* out) {
+  *out << '"' << item.stringValue << "\"@" << (item.language.empty() ? "-" : item.language);
+}
+
+namespace {
+
+namespace fs = std::filesystem;
+using testing::M4ALayout;
+using testing::writeTone;
+
+class RCAudioAssetTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    dir_ = fs::temp_directory_path() /
+           ("qv-asset-" + std::to_string(::getpid()) + "-" +
+            ::testing::UnitTest::GetInstance()->current_test_info()->name());
+    fs::create_directories(dir_);
+  }
+  void TearDown() override {
+    platform::setLogSinkForTesting(nullptr);
+    platform::setLogThreshold(6);
+    fs::remove_all(dir_);
+  }
+  std::string path(const std::string& name) const { return (dir_ / name).string(); }
+  platform::URL url(const std::string& name) const {
+    return platform::URL::fileURLWithPath(path(name));
+  }
+  static platform::Result<RCCommonMetadata> loadAsync(const RCAudioAsset& asset) {
+    std::promise<platform::Result<RCCommonMetadata>> promise;
+    auto future = promise.get_future();
+    asset.loadCommonMetadataAsync(
+        [&promise](platform::Result<RCCommonMetadata> result) { promise.set_value(result); });
+    return future.get();
+  }
+  fs::path dir_;
+};
+
+TEST_F(RCAudioAssetTest, DurationOfEveryCaptureFormat) {
+  struct Case {
+    std::string name, format;
+    M4ALayout layout;
+  };
+  for (const Case& c :
+       {Case{"a.m4a", "m4a", M4ALayout::MoovAtEnd}, Case{"b.m4a", "m4a", M4ALayout::MoovFirst},
+        Case{"c.flac", "flac", {}}, Case{"d.wav", "wav", {}}}) {
+    SCOPED_TRACE(c.name);
+    ASSERT_TRUE(writeTone(path(c.name), 2.5, c.format, 48000, 2, 440.0, 0.5, c.layout));
+    auto asset = RCAudioAsset::assetWithURL(url(c.name));
+    ASSERT_NE(asset, nullptr);
+    EXPECT_NEAR(asset->duration(), 2.5, 0.05);
+    EXPECT_EQ(asset->url(), url(c.name));
+  }
+}
+
+TEST_F(RCAudioAssetTest, BadFilesGiveNoAssetOrAClearDurationAndStayOffTheConsole) {
+  std::mutex mutex;
+  std::vector<std::string> lines;
+  platform::setLogThreshold(7);
+  platform::setLogSinkForTesting([&](int level, std::string_view text) {
+    std::lock_guard lock(mutex);
+    lines.push_back(std::to_string(level) + " " + std::string(text));
+  });
+
+  std::ofstream(path("empty.m4a")).flush();
+  std::ofstream(path("text.m4a")) << "Dear diary, today I recorded nothing.\n";
+  for (const char* format : {"m4a", "flac", "wav"}) {
+    const std::string name = std::string("cut.") + format;
+    ASSERT_TRUE(writeTone(path(name), 2.0, format));
+    fs::resize_file(path(name), fs::file_size(path(name)) * 2 / 3);
+  }
+  ASSERT_TRUE(
+      writeTone(path("cutfirst.m4a"), 2.0, "m4a", 44100, 1, 440, 0.5, M4ALayout::MoovFirst));
+  fs::resize_file(path("cutfirst.m4a"), fs::file_size(path("cutfirst.m4a")) / 2);
+  ASSERT_TRUE(writeTone(path("header.wav"), 1.0, "wav"));
+  fs::resize_file(path("header.wav"), 30);  // inside the header
+  ASSERT_EQ(::mkfifo(path("fifo.m4a").c_str(), 0600), 0);
+  const std::string video =
+      "ffmpeg -nostdin -hide_banner -loglevel error -y -f lavfi -i color=s=32x32:d=0.5 "
+      "-c:v mpeg4 -f mp4 '" +
+      path("video.m4a") + "'";
+  ASSERT_EQ(std::system(video.c_str()), 0);
+
+  // Nothing FFmpeg says may reach stderr: watch the descriptor itself.
+  fflush(stderr);
+  const int savedStderr = ::dup(2);
+  const std::string stderrPath = path("stderr.txt");
+  const int capture = ::open(stderrPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+  ::dup2(capture, 2);
+
+  std::map<std::string, std::shared_ptr<RCAudioAsset>> assets;
+  for (const char* name : {"empty.m4a", "text.m4a", "cut.m4a", "cut.flac", "cut.wav",
+                           "cutfirst.m4a", "header.wav", "fifo.m4a", "video.m4a", "missing.m4a"}) {
+    assets[name] = RCAudioAsset::assetWithURL(url(name));
+  }
+  assets["directory"] = RCAudioAsset::assetWithURL(platform::URL::fileURLWithPath(dir_.string()));
+
+  fflush(stderr);
+  ::dup2(savedStderr, 2);
+  ::close(savedStderr);
+  ::close(capture);
+  EXPECT_EQ(fs::file_size(stderrPath), 0u);
+
+  for (const char* none : {"empty.m4a", "text.m4a", "cut.m4a", "fifo.m4a", "video.m4a",
+                           "missing.m4a", "directory", "header.wav"}) {
+    EXPECT_EQ(assets[none], nullptr) << none;
+  }
+  // Cut-off files whose headers survive still play what is there.
+  for (const char* playable : {"cut.flac", "cut.wav", "cutfirst.m4a"}) {
+    ASSERT_NE(assets[playable], nullptr) << playable;
+    const double duration = assets[playable]->duration();
+    EXPECT_TRUE(std::isnan(duration) || (duration >= 0.0 && duration <= 2.1))
+        << playable << " " << duration;
+  }
+  std::lock_guard lock(mutex);
+  const bool ffmpegSpoke = std::any_of(lines.begin(), lines.end(), [](const std::string& line) {
+    return line.starts_with("7 [RCFFmpegLogging] ffmpeg: ");
+  });
+  EXPECT_TRUE(ffmpegSpoke) << "FFmpeg's complaints go to the log at level 7";
+}
+
+TEST_F(RCAudioAssetTest, TitleItemsAreTheFilesOwn) {
+  // m4a: one tagged title only, then two languages and an untagged one.
+  ASSERT_TRUE(writeTone(path("one.m4a"), 0.5, "m4a"));
+  ASSERT_TRUE(RCMP4WriteTitle(path("one.m4a"), "Bonjour", "fra"));
+  auto asset = RCAudioAsset::assetWithURL(url("one.m4a"));
+  ASSERT_NE(asset, nullptr);
+  auto metadata = loadAsync(*asset);
+  ASSERT_TRUE(metadata) << metadata.error();
+  EXPECT_EQ(metadata->titleItems, (std::vector<RCMetadataItem>{{"Bonjour", "fra"}}));
+
+  testing::ToneSpec spec;
+  spec.seconds = 0.5;
+  spec.metadata = {{"title", "Plain"}, {"creation_time", "2021-06-07T08:09:10.000000Z"}};
+  ASSERT_TRUE(writeTone(path("many.m4a"), spec));
+  ASSERT_TRUE(RCMP4WriteTitle(path("many.m4a"), "Hallo", "ger"));
+  ASSERT_TRUE(RCMP4WriteTitle(path("many.m4a"), "Hello", "eng"));
+  asset = RCAudioAsset::assetWithURL(url("many.m4a"));
+  ASSERT_NE(asset, nullptr);
+  metadata = loadAsync(*asset);
+  ASSERT_TRUE(metadata);
+  EXPECT_EQ(metadata->titleItems.size(), 3u);
+  EXPECT_EQ(RCMetadataItemsWithLocale(metadata->titleItems, "de-CH"),
+            (std::vector<RCMetadataItem>{{"Hallo", "deu"}}));
+  ASSERT_TRUE(metadata->creationDate);
+  EXPECT_EQ(metadata->creationDate->ISO8601String(), "2021-06-07T08:09:10.000Z");
+
+  // FLAC keeps whatever keys it is given; the CLI writes them as comments.
+  const std::string command =
+      "ffmpeg -nostdin -hide_banner -loglevel error -y -f lavfi -i sine=d=0.3 "
+      "-metadata title-deu=Hallo -metadata title-ger=Servus -metadata TITLE=Plain '" +
+      path("cli.flac") + "'";
+  ASSERT_EQ(std::system(command.c_str()), 0);
+  asset = RCAudioAsset::assetWithURL(url("cli.flac"));
+  ASSERT_NE(asset, nullptr);
+  metadata = asset->loadCommonMetadata();
+  ASSERT_TRUE(metadata);
+  EXPECT_EQ(metadata->titleItems.size(), 3u);
+  EXPECT_EQ(RCMetadataItemsWithLocale(metadata->titleItems, "de").size(), 2u);
+  EXPECT_FALSE(metadata->creationDate);
+
+  // No metadata at all.
+  ASSERT_TRUE(writeTone(path("bare.wav"), 0.3, "wav"));
+  asset = RCAudioAsset::assetWithURL(url("bare.wav"));
+  ASSERT_NE(asset, nullptr);
+  metadata = loadAsync(*asset);
+  ASSERT_TRUE(metadata);
+  EXPECT_TRUE(metadata->titleItems.empty());
+  EXPECT_FALSE(metadata->creationDate);
+}
+
+TEST_F(RCAudioAssetTest, AVanishedFileFailsTheLoadOnceAndOffTheCallersThread) {
+  ASSERT_TRUE(writeTone(path("gone.m4a"), 0.3, "m4a"));
+  auto asset = RCAudioAsset::assetWithURL(url("gone.m4a"));
+  ASSERT_NE(asset, nullptr);
+  fs::remove(path("gone.m4a"));
+  std::promise<std::pair<bool, std::thread::id>> promise;
+  asset->loadCommonMetadataAsync([&promise](platform::Result<RCCommonMetadata> result) {
+    promise.set_value({result.has_value(), std::this_thread::get_id()});
+  });
+  asset.reset();  // the load does not need the asset any more
+  auto [succeeded, thread] = promise.get_future().get();
+  EXPECT_FALSE(succeeded);
+  EXPECT_NE(thread, std::this_thread::get_id());
+}
+
+TEST_F(RCAudioAssetTest, ManyConcurrentLoadsEachCompleteExactlyOnce) {
+  ASSERT_TRUE(writeTone(path("a.m4a"), 0.2, "m4a"));
+  ASSERT_TRUE(RCMP4WriteTitle(path("a.m4a"), "A", "eng"));
+  ASSERT_TRUE(writeTone(path("b.flac"), 0.2, "flac"));
+  auto a = RCAudioAsset::assetWithURL(url("a.m4a"));
+  auto b = RCAudioAsset::assetWithURL(url("b.flac"));
+  ASSERT_TRUE(a && b);
+
+  constexpr int kThreads = 4, kPerThread = 50;
+  std::vector<std::atomic<int>> calls(kThreads * kPerThread);
+  std::atomic<int> done{0}, failures{0};
+  std::mutex mutex;
+  std::condition_variable allDone;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < kPerThread; ++i) {
+        const int index = t * kPerThread + i;
+        const RCAudioAsset& asset = (index % 2) ? *a : *b;
+        asset.loadCommonMetadataAsync([&, index](platform::Result<RCCommonMetadata> result) {
+          if (!result || (index % 2 && result->titleItems.size() != 1)) ++failures;
+          EXPECT_TRUE(RCAssetMetadataLoader::shared().isCurrent());
+          calls[index].fetch_add(1);
+          if (done.fetch_add(1) + 1 == kThreads * kPerThread) {
+            std::lock_guard lock(mutex);
+            allDone.notify_all();
+          }
+        });
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  std::unique_lock lock(mutex);
+  allDone.wait(lock, [&] { return done.load() == kThreads * kPerThread; });
+  EXPECT_EQ(failures.load(), 0);
+  for (auto& count : calls) EXPECT_EQ(count.load(), 1);
+}
+
+}  // namespace
+}  // namespace quorvel
