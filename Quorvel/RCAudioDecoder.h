@@ -1,0 +1,66 @@
+// RCAudioDecoder: the first audio stream of a file, read packet by packet
+// (libavformat) and, when asked, decoded (libavcodec, one thread).
+//
+// Owned by one user and used on one thread at a time; not synchronized.
+// Every failure is an Error in kRCMediaErrorDomain: CannotOpen for a missing,
+// unreadable or unrecognised file, NoAudioStream, DecodeFailed.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+
+#include "platform/Error.h"
+#include "platform/URL.h"
+
+struct AVCodecContext;
+struct AVCodecParameters;
+struct AVFormatContext;
+struct AVFrame;
+struct AVPacket;
+struct AVStream;
+
+namespace quorvel {
+
+class RCAudioDecoder {
+ public:
+  // Opens `url` and finds its audio stream. The stream's parameters are
+  // probed by decoding a little only when the header leaves them incomplete.
+  static platform::Result<std::unique_ptr<RCAudioDecoder>> open(const platform::URL& url);
+  ~RCAudioDecoder();
+  RCAudioDecoder(const RCAudioDecoder&) = delete;
+  RCAudioDecoder& operator=(const RCAudioDecoder&) = delete;
+
+  const platform::URL& url() const { return url_; }
+  AVFormatContext* formatContext() const { return format_; }
+  AVStream* stream() const { return stream_; }
+  const AVCodecParameters* codecParameters() const;
+  // The duration the container declares for the stream (or the file), in
+  // seconds; 0 when it declares none.
+  double declaredDurationSeconds() const;
+
+  // Reads the next packet of the audio stream into `packet` (other streams'
+  // packets are skipped). Returns false at the end of the file.
+  platform::Result<bool> readPacket(AVPacket* packet);
+
+  // Opens the codec (once). Needed before decode().
+  platform::Status openCodec();
+  AVCodecContext* codecContext() const { return codec_; }
+  using FrameHandler = std::function<platform::Status(AVFrame* frame)>;
+  // Sends `packet` (nullptr: drain at the end) and hands every frame the
+  // codec returns to `handler`, whose failure stops and is returned.
+  platform::Status decode(const AVPacket* packet, const FrameHandler& handler);
+  // Reads and decodes the whole stream from where it stands, then drains.
+  platform::Status decodeAll(const FrameHandler& handler);
+
+ private:
+  RCAudioDecoder(platform::URL url, AVFormatContext* format, AVStream* stream);
+  platform::URL url_;
+  AVFormatContext* format_ = nullptr;
+  AVStream* stream_ = nullptr;
+  AVCodecContext* codec_ = nullptr;
+  AVFrame* frame_ = nullptr;
+  bool draining_ = false;
+};
+
+}  // namespace quorvel

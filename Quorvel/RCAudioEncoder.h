@@ -1,0 +1,67 @@
+// RCAudioEncoder: encodes PCM audio into a new file (libavcodec +
+// RCAudioOutput). The codec follows the container the extension names: AAC
+// for m4a, FLAC for flac, PCM for wav; rate, channels, bit depth and (for
+// AAC) bit rate follow a model stream, normally the first fragment's.
+//
+// Owned by one user and used on one thread at a time; not synchronized.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/Error.h"
+
+extern "C" {
+#include <libavutil/channel_layout.h>
+#include <libavutil/samplefmt.h>
+}
+
+struct AVAudioFifo;
+struct AVCodecContext;
+struct AVCodecParameters;
+struct AVFrame;
+struct AVPacket;
+
+namespace quorvel {
+
+class RCAudioOutput;
+
+class RCAudioEncoder {
+ public:
+  static platform::Result<std::unique_ptr<RCAudioEncoder>> open(const std::string& path,
+                                                                std::string_view extension,
+                                                                const AVCodecParameters* model);
+  ~RCAudioEncoder();
+  RCAudioEncoder(const RCAudioEncoder&) = delete;
+  RCAudioEncoder& operator=(const RCAudioEncoder&) = delete;
+
+  // What write() takes.
+  AVSampleFormat sampleFormat() const;
+  int sampleRate() const;
+  const AVChannelLayout& channelLayout() const;
+
+  // Adds `count` frames in sampleFormat()'s layout (planes or one interleaved plane).
+  platform::Status write(const std::uint8_t* const* data, int count);
+  // Encodes what is buffered, drains the codec and finishes the file.
+  platform::Status finish();
+  // Frames written so far.
+  std::int64_t framesWritten() const { return framesIn_; }
+
+ private:
+  RCAudioEncoder() = default;
+  platform::Status encodeFromFifo(bool final);
+  platform::Status encodeFrame(AVFrame* frame);
+
+  AVCodecContext* codec_ = nullptr;
+  std::unique_ptr<RCAudioOutput> output_;
+  AVAudioFifo* fifo_ = nullptr;
+  AVFrame* frame_ = nullptr;
+  AVPacket* packet_ = nullptr;
+  int frameSize_ = 0;
+  std::int64_t framesIn_ = 0;
+  std::int64_t nextPts_ = 0;
+};
+
+}  // namespace quorvel

@@ -1,0 +1,44 @@
+// The composer: joins the used ranges of a recording's fragment files into
+// its one composed audio file, and optionally writes the composed waveform.
+//
+// When every fragment is AAC with identical codec parameters and the target
+// is m4a, the packets are copied (no generation loss) with continuous
+// timestamps; before each fragment's first used packet the packet that
+// precedes it is copied too, so the decoder's overlap starts from that
+// fragment's own audio and the join does not click. Otherwise (mixed formats,
+// lossless or PCM targets) the audio is decoded, trimmed to the sample,
+// converted to the first fragment's rate and channels and encoded in the
+// target's codec.
+//
+// The output is written to a hidden temporary file beside the destination,
+// flushed to disk and renamed over it: a crash leaves the old file or the new
+// one; on failure the temporary file is removed and the destination is left
+// as it was.
+//
+// RCComposeAudio blocks while it works; it may run on any thread, and calls
+// on distinct destinations may run at the same time.
+#pragma once
+
+#include <optional>
+#include <vector>
+
+#include "platform/Error.h"
+#include "platform/URL.h"
+
+namespace quorvel {
+
+struct RCComposerSegment {
+  platform::URL fragmentURL;
+  double contentStart;     // seconds into the fragment's own audio
+  double contentDuration;  // seconds of it used
+};
+
+// Concatenates the segments' used ranges, in order, into `destination` (its
+// extension picks the container: m4a, flac or wav). Writes the composed
+// waveform to `waveformDestination` when given. Never leaves a half file.
+// Errors are in kRCMediaErrorDomain (or POSIX for file system failures).
+platform::Status RCComposeAudio(
+    const std::vector<RCComposerSegment>& segments, const platform::URL& destination,
+    const std::optional<platform::URL>& waveformDestination = std::nullopt);
+
+}  // namespace quorvel
