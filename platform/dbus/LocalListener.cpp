@@ -1,0 +1,164 @@
+#include "platform/dbus/LocalListener.h"
+
+#include <fmt/format.h>
+
+namespace platform {
+namespace {
+
+class LocalResponder final : public IncomingCall::Responder {
+ public:
+  explicit LocalResponder(std::shared_ptr<LocalReply> reply) : reply_(std::move(reply)) {}
+  void sendReply(const BusValues& values) override { reply_->record(false, values, {}, {}); }
+  void sendError(const std::string& errorName, const std::string& message) override {
+    reply_->record(true, {}, errorName, message);
+  }
+
+ private:
+  std::shared_ptr<LocalReply> reply_;
+};
+
+}  // namespace
+
+bool LocalReply::isAnswered() const {
+  std::lock_guard lock(mutex_);
+  return count_ > 0;
+}
+
+bool LocalReply::waitFor(std::chrono::milliseconds timeout) const {
+  std::unique_lock lock(mutex_);
+  return answered_.wait_for(lock, timeout, [this] { return count_ > 0; });
+}
+
+int LocalReply::answerCount() const {
+  std::lock_guard lock(mutex_);
+  return count_;
+}
+
+bool LocalReply::isError() const {
+  std::lock_guard lock(mutex_);
+  return isError_;
+}
+
+std::string LocalReply::errorName() const {
+  std::lock_guard lock(mutex_);
+  return errorName_;
+}
+
+std::string LocalReply::errorMessage() const {
+  std::lock_guard lock(mutex_);
+  return errorMessage_;
+}
+
+BusValues LocalReply::values() const {
+  std::lock_guard lock(mutex_);
+  return values_;
+}
+
+void LocalReply::record(bool isError, BusValues values, std::string errorName,
+                        std::string message) {
+  {
+    std::lock_guard lock(mutex_);
+    if (count_++ == 0) {
+      isError_ = isError;
+      values_ = std::move(values);
+      errorName_ = std::move(errorName);
+      errorMessage_ = std::move(message);
+    }
+  }
+  answered_.notify_all();
+}
+
+LocalListener::LocalListener(InterfaceDescription interface) : Listener(std::move(interface)) {}
+
+LocalListener::~LocalListener() { stop(); }
+
+Status LocalListener::resume() {
+  if (auto valid = validateInterface(); !valid) return valid;
+  std::lock_guard lock(stateMutex_);
+  resumed_ = true;
+  return {};
+}
+
+void LocalListener::emitSignal(const std::string& name, const BusValues& arguments) {
+  std::lock_guard lock(stateMutex_);
+  signals_.emplace_back(name, arguments);
+}
+
+Status LocalListener::releaseName() {
+  std::lock_guard lock(stateMutex_);
+  nameReleased_ = true;
+  return {};
+}
+
+void LocalListener::stop() {
+  std::lock_guard delivery(deliveryMutex_);
+  {
+    std::lock_guard lock(stateMutex_);
+    if (stopped_) return;
+    stopped_ = true;
+  }
+  forgetConnections();
+}
+
+std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
+                                                   const std::string& member, BusValues arguments,
+                                                   bool noReplyExpected) {
+  auto reply = std::make_shared<LocalReply>();
+  auto responder = std::make_unique<LocalResponder>(reply);
+  std::lock_guard delivery(deliveryMutex_);
+  {
+    std::lock_guard lock(stateMutex_);
+    if (!resumed_ || stopped_ || nameReleased_) {
+      if (!noReplyExpected) responder->sendError(kBusErrorServiceUnknown, "no listener");
+      return reply;
+    }
+  }
+  const MethodSpec* spec = method(member);
+  if (!spec) {
+    if (!noReplyExpected) {
+      responder->sendError(
+          kBusErrorUnknownMethod,
+          fmt::format("Unknown method {} or interface {}.", member, interfaceDescription().name));
+    }
+    return reply;
+  }
+  std::string signature = signatureOf(arguments);
+  if (signature != spec->inputSignature) {
+    if (!noReplyExpected) {
+      responder->sendError(
+          kBusErrorInvalidArgs,
+          fmt::format("Invalid arguments '{}' to call {}.{}(), expecting '{}'.", signature,
+                      interfaceDescription().name, member, spec->inputSignature));
+    }
+    return reply;
+  }
+  dispatch(sender, *spec, std::move(arguments), noReplyExpected, std::move(responder));
+  return reply;
+}
+
+void LocalListener::vanish(const std::string& sender) {
+  std::lock_guard delivery(deliveryMutex_);
+  peerVanished(sender);
+}
+
+void LocalListener::loseBus() {
+  std::lock_guard delivery(deliveryMutex_);
+  busLost();
+}
+
+std::vector<std::pair<std::string, BusValues>> LocalListener::emittedSignals() const {
+  std::lock_guard lock(stateMutex_);
+  return signals_;
+}
+
+bool LocalListener::isNameReleased() const {
+  std::lock_guard lock(stateMutex_);
+  return nameReleased_;
+}
+
+bool LocalListener::isStopped() const {
+  std::lock_guard lock(stateMutex_);
+  return stopped_;
+}
+
+}  // namespace platform

@@ -1,0 +1,88 @@
+// LocalListener: an in-process Listener for tests of the service core. No
+// bus: a test names peers (":1.1", ":1.2"...), delivers their calls with
+// deliver(), and ends them with vanish() (invalidation) or loseBus()
+// (interruption of every connection). Deliveries behave as on the bus: the
+// member and argument signature are checked (UnknownMethod, InvalidArgs),
+// the delegate is asked about a peer's first call, the call runs on the
+// calling thread with Connection::current() set, and its answer lands in a
+// LocalReply that the test can wait on.
+//
+// Threads: any; deliveries, vanish() and loseBus() are serialized (one at a
+// time, like the bus thread). Owned by the test.
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/dbus/Listener.h"
+
+namespace platform {
+
+// The answer to one delivered call. Filled from whichever thread answers.
+class LocalReply {
+ public:
+  // Whether an answer (reply or error) has arrived.
+  bool isAnswered() const;
+  // Blocks until answered. Returns false if `timeout` passes first.
+  bool waitFor(std::chrono::milliseconds timeout) const;
+  // How many answers arrived (more than one is a transport bug).
+  int answerCount() const;
+  bool isError() const;
+  std::string errorName() const;
+  std::string errorMessage() const;
+  BusValues values() const;
+
+  // Used by the listener's responder.
+  void record(bool isError, BusValues values, std::string errorName, std::string message);
+
+ private:
+  mutable std::mutex mutex_;
+  mutable std::condition_variable answered_;
+  int count_ = 0;
+  bool isError_ = false;
+  BusValues values_;
+  std::string errorName_;
+  std::string errorMessage_;
+};
+
+class LocalListener final : public Listener {
+ public:
+  explicit LocalListener(InterfaceDescription interface);
+  ~LocalListener() override;
+
+  // Validates the interface and starts accepting deliveries.
+  Status resume() override;
+  // Records the signal (see emittedSignals()).
+  void emitSignal(const std::string& name, const BusValues& arguments = {}) override;
+  Status releaseName() override;
+  void stop() override;
+
+  // Delivers a call of `member` with `arguments` from peer `sender` and
+  // returns where its answer will land. A listener that is not resumed, or
+  // is stopped, answers ServiceUnknown.
+  std::shared_ptr<LocalReply> deliver(const std::string& sender, const std::string& member,
+                                      BusValues arguments = {}, bool noReplyExpected = false);
+  // The peer `sender` has left: its connection is invalidated.
+  void vanish(const std::string& sender);
+  // The bus is gone: every connection is interrupted.
+  void loseBus();
+
+  std::vector<std::pair<std::string, BusValues>> emittedSignals() const;
+  bool isNameReleased() const;
+  bool isStopped() const;
+
+ private:
+  mutable std::recursive_mutex deliveryMutex_;  // one delivery at a time
+  mutable std::mutex stateMutex_;               // guards the fields below
+  bool resumed_ = false;
+  bool nameReleased_ = false;
+  bool stopped_ = false;
+  std::vector<std::pair<std::string, BusValues>> signals_;
+};
+
+}  // namespace platform
