@@ -55,6 +55,12 @@ void RCFileInputWaveformDataSource::load() {
   auto status = generate();
   if (!status) {
     if (wroteFile_) ::unlink(waveformURL_.path().c_str());
+  }
+  if (!status && cancelled_) {
+    QV_LOG(platform::kLogLevelDebug, "Stopped computing the waveform of {}",
+           avURL_.lastPathComponent());
+    error_ = status.error();
+  } else if (!status) {
     QV_LOG(platform::kLogLevelError, "ERROR: Computing the waveform of {} failed: {}",
            avURL_.lastPathComponent(), status.error());
     error_ = status.error();
