@@ -240,8 +240,10 @@ class StreamCopier {
   platform::Status decodeForWaveform(const AVPacket* packet, bool last) {
     PacketPtr copy = makePacket();
     if (av_packet_ref(copy.get(), packet) < 0) throw std::bad_alloc();
-    // The output's timeline decides what is heard, not the fragment's trims.
+    // The output's timeline decides what is heard, not the fragment's trims
+    // (its skip side data, its priming packets marked for discarding).
     av_packet_free_side_data(copy.get());
+    copy->flags &= ~AV_PKT_FLAG_DISCARD;
     const std::int64_t limit = last ? endPts_ : std::numeric_limits<std::int64_t>::max();
     int result = avcodec_send_packet(waveformDecoder_, copy.get());
     if (last && result >= 0) result = avcodec_send_packet(waveformDecoder_, nullptr);
