@@ -117,6 +117,16 @@ void appendAtom(Bytes& out, std::string_view type, View payload) {
   out.insert(out.end(), payload.begin(), payload.end());
 }
 
+// Copies a child atom as it is, except that a size of 0 ("up to the end of
+// the parent") becomes the real size: whatever follows it in the new parent
+// must not be swallowed.
+void appendChild(Bytes& out, View buffer, const Child& child) {
+  View whole = child.whole(buffer);
+  const std::size_t at = out.size();
+  out.insert(out.end(), whole.begin(), whole.end());
+  if (be32(&out[at]) == 0) storeBE32(&out[at], std::uint32_t(child.size));
+}
+
 // Macintosh language codes that QuickTime used before ISO codes.
 constexpr std::array<const char*, 33> kMacLanguages = {
     "eng", "fra", "deu", "ita", "nld", "swe", "spa", "dan", "por", "nor", "heb",
@@ -255,8 +265,7 @@ Bytes ilstWithoutTitles(View buffer, const Child& ilst) {
   if (items) {
     for (const Child& item : items->atoms) {
       if (item.type != kTitleType) {
-        View whole = item.whole(buffer);
-        payload.insert(payload.end(), whole.begin(), whole.end());
+        appendChild(payload, buffer, item);
       }
     }
     tail = items->tail;
@@ -280,8 +289,7 @@ Bytes metaWithoutTitles(View buffer, const Child& meta) {
         Bytes ilst = ilstWithoutTitles(buffer, child);
         payload.insert(payload.end(), ilst.begin(), ilst.end());
       } else {
-        View whole = child.whole(buffer);
-        payload.insert(payload.end(), whole.begin(), whole.end());
+        appendChild(payload, buffer, child);
       }
     }
     tail = children->tail;
@@ -322,8 +330,7 @@ platform::Result<Bytes> udtaWithTitle(View buffer, const Child* udta, const Titl
         Bytes meta = metaWithoutTitles(buffer, child);
         payload.insert(payload.end(), meta.begin(), meta.end());
       } else {
-        View whole = child.whole(buffer);
-        payload.insert(payload.end(), whole.begin(), whole.end());
+        appendChild(payload, buffer, child);
       }
     }
     tailBytes = buffer.subspan(children->tail, udta->offset + udta->size - children->tail);
@@ -585,8 +592,7 @@ platform::Result<std::vector<std::uint8_t>> RCMP4MovieWithTitle(View movieAtom,
       Bytes meta = metaWithoutTitles(movieAtom, child);
       payload.insert(payload.end(), meta.begin(), meta.end());
     } else {
-      View whole = child.whole(movieAtom);
-      payload.insert(payload.end(), whole.begin(), whole.end());
+      appendChild(payload, movieAtom, child);
     }
   }
   if (!wroteTitle) {
