@@ -18,6 +18,7 @@ using std::unexpected;
 #else
 
 #include <cstdlib>
+#include <optional>
 #include <type_traits>
 #include <utility>
 #include <variant>
@@ -88,20 +89,20 @@ class expected<void, E> {
 
   expected() = default;
   template <class G>
-  expected(unexpected<G> error) : error_(std::move(error).error()), has_error_(true) {}
+  expected(unexpected<G> error) : error_(std::move(error).error()) {}
 
-  bool has_value() const { return !has_error_; }
+  bool has_value() const { return !error_.has_value(); }
   explicit operator bool() const { return has_value(); }
   void value() const {
-    if (has_error_) std::abort();
+    if (error_) std::abort();
   }
-  const E& error() const& { return error_; }
-  E& error() & { return error_; }
-  E&& error() && { return std::move(error_); }
+  const E& error() const& { return *error_; }
+  E& error() & { return *error_; }
+  E&& error() && { return std::move(*error_); }
 
  private:
-  E error_{};
-  bool has_error_ = false;
+  // Optional so that E needs no default constructor (platform::Error has none).
+  std::optional<E> error_;
 };
 
 }  // namespace platform
