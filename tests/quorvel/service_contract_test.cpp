@@ -1,0 +1,224 @@
+// The wire contract: error values to D-Bus error replies and back, access
+// tokens through their (siss) tuple, and the interface XML agreeing with the
+// constants the daemon and clients are built from.
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <sstream>
+
+#include "Quorvel/RCError.h"
+#include "Quorvel/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/RCSSavedRecordingServiceConstants.h"
+#include "Quorvel/RCSSavedRecordingServiceErrors.h"
+
+namespace quorvel {
+namespace {
+
+TEST(ServiceErrorsTest, EveryServiceCodeTravelsUnderItsOwnNameAndComesBack) {
+  struct Case {
+    RCSSavedRecordingServiceErrorCode code;
+    const char* name;
+  };
+  for (Case c : {Case{RCSSavedRecordingServiceErrorMissingCompositionAVURL,
+                      "org.quorvel.SavedRecordingService.Error.MissingCompositionAVURL"},
+                 Case{RCSSavedRecordingServiceErrorConflictingSession,
+                      "org.quorvel.SavedRecordingService.Error.ConflictingSession"},
+                 Case{RCSSavedRecordingServiceErrorDeferredRequestSuperseded,
+                      "org.quorvel.SavedRecordingService.Error.DeferredRequestSuperseded"},
+                 Case{RCSSavedRecordingServiceErrorCompositionFailed,
+                      "org.quorvel.SavedRecordingService.Error.CompositionFailed"}}) {
+    platform::Error error = RCSSavedRecordingServiceError(c.code);
+    EXPECT_EQ(error.domain(), "org.quorvel.SavedRecordingService.ErrorDomain");
+    RCSDBusError reply = RCSDBusErrorFromError(error);
+    EXPECT_EQ(reply.name, c.name);
+    EXPECT_NE(reply.message.find("org.quorvel.SavedRecordingService.ErrorDomain"),
+              std::string::npos);
+    EXPECT_NE(reply.message.find(std::to_string(c.code)), std::string::npos);
+    platform::Error back = RCSErrorFromDBusError(reply.name, reply.message);
+    EXPECT_EQ(back.domain(), error.domain());
+    EXPECT_EQ(back.code(), c.code);
+    EXPECT_EQ(back.underlyingError(), nullptr);
+    // A client that only has the name still gets the code.
+    EXPECT_EQ(RCSErrorFromDBusError(reply.name, "").code(), c.code);
+  }
+}
+
+TEST(ServiceErrorsTest, OtherErrorsAreGenericButKeepDomainCodeTextAndUnderlyingChain) {
+  platform::Error failed =
+      RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorCompositionFailed);
+  platform::Error generic = RCGenericErrorWithUnderlyingError(failed);
+  ASSERT_NE(generic.underlyingError(), nullptr);
+  EXPECT_EQ(generic.underlyingError()->code(), 401);
+
+  RCSDBusError reply = RCSDBusErrorFromError(generic);
+  EXPECT_EQ(reply.name, "org.quorvel.Error.Generic");
+  platform::Error back = RCSErrorFromDBusError(reply.name, reply.message);
+  EXPECT_EQ(back.domain(), RCErrorDomain);
+  EXPECT_EQ(back.code(), RCErrorCodeGeneric);
+  EXPECT_EQ(back.localizedDescription(), generic.localizedDescription());
+  ASSERT_NE(back.underlyingError(), nullptr);
+  EXPECT_EQ(*back.underlyingError(), failed);
+
+  // An unknown code of the service domain, and text with quotes and markers.
+  platform::Error odd(RCSSavedRecordingServiceErrorDomain, 999, "say \"hi\" Code=3");
+  reply = RCSDBusErrorFromError(odd);
+  EXPECT_EQ(reply.name, "org.quorvel.Error.Generic");
+  back = RCSErrorFromDBusError(reply.name, reply.message);
+  EXPECT_EQ(back, odd);
+  EXPECT_EQ(back.localizedDescription(), "say \"hi\" Code=3");
+
+  platform::Error posix = platform::posixError(ENOENT, "open x");
+  back = RCSErrorFromDBusError("org.quorvel.Error.Generic", RCSDBusErrorFromError(posix).message);
+  EXPECT_EQ(back.domain(), platform::kPOSIXErrorDomain);
+  EXPECT_EQ(back.code(), ENOENT);
+}
+
+TEST(ServiceErrorsTest, RepliesFromOtherSendersBecomeErrorsNamedAfterThem) {
+  platform::Error noReply =
+      RCSErrorFromDBusError("org.freedesktop.DBus.Error.NoReply", "Did not receive a reply");
+  EXPECT_EQ(noReply.domain(), "org.freedesktop.DBus.Error.NoReply");
+  EXPECT_EQ(noReply.localizedDescription(), "Did not receive a reply");
+  platform::Error generic = RCSErrorFromDBusError("org.quorvel.Error.Generic", "garbled");
+  EXPECT_EQ(generic.domain(), RCErrorDomain);
+  EXPECT_EQ(generic.code(), RCErrorCodeGeneric);
+  // Half a description: domain without code is not taken for one.
+  EXPECT_EQ(RCSErrorFromDBusError("x.y", "Error Domain=abc").domain(), "x.y");
+  EXPECT_EQ(RCSErrorFromDBusError("x.y", "Error Domain=abc Code=").domain(), "x.y");
+}
+
+TEST(AccessTokenTest, TupleRoundTripComparesEqualAndSeparateTokensNever) {
+  platform::URL url = platform::URL::fileURLWithPath("/r/My Walk #1.m4a");
+  auto kept = RCSSavedRecordingAccessToken::tokenWithName("preview", 1, url);
+  auto tuple = kept.toTuple();
+  EXPECT_EQ(std::get<0>(tuple), "preview");
+  EXPECT_EQ(std::get<1>(tuple), 1);
+  EXPECT_EQ(std::get<2>(tuple), url.absoluteString());
+  auto back = RCSSavedRecordingAccessToken::fromTuple(tuple);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back, kept);
+  // Clients may hand the identifier back in lower case.
+  std::string lower = std::get<3>(tuple);
+  for (char& c : lower) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+  std::get<3>(tuple) = lower;
+  EXPECT_EQ(*RCSSavedRecordingAccessToken::fromTuple(tuple), kept);
+
+  // Two shared sessions of one name on one recording hold different tokens.
+  auto other = RCSSavedRecordingAccessToken::tokenWithName("preview", 1, url);
+  EXPECT_NE(other, kept);
+  // Every field takes part in equality.
+  auto changed = kept.toTuple();
+  std::get<0>(changed) = "export";
+  EXPECT_NE(*RCSSavedRecordingAccessToken::fromTuple(changed), kept);
+  changed = kept.toTuple();
+  std::get<1>(changed) = 2;
+  EXPECT_NE(*RCSSavedRecordingAccessToken::fromTuple(changed), kept);
+  changed = kept.toTuple();
+  std::get<2>(changed) = "file:///r/Other.m4a";
+  EXPECT_NE(*RCSSavedRecordingAccessToken::fromTuple(changed), kept);
+}
+
+TEST(AccessTokenTest, NoTokenAndMalformedTuplesAreNoToken) {
+  EXPECT_FALSE(
+      RCSSavedRecordingAccessToken::fromTuple(RCSSavedRecordingAccessToken::noTokenTuple()));
+  EXPECT_EQ(RCSSavedRecordingAccessToken::noTokenTuple(),
+            (RCSSavedRecordingAccessToken::Tuple{"", 0, "", ""}));
+  auto good = RCSSavedRecordingAccessToken::tokenWithName(
+                  "capture", 2, platform::URL::fileURLWithPath("/r/a.m4a"))
+                  .toTuple();
+  auto bad = good;
+  std::get<3>(bad) = "not-a-uuid";
+  EXPECT_FALSE(RCSSavedRecordingAccessToken::fromTuple(bad));
+  bad = good;
+  std::get<2>(bad) = "http://example.com/a.m4a";
+  EXPECT_FALSE(RCSSavedRecordingAccessToken::fromTuple(bad));
+  // A token without a URL is still a token, just for no recording.
+  bad = good;
+  std::get<2>(bad) = "";
+  auto noURL = RCSSavedRecordingAccessToken::fromTuple(bad);
+  ASSERT_TRUE(noURL);
+  EXPECT_FALSE(noURL->compositionAVURL());
+}
+
+TEST(AccessTokenTest, DebugDescriptionNamesEveryField) {
+  auto token = RCSSavedRecordingAccessToken::tokenWithName(
+      "trimming", 2, platform::URL::fileURLWithPath("/r/a b.m4a"));
+  std::string text = token.debugDescription();
+  for (const std::string& part :
+       {std::string("trimming"), std::string("exclusive"), std::string("file:///r/a%20b.m4a"),
+        token.identifier().string()}) {
+    EXPECT_NE(text.find(part), std::string::npos) << text;
+  }
+}
+
+std::string readInterfaceXML() {
+  std::ifstream in(std::string(QUORVEL_SOURCE_DIR) +
+                   "/packaging/org.quorvel.SavedRecordingService1.xml");
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+// The method's element, from "<method name=..." to its end.
+std::string methodElement(const std::string& xml, const std::string& name) {
+  std::size_t start = xml.find("<method name=\"" + name + "\"");
+  if (start == std::string::npos) return {};
+  std::size_t selfClosed = xml.find("/>", start);
+  std::size_t open = xml.find('>', start);
+  if (selfClosed != std::string::npos && selfClosed + 1 == open) {
+    return xml.substr(start, selfClosed + 2 - start);
+  }
+  return xml.substr(start, xml.find("</method>", start) - start);
+}
+
+TEST(InterfaceXMLTest, DeclaresEveryMethodErrorAndTheSignalOfTheConstants) {
+  std::string xml = readInterfaceXML();
+  ASSERT_FALSE(xml.empty());
+  EXPECT_NE(xml.find(std::string("<interface name=\"") + RCSSavedRecordingServiceInterfaceName),
+            std::string::npos);
+  EXPECT_NE(
+      xml.find(std::string("<signal name=\"") +
+               RCSavedRecordingServiceDidChangeExportingCompositionAVURLsDistributedNotification),
+      std::string::npos);
+  EXPECT_NE(xml.find(RCSSavedRecordingServiceObjectPath), std::string::npos);
+  EXPECT_NE(xml.find(RCSSavedRecordingServiceMachServiceName), std::string::npos);
+
+  struct Method {
+    const char* name;
+    const char* signatureIn;
+    const char* signatureOut;
+    bool noReply;
+  };
+  for (Method m : {Method{RCSMethodPrepareToCapture, "s", "(siss)", false},
+                   Method{RCSMethodPrepareToPreview, "s", "(siss)", false},
+                   Method{RCSMethodPrepareToExport, "sb", "(siss)", false},
+                   Method{RCSMethodPrepareToTrim, "s", "(siss)", false},
+                   Method{RCSMethodEndAccessSession, "(siss)", "", true},
+                   Method{RCSMethodDisableOrphanedFragmentCleanup, "s", "", false},
+                   Method{RCSMethodEnableOrphanedFragmentCleanup, "s", "", true},
+                   Method{RCSMethodDisableOrphanHandling, "", "", false},
+                   Method{RCSMethodEnableOrphanHandling, "", "", false},
+                   Method{RCSMethodFetchExportingCompositionAVURLs, "", "as", false}}) {
+    std::string element = methodElement(xml, m.name);
+    ASSERT_FALSE(element.empty()) << m.name;
+    std::string in, out;
+    for (std::size_t at = element.find("<arg "); at != std::string::npos;
+         at = element.find("<arg ", at + 1)) {
+      std::string arg = element.substr(at, element.find("/>", at) - at);
+      std::size_t type = arg.find("type=\"") + 6;
+      std::string signature = arg.substr(type, arg.find('"', type) - type);
+      (arg.find("direction=\"out\"") != std::string::npos ? out : in) += signature;
+    }
+    EXPECT_EQ(in, m.signatureIn) << m.name;
+    EXPECT_EQ(out, m.signatureOut) << m.name;
+    EXPECT_EQ(element.find("org.freedesktop.DBus.Method.NoReply") != std::string::npos, m.noReply)
+        << m.name;
+  }
+  for (const char* name : {RCSDBusErrorMissingCompositionAVURL, RCSDBusErrorConflictingSession,
+                           RCSDBusErrorDeferredRequestSuperseded, RCSDBusErrorCompositionFailed,
+                           RCSDBusErrorGeneric}) {
+    EXPECT_NE(methodElement(xml, RCSMethodPrepareToExport).find(name), std::string::npos) << name;
+  }
+}
+
+}  // namespace
+}  // namespace quorvel
