@@ -219,16 +219,20 @@ TEST(OperationQueueTest, SuspensionHoldsQueuedOperationsAndLetsRunningOnesFinish
   started.waitFor(2);
   queue.setSuspended(true);
   EXPECT_TRUE(queue.isSuspended());
+  std::vector<std::shared_ptr<Operation>> held;
   for (int i = 0; i < 3; ++i) {
-    auto operation = std::make_shared<BlockingOperation>(started, open);
-    operation->setCompletionBlock([&] { finished.increment(); });
-    queue.addOperation(operation);
+    held.push_back(std::make_shared<BlockingOperation>(started, open));
+    held.back()->setCompletionBlock([&] { finished.increment(); });
+    queue.addOperation(held.back());
   }
   running[0].open();
   running[1].open();
   finished.waitFor(2);  // the running ones went on while suspended
   EXPECT_EQ(started.value(), 2);
-  EXPECT_EQ(queue.operationCount(), 3u);
+  for (const auto& operation : held) {
+    EXPECT_TRUE(operation->isReady());
+    EXPECT_FALSE(operation->isExecuting());
+  }
   queue.setSuspended(false);
   queue.waitUntilAllOperationsAreFinished();
   EXPECT_EQ(started.value(), 5);
