@@ -129,11 +129,14 @@ void SerialQueue::sync(Task task) {
   struct Release {
     State& state;
     ~Release() {
+      bool work;
       {
         std::lock_guard lock(state.mutex);
         state.owned = false;
+        work = !state.items.empty() || state.stopping;
       }
-      state.wake.notify_one();
+      // An idle queue's worker has nothing to do: leave it asleep.
+      if (work) state.wake.notify_one();
     }
   } release{state};
   detail::ScopedCurrentQueue scope(*this);
