@@ -1,0 +1,75 @@
+// Computing and saving the waveform of 20 minutes of AAC, against decoding the
+// same file with the FFmpeg tool on one thread ("-f null"), measured in the
+// same run (best of three each). Target: at most 1.1 times the tool's time.
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <functional>
+#include <string>
+
+#include "Quorvel/RCFileInputWaveformDataSource.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+double bestOf(int runs, const std::function<void()>& work) {
+  double best = 1e9;
+  for (int i = 0; i < runs; ++i) {
+    const auto start = std::chrono::steady_clock::now();
+    work();
+    best = std::min(
+        best, std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
+  }
+  return best;
+}
+
+void run(const std::string& command) {
+  if (std::system(command.c_str()) != 0) {
+    std::fprintf(stderr, "failed: %s\n", command.c_str());
+    std::exit(1);
+  }
+}
+
+}  // namespace
+
+int main() {
+  const fs::path cache = fs::path(QUORVEL_BINARY_DIR) / "bench-cache";
+  fs::create_directories(cache);
+  const fs::path work =
+      fs::temp_directory_path() / ("qv-waveform-bench-" + std::to_string(getpid()));
+  fs::create_directories(work);
+  const fs::path source = cache / "waveform-input.m4a";
+  if (!fs::exists(source)) {
+    const fs::path temp = cache / "making-waveform-input.m4a";
+    run("ffmpeg -v error -y -f lavfi -i 'sine=f=330:d=1200:r=44100' -f lavfi -i "
+        "'anoisesrc=d=1200:r=44100:a=0.05' -filter_complex amix=inputs=2 -c:a aac -b:a 128k '" +
+        temp.string() + "'");
+    fs::rename(temp, source);
+  }
+  // The recording lives in the work directory, so its waveform file goes there.
+  const fs::path audio = work / "recording.m4a";
+  fs::copy_file(source, audio);
+  const auto url = platform::URL::fileURLWithPath(audio.string());
+
+  std::size_t pixels = 0;
+  const double ours = bestOf(3, [&] {
+    quorvel::RCFileInputWaveformDataSource dataSource(url, true, 30.0);
+    dataSource.beginLoading();
+    if (!dataSource.waitUntilFinished()) {
+      std::fprintf(stderr, "waveform failed\n");
+      std::exit(1);
+    }
+    pixels = dataSource.waveform().length();
+  });
+  const double tool =
+      bestOf(3, [&] { run("ffmpeg -v error -threads 1 -i '" + audio.string() + "' -f null -"); });
+
+  std::printf("waveform of 20 min AAC (saved every 30 s, %zu pixels): %.3f s\n", pixels, ours);
+  std::printf("ffmpeg -threads 1 -i FILE -f null -:               %.3f s\n", tool);
+  std::printf("ratio: %.3f (target <= 1.1)\n", ours / tool);
+  fs::remove_all(work);
+  return 0;
+}
