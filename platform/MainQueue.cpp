@@ -12,6 +12,7 @@
 
 #include <fmt/format.h>
 
+#include <atomic>
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
@@ -185,9 +186,20 @@ std::size_t MainQueue::pendingCount() const {
   return state_->ready.size() + state_->timers.size();
 }
 
+namespace {
+std::atomic<MainQueue*> gMainQueueForTesting{nullptr};
+}  // namespace
+
 MainQueue& mainQueue() {
+  if (MainQueue* replacement = gMainQueueForTesting.load(std::memory_order_acquire)) {
+    return *replacement;
+  }
   static MainQueue* queue = new MainQueue(SystemClock::instance(), "main");
   return *queue;
+}
+
+void setMainQueueForTesting(MainQueue* queue) {
+  gMainQueueForTesting.store(queue, std::memory_order_release);
 }
 
 }  // namespace platform

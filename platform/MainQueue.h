@@ -56,5 +56,8 @@ class MainQueue final : public DispatchQueue {
 
 // The process's main queue (system clock), serviced by run() in main().
 MainQueue& mainQueue();
+// Tests: makes mainQueue() return `queue` (a queue on a ManualClock, say)
+// until called again with nullptr. Set it before the code under test runs.
+void setMainQueueForTesting(MainQueue* queue);
 
 }  // namespace platform
