@@ -61,6 +61,7 @@ struct BusListener::Core {
   std::unique_ptr<sdbus::IConnection> bus;
   std::unique_ptr<sdbus::IObject> object;
   sdbus::Slot nameOwnerChangedMatch;
+  std::vector<sdbus::Slot> signalMatches;
 };
 
 struct BusListener::Loop {
@@ -130,6 +131,7 @@ BusListener::~BusListener() {
   // that late answers (which keep the Core alive) never see this listener.
   try {
     core_->nameOwnerChangedMatch.reset();
+    core_->signalMatches.clear();
     core_->object.reset();
   } catch (const std::exception& error) {
     QV_LOG(kLogLevelError, "unregistering the listener failed: {}", error.what());
@@ -201,9 +203,18 @@ Status BusListener::resume() {
           if (!message) return;
           if (!name.empty() && name.front() == ':' && newOwner.empty()) peerVanished(name);
         });
+    for (const SignalMatch& match : interfaceDescription().matches) {
+      std::string rule =
+          "type='signal',interface='" + match.interface + "',member='" + match.member + "'";
+      core_->signalMatches.push_back(core_->bus->addMatch(rule, [&match](sdbus::Message& message) {
+        auto values = sdbuscodec::readValues(message, match.signature);
+        if (values && match.handler) match.handler(*values);
+      }));
+    }
     if (!options_.serviceName.empty()) core_->bus->requestName(options_.serviceName);
   } catch (const sdbus::Error& error) {
     core_->nameOwnerChangedMatch.reset();
+    core_->signalMatches.clear();
     core_->object.reset();
     core_->bus.reset();
     return fail(busError(4, "cannot own the name '" + options_.serviceName + "'", error));

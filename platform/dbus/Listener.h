@@ -53,10 +53,25 @@ struct SignalSpec {
   std::vector<std::string> names;
 };
 
+// A broadcast signal the listener receives, from any sender on the bus.
+// `handler` gets its leading arguments of `signature`; a signal of that name
+// whose arguments do not start so goes to `mismatchHandler` instead. Both run
+// on the delivery thread.
+struct SignalMatch {
+  std::string interface;  // e.g. "org.quorvel.Events1"
+  std::string member;     // e.g. "Event"
+  std::string signature;  // e.g. "s"
+  std::function<void(const BusValues& arguments)> handler;
+  std::function<void()> mismatchHandler;
+};
+
 struct InterfaceDescription {
   std::string name;  // e.g. "org.quorvel.SavedRecordingService1"
   std::vector<MethodSpec> methods;
   std::vector<SignalSpec> signals;
+  // Signals of others the listener subscribes to, installed before the name
+  // is requested.
+  std::vector<SignalMatch> matches;
 };
 
 // The listener's delegate decides about new connections. It is not owned

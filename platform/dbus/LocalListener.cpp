@@ -161,4 +161,17 @@ bool LocalListener::isStopped() const {
   return stopped_;
 }
 
+void LocalListener::deliverSignal(const std::string& interface, const std::string& member,
+                                  const BusValues& arguments) {
+  std::lock_guard delivery(deliveryMutex_);
+  for (const SignalMatch& match : interfaceDescription().matches) {
+    if (match.interface != interface || match.member != member) continue;
+    if (signatureOf(arguments).starts_with(match.signature)) {
+      if (match.handler) match.handler(arguments);
+    } else if (match.mismatchHandler) {
+      match.mismatchHandler();
+    }
+  }
+}
+
 }  // namespace platform

@@ -67,6 +67,10 @@ class LocalListener final : public Listener {
   // is stopped, answers ServiceUnknown.
   std::shared_ptr<LocalReply> deliver(const std::string& sender, const std::string& member,
                                       BusValues arguments = {}, bool noReplyExpected = false);
+  // A broadcast signal arrives: runs the handler of each matching
+  // subscription (see SignalMatch) on the calling thread.
+  void deliverSignal(const std::string& interface, const std::string& member,
+                     const BusValues& arguments);
   // The peer `sender` has left: its connection is invalidated.
   void vanish(const std::string& sender);
   // The bus is gone: every connection is interrupted.
