@@ -1,0 +1,18 @@
+// RCSSavedRecordingServiceConnection: the service interface as the bus sees
+// it — every method with its argument and reply signatures and names, and the
+// exporting-set signal. The daemon attaches a handler to each method;
+// packaging/org.quorvel.SavedRecordingService1.xml is the same contract in
+// the bus's introspection format. Constant data; usable from any thread.
+#pragma once
+
+#include "platform/dbus/Listener.h"
+
+namespace quorvel {
+
+class RCSSavedRecordingServiceConnection {
+ public:
+  // The interface the service exports (methods without handlers).
+  static platform::InterfaceDescription serviceInterface();
+};
+
+}  // namespace quorvel
