@@ -1,0 +1,264 @@
+// quorvelctl: talks to quorveld from the command line. One subcommand per
+// request of the service, plus `watch` for the exporting-set signal.
+//
+//   quorvelctl capture URL                 prints the token
+//   quorvelctl capture URL -- COMMAND...   holds the session while COMMAND
+//                                          runs, ends it whatever COMMAND's
+//                                          outcome, exits with its status
+//   quorvelctl end NAME TYPE URL ID        hands a token back
+//
+// Every error is a message on stderr and a non-zero exit status: 1 for an
+// error the daemon answered, 2 for bad usage, 3 when the daemon could not be
+// reached, COMMAND's status when COMMAND ran.
+#include <fmt/format.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <CLI/CLI.hpp>
+#include <nlohmann/json.hpp>
+
+#include <condition_variable>
+#include <csignal>
+#include <cstdio>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Quorvel/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/SavedRecordingServiceClient.h"
+
+namespace {
+
+using quorvel::RCSSavedRecordingAccessToken;
+using quorvel::SavedRecordingServiceClient;
+
+constexpr int kExitDaemonError = 1;
+constexpr int kExitUsage = 2;
+constexpr int kExitUnreachable = 3;
+
+struct Globals {
+  std::string busAddress;
+  bool json = false;
+};
+
+nlohmann::json tokenJSON(const RCSSavedRecordingAccessToken& token) {
+  auto [name, type, url, identifier] = token.toTuple();
+  return {{"accessName", name},
+          {"accessType", type},
+          {"compositionAVURL", url},
+          {"identifier", identifier}};
+}
+
+nlohmann::json errorJSON(const platform::Error& error) {
+  return {{"domain", error.domain()},
+          {"code", error.code()},
+          {"description", error.localizedDescription()}};
+}
+
+int reportError(const Globals& globals, const platform::Error& error) {
+  if (globals.json) {
+    std::printf("%s\n", nlohmann::json{{"error", errorJSON(error)}}.dump().c_str());
+  }
+  std::fprintf(stderr, "quorvelctl: %s\n", error.description().c_str());
+  return kExitDaemonError;
+}
+
+std::optional<platform::URL> parseURL(const std::string& text) {
+  if (!text.empty() && text.front() != '/' && text.find("://") == std::string::npos) {
+    return platform::URL::fileURLWithPath(text);  // a relative path
+  }
+  return platform::URL::fromFileURLStringOrPath(text);
+}
+
+// Runs `command` and returns its exit status (128 + signal when killed).
+int runCommand(const std::vector<std::string>& command) {
+  std::vector<char*> argv;
+  for (const auto& arg : command) argv.push_back(const_cast<char*>(arg.c_str()));
+  argv.push_back(nullptr);
+  pid_t child = fork();
+  if (child < 0) {
+    std::perror("quorvelctl: fork");
+    return 127;
+  }
+  if (child == 0) {
+    execvp(argv[0], argv.data());
+    std::fprintf(stderr, "quorvelctl: cannot run %s: %s\n", argv[0], std::strerror(errno));
+    _exit(127);
+  }
+  // While COMMAND runs it owns the terminal's interrupts; we only wait.
+  std::signal(SIGINT, SIG_IGN);
+  std::signal(SIGQUIT, SIG_IGN);
+  int status = 0;
+  while (waitpid(child, &status, 0) < 0 && errno == EINTR) {
+  }
+  if (WIFEXITED(status)) return WEXITSTATUS(status);
+  if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
+  return 1;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Globals globals;
+  CLI::App app{"quorvelctl: talk to the quorveld saved-recordings daemon", "quorvelctl"};
+  app.require_subcommand(1);
+  app.add_option("--bus-address", globals.busAddress,
+                 "D-Bus address of the daemon's bus (default: the session bus)");
+  app.add_flag("--json", globals.json, "print results as JSON");
+
+  struct Prepare {
+    const char* name;
+    const char* help;
+    std::string url;
+    bool cacheWaveform = false;
+    std::vector<std::string> command;
+    CLI::App* sub = nullptr;
+  };
+  std::vector<Prepare> prepares = {
+      {"capture", "get exclusive access to record into a recording"},
+      {"preview", "get shared access to play a recording"},
+      {"export", "get shared access to a finalized recording"},
+      {"trim", "get exclusive access to edit a recording"},
+  };
+  for (auto& prepare : prepares) {
+    prepare.sub = app.add_subcommand(prepare.name, prepare.help);
+    prepare.sub->add_option("url", prepare.url, "the recording's composed audio file (path or URL)")
+        ->required();
+    if (std::string_view(prepare.name) == "export") {
+      prepare.sub->add_flag("--cache-waveform", prepare.cacheWaveform,
+                            "also compute and keep the waveform");
+    }
+    prepare.sub->add_option("command", prepare.command,
+                            "after --: run this while holding access, then end the session");
+  }
+
+  std::vector<std::string> tokenFields;
+  auto* end = app.add_subcommand("end", "hand a token back (ends its session)");
+  end->add_option("token", tokenFields, "NAME TYPE URL ID, as printed by a prepare subcommand")
+      ->expected(4)
+      ->required();
+
+  std::string cleanupURL;
+  auto* disableCleanup =
+      app.add_subcommand("disable-cleanup", "hold off deleting a recording's unused fragments");
+  disableCleanup->add_option("url", cleanupURL, "the recording")->required();
+  auto* enableCleanup =
+      app.add_subcommand("enable-cleanup", "release a hold placed with disable-cleanup");
+  enableCleanup->add_option("url", cleanupURL, "the recording")->required();
+  auto* disableOrphans =
+      app.add_subcommand("disable-orphan-handling", "switch the orphan recovery run off");
+  auto* enableOrphans =
+      app.add_subcommand("enable-orphan-handling", "switch the orphan recovery run on (runs it)");
+  auto* fetch =
+      app.add_subcommand("fetch-exporting", "list the recordings whose export is being prepared");
+  auto* watch = app.add_subcommand("watch", "print a line each time the exporting set changes");
+
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    int code = app.exit(e);
+    return code == 0 ? 0 : kExitUsage;
+  }
+
+  auto connected = SavedRecordingServiceClient::connect(globals.busAddress);
+  if (!connected) {
+    std::fprintf(stderr, "quorvelctl: %s\n", connected.error().localizedDescription().c_str());
+    return kExitUnreachable;
+  }
+  SavedRecordingServiceClient& client = **connected;
+
+  for (auto& prepare : prepares) {
+    if (!*prepare.sub) continue;
+    auto url = parseURL(prepare.url);
+    if (!url) {
+      std::fprintf(stderr, "quorvelctl: not a file path or file URL: %s\n", prepare.url.c_str());
+      return kExitUsage;
+    }
+    std::string_view kind = prepare.name;
+    auto token = kind == "capture"   ? client.prepareToCapture(*url)
+                 : kind == "preview" ? client.prepareToPreview(*url)
+                 : kind == "export"  ? client.prepareToExport(*url, prepare.cacheWaveform)
+                                     : client.prepareToTrim(*url);
+    if (!token) return reportError(globals, token.error());
+    if (!prepare.command.empty()) {
+      int status = runCommand(prepare.command);
+      client.endAccessSessionWithToken(*token);
+      return status;
+    }
+    if (globals.json) {
+      std::printf("%s\n", nlohmann::json{{"token", tokenJSON(*token)}}.dump().c_str());
+    } else {
+      auto [name, type, urlString, identifier] = token->toTuple();
+      std::printf("%s %d %s %s\n", name.c_str(), type, urlString.c_str(), identifier.c_str());
+    }
+    return 0;
+  }
+
+  if (*end) {
+    int type = 0;
+    try {
+      type = std::stoi(tokenFields[1]);
+    } catch (const std::exception&) {
+      std::fprintf(stderr, "quorvelctl: the token's TYPE must be a number: %s\n",
+                   tokenFields[1].c_str());
+      return kExitUsage;
+    }
+    auto token = RCSSavedRecordingAccessToken::fromTuple(
+        {tokenFields[0], type, tokenFields[2], tokenFields[3]});
+    if (!token) {
+      std::fprintf(stderr, "quorvelctl: not a token: %s %s %s %s\n", tokenFields[0].c_str(),
+                   tokenFields[1].c_str(), tokenFields[2].c_str(), tokenFields[3].c_str());
+      return kExitUsage;
+    }
+    client.endAccessSessionWithToken(*token);
+    return 0;
+  }
+
+  if (*disableCleanup || *enableCleanup) {
+    auto url = parseURL(cleanupURL);
+    if (!url) {
+      std::fprintf(stderr, "quorvelctl: not a file path or file URL: %s\n", cleanupURL.c_str());
+      return kExitUsage;
+    }
+    if (*enableCleanup) {
+      client.enableOrphanedFragmentCleanupForCompositionAVURL(*url);
+      return 0;
+    }
+    auto done = client.disableOrphanedFragmentCleanup(*url);
+    return done ? 0 : reportError(globals, done.error());
+  }
+
+  if (*disableOrphans || *enableOrphans) {
+    auto done = *disableOrphans ? client.disableOrphanHandling() : client.enableOrphanHandling();
+    return done ? 0 : reportError(globals, done.error());
+  }
+
+  if (*fetch) {
+    auto urls = client.fetchExportingCompositionAVURLs();
+    if (!urls) return reportError(globals, urls.error());
+    if (globals.json) {
+      nlohmann::json list = nlohmann::json::array();
+      for (const auto& url : *urls) list.push_back(url.absoluteString());
+      std::printf("%s\n", nlohmann::json{{"compositionAVURLs", list}}.dump().c_str());
+    } else {
+      for (const auto& url : *urls) std::printf("%s\n", url.absoluteString().c_str());
+    }
+    return 0;
+  }
+
+  if (*watch) {
+    std::mutex mutex;
+    std::condition_variable never;
+    client.setExportingCompositionAVURLsChangedHandler([&globals] {
+      if (globals.json) {
+        std::printf("{\"signal\":\"ExportingCompositionAVURLsChanged\"}\n");
+      } else {
+        std::printf("ExportingCompositionAVURLsChanged\n");
+      }
+      std::fflush(stdout);
+    });
+    std::unique_lock lock(mutex);
+    never.wait(lock, [] { return false; });  // until interrupted
+  }
+  return 0;
+}
