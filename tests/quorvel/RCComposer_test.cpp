@@ -73,7 +73,7 @@ class ComposerTest : public ::testing::Test {
   void TearDown() override {
     platform::setLogSinkForTesting(nullptr);
     platform::setLogThreshold(6);
-    if (!std::getenv("QV_KEEP")) fs::remove_all(dir_);
+    fs::remove_all(dir_);
   }
   std::string path(const std::string& name) const { return (dir_ / name).string(); }
   platform::URL url(const std::string& name) const {

@@ -5,10 +5,13 @@
 #include <sys/inotify.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cmath>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <memory>
+#include <thread>
 #include <vector>
 
 #include "Quorvel/RCFileInputWaveformDataSource.h"
@@ -271,6 +274,38 @@ TEST_F(WaveformDataSourceTest, SavesAtEveryFlushIntervalAndReplacesTheFileAtTheE
     ASSERT_NEAR(final->max(p, 0), 16384, 2500) << p;
     ASSERT_NEAR(final->min(p, 0), -16384, 2500) << p;
   }
+  EXPECT_EQ(hiddenLeftovers(), 0u);
+}
+
+TEST_F(WaveformDataSourceTest, ConcurrentSourcesOfOneRecordingNeverExposeAHalfFile) {
+  ASSERT_TRUE(writeTone((dir_ / "shared.m4a").string(), 2.0, "m4a", 44100, 2, 500, 0.5));
+  std::vector<std::unique_ptr<RCFileInputWaveformDataSource>> sources;
+  for (int i = 0; i < 6; ++i)
+    sources.push_back(
+        std::make_unique<RCFileInputWaveformDataSource>(url("shared.m4a"), true, 0.05));
+  for (auto& source : sources) source->beginLoading();
+  // Read the file while the sources replace it over and over: every read
+  // sees a whole waveform (or no file yet), never a torn one.
+  std::atomic<bool> done{false};
+  int reads = 0, torn = 0;
+  std::thread reader([&] {
+    const platform::URL waveformURL = RCWaveform::waveformURLForAVURL(url("shared.m4a"));
+    while (!done) {
+      auto read = RCReadWaveformFile(waveformURL);
+      if (read)
+        ++reads;
+      else if (read.error().domain() == kRCMediaErrorDomain)
+        ++torn;
+    }
+  });
+  for (auto& source : sources) EXPECT_TRUE(source->waitUntilFinished());
+  done = true;
+  reader.join();
+  EXPECT_EQ(torn, 0);
+  EXPECT_GT(reads, 0);
+  auto final = RCReadWaveformFile(RCWaveform::waveformURLForAVURL(url("shared.m4a")));
+  ASSERT_TRUE(final);
+  EXPECT_EQ(*final, sources.front()->waveform());
   EXPECT_EQ(hiddenLeftovers(), 0u);
 }
 
