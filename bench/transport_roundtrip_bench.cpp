@@ -16,9 +16,8 @@
 #include <string>
 
 #include "platform/dbus/BusListener.h"
-// The bench is a single file by the build's convention; it reuses the test
-// suite's private bus by compiling its source in.
-#include "tests/support/TestBus.cpp"
+// The test suite's private bus.
+#include "tests/support/TestBus.h"
 
 namespace {
 
