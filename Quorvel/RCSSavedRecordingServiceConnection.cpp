@@ -19,12 +19,12 @@ platform::InterfaceDescription RCSSavedRecordingServiceConnection::serviceInterf
       .name = RCSSavedRecordingServiceInterfaceName,
       .methods =
           {
-              method(RCSMethodPrepareToCapture, "s", {"compositionAVURL"}, "(siss)", {"token"}),
-              method(RCSMethodPrepareToPreview, "s", {"compositionAVURL"}, "(siss)", {"token"}),
+              method(RCSMethodPrepareToCapture, "s", {"compositionAVURL"}, "(siss)", {"accessToken"}),
+              method(RCSMethodPrepareToPreview, "s", {"compositionAVURL"}, "(siss)", {"accessToken"}),
               method(RCSMethodPrepareToExport, "sb", {"compositionAVURL", "cacheWaveform"},
-                     "(siss)", {"token"}),
-              method(RCSMethodPrepareToTrim, "s", {"compositionAVURL"}, "(siss)", {"token"}),
-              method(RCSMethodEndAccessSession, "(siss)", {"token"}, "", {}, /*noReply=*/true),
+                     "(siss)", {"accessToken"}),
+              method(RCSMethodPrepareToTrim, "s", {"compositionAVURL"}, "(siss)", {"accessToken"}),
+              method(RCSMethodEndAccessSession, "(siss)", {"accessToken"}, "", {}, /*noReply=*/true),
               method(RCSMethodDisableOrphanedFragmentCleanup, "s", {"compositionAVURL"}, "", {}),
               method(RCSMethodEnableOrphanedFragmentCleanup, "s", {"compositionAVURL"}, "", {},
                      /*noReply=*/true),
