@@ -119,6 +119,7 @@ void SavedRecordingService::_handleLaunchEvent(const std::optional<std::string>&
     QV_LOG(platform::kLogLevelError, "Ignoring a launch event without a name");
     return;
   }
+  QV_LOG(platform::kLogLevelDebug, "Posting launch event '{}'", *name);
   platform::NotificationCenter::defaultCenter().postNotificationName(*name);
 }
 

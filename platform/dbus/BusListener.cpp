@@ -208,7 +208,11 @@ Status BusListener::resume() {
           "type='signal',interface='" + match.interface + "',member='" + match.member + "'";
       core_->signalMatches.push_back(core_->bus->addMatch(rule, [&match](sdbus::Message& message) {
         auto values = sdbuscodec::readValues(message, match.signature);
-        if (values && match.handler) match.handler(*values);
+        if (values) {
+          if (match.handler) match.handler(*values);
+        } else if (match.mismatchHandler) {
+          match.mismatchHandler();
+        }
       }));
     }
     if (!options_.serviceName.empty()) core_->bus->requestName(options_.serviceName);

@@ -1,0 +1,189 @@
+// The real quorveld on a private bus, called the way apps and users call it:
+// the client library, quorvelctl, gdbus and dbus-send. Checks what each sees
+// and what the daemon logs.
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <filesystem>
+#include <string>
+
+#include "Quorvel/SavedRecordingServiceClient.h"
+#include "tests/support/DaemonProcess.h"
+#include "tests/support/TestBus.h"
+
+namespace quorvel {
+namespace {
+
+using testing::DaemonProcess;
+
+constexpr const char* kService = "org.quorvel.SavedRecordingService";
+constexpr const char* kPath = "/org/quorvel/SavedRecordingService";
+constexpr const char* kInterface = "org.quorvel.SavedRecordingService1";
+
+class DaemonTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    recordings_ = std::filesystem::temp_directory_path() /
+                  ("quorvel-it-" + std::to_string(getpid()) + "-" +
+                   ::testing::UnitTest::GetInstance()->current_test_info()->name());
+    std::filesystem::remove_all(recordings_);
+  }
+  void TearDown() override { std::filesystem::remove_all(recordings_); }
+
+  std::unique_ptr<DaemonProcess> startDaemon(const std::string& idleExitAfter = "0") {
+    auto daemon = std::make_unique<DaemonProcess>(
+        std::vector<std::string>{"--bus-address", bus_.address(), "--recordings-dir",
+                                 recordings_.string(), "--idle-exit-after", idleExitAfter});
+    // Logged once the name is ours.
+    EXPECT_TRUE(daemon->waitForLine("[BusListener] listening as")) << daemon->output();
+    return daemon;
+  }
+  DaemonProcess::CommandResult gdbusCall(const std::string& method,
+                                         std::vector<std::string> arguments = {}) {
+    std::vector<std::string> argv{"gdbus",         "call",
+                                  "--address",     bus_.address(),
+                                  "--dest",        kService,
+                                  "--object-path", kPath,
+                                  "--method",      std::string(kInterface) + "." + method};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return DaemonProcess::run(argv);
+  }
+  DaemonProcess::CommandResult quorvelctl(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(),
+                     {DaemonProcess::programPath("quorvelctl"), "--bus-address", bus_.address()});
+    return DaemonProcess::run(arguments);
+  }
+
+  platform::testing::TestBus bus_;
+  std::filesystem::path recordings_;
+};
+
+TEST_F(DaemonTest, StartsOwnsItsNameAndLogsTheStartUp) {
+  auto daemon = startDaemon();
+  EXPECT_EQ(daemon->linesContaining("[quorveld] Starting xpc service").size(), 1u);
+  EXPECT_EQ(daemon
+                ->linesContaining(
+                    "[SavedRecordingService] Starting service 'org.quorvel.SavedRecordingService'")
+                .size(),
+            1u);
+  EXPECT_TRUE(daemon->waitForLine("[RCSXPCTransaction] Root XPC transaction began."));
+  EXPECT_TRUE(std::filesystem::is_directory(recordings_));
+
+  auto introspection = DaemonProcess::run({"gdbus", "introspect", "--address", bus_.address(),
+                                           "--dest", kService, "--object-path", kPath});
+  ASSERT_EQ(introspection.status, 0) << introspection.output;
+  EXPECT_NE(introspection.output.find("interface org.quorvel.SavedRecordingService1"),
+            std::string::npos);
+  EXPECT_NE(introspection.output.find("PrepareToExport(in  s compositionAVURL,"), std::string::npos)
+      << introspection.output;
+}
+
+TEST_F(DaemonTest, ClientLibraryGetsAnswersAndErrorsAsValues) {
+  auto daemon = startDaemon();
+  auto client = SavedRecordingServiceClient::connect(bus_.address());
+  ASSERT_TRUE(client) << client.error();
+
+  auto exporting = (*client)->fetchExportingCompositionAVURLs();
+  ASSERT_TRUE(exporting) << exporting.error();
+  EXPECT_TRUE(exporting->empty());
+
+  auto url = platform::URL::fileURLWithPath(recordings_.string() + "/Walk in the park.m4a");
+  auto token = (*client)->prepareToCapture(url);
+  ASSERT_FALSE(token);
+  EXPECT_EQ(token.error().domain(), "org.freedesktop.DBus.Error.NotSupported");
+  EXPECT_NE(token.error().localizedDescription().find("prepareToCaptureToCompositionAVURL:"),
+            std::string::npos);
+  EXPECT_TRUE(daemon->waitForLine(
+      "[SavedRecordingService] Received request to prepare 'Walk in the park.m4a' for capture..."));
+  EXPECT_TRUE(daemon->waitForLine("Listener accepted new connection <connection :1."));
+}
+
+TEST_F(DaemonTest, ForeignClientsGetTheContractsErrors) {
+  auto daemon = startDaemon();
+  auto missing = gdbusCall("PrepareToCapture", {""});
+  EXPECT_NE(missing.status, 0);
+  EXPECT_NE(missing.output.find("org.quorvel.SavedRecordingService.Error.MissingCompositionAVURL"),
+            std::string::npos)
+      << missing.output;
+  EXPECT_NE(missing.output.find("Code=101"), std::string::npos);
+  EXPECT_TRUE(
+      daemon->waitForLine(".  compositionAVURL parameter is required for invocations of "
+                          "-prepareToCaptureToCompositionAVURL:accessRequestHandler:"));
+
+  auto wrongSignature = DaemonProcess::run(
+      {"dbus-send", "--bus=" + bus_.address(), "--print-reply", "--dest=" + std::string(kService),
+       kPath, std::string(kInterface) + ".PrepareToCapture", "int32:7"});
+  EXPECT_NE(wrongSignature.output.find("org.freedesktop.DBus.Error.InvalidArgs"), std::string::npos)
+      << wrongSignature.output;
+  auto unknown = gdbusCall("NoSuchMethod");
+  EXPECT_NE(unknown.output.find("org.freedesktop.DBus.Error.UnknownMethod"), std::string::npos)
+      << unknown.output;
+
+  // The daemon keeps serving.
+  auto fetched = gdbusCall("FetchExportingCompositionAVURLs");
+  EXPECT_EQ(fetched.status, 0) << fetched.output;
+  EXPECT_NE(fetched.output.find("(@as [],)"), std::string::npos) << fetched.output;
+
+  // Launch events: a named one is posted in-process, one without a name is
+  // logged and ignored.
+  auto emit = [this](std::vector<std::string> arguments) {
+    std::vector<std::string> argv{"dbus-send", "--bus=" + bus_.address(), "--type=signal", "/",
+                                  "org.quorvel.Events1.Event"};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return DaemonProcess::run(argv);
+  };
+  EXPECT_EQ(emit({}).status, 0);
+  EXPECT_TRUE(daemon->waitForLine("Ignoring a launch event without a name"));
+  EXPECT_EQ(emit({"string:com.example.RecordingsChanged"}).status, 0);
+  EXPECT_TRUE(daemon->waitForLine("Posting launch event 'com.example.RecordingsChanged'"));
+}
+
+TEST_F(DaemonTest, QuorvelctlReportsResultsAndErrorsByExitStatus) {
+  auto daemon = startDaemon();
+  auto fetched = quorvelctl({"--json", "fetch-exporting"});
+  EXPECT_EQ(fetched.status, 0) << fetched.output;
+  EXPECT_EQ(fetched.output, "{\"compositionAVURLs\":[]}\n");
+
+  auto captured = quorvelctl({"capture", recordings_.string() + "/x.m4a"});
+  EXPECT_EQ(captured.status, 1);
+  EXPECT_NE(
+      captured.output.find("quorvelctl: Error Domain=org.freedesktop.DBus.Error.NotSupported"),
+      std::string::npos)
+      << captured.output;
+
+  auto usage = quorvelctl({"end", "capture", "two", "file:///x.m4a", "nope"});
+  EXPECT_EQ(usage.status, 2) << usage.output;
+
+  auto unreachable = DaemonProcess::run({DaemonProcess::programPath("quorvelctl"), "--bus-address",
+                                         "unix:path=/nonexistent/bus", "fetch-exporting"});
+  EXPECT_EQ(unreachable.status, 3) << unreachable.output;
+}
+
+TEST_F(DaemonTest, DebugSignalDumpsWithoutEndingTheProcess) {
+  auto daemon = startDaemon();
+  daemon->sendSignal(SIGUSR1);
+  EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
+  daemon->sendSignal(SIGUSR1);
+  EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
+  auto fetched = gdbusCall("FetchExportingCompositionAVURLs");
+  EXPECT_EQ(fetched.status, 0) << fetched.output << daemon->output();
+}
+
+TEST_F(DaemonTest, ExitsByItselfOnceIdleAndASecondDaemonIsRefused) {
+  auto daemon = startDaemon("1");
+  // A second daemon cannot own the name: a clear message and status 1.
+  DaemonProcess second({"--bus-address", bus_.address(), "--recordings-dir", recordings_.string()});
+  EXPECT_EQ(second.waitForExit(), 1);
+  EXPECT_NE(second.output().find("quorveld: cannot serve org.quorvel.SavedRecordingService"),
+            std::string::npos)
+      << second.output();
+
+  EXPECT_EQ(daemon->waitForExit(), 0) << daemon->output();
+  EXPECT_EQ(
+      daemon->linesContaining("No XPC transactions remain. Ending root XPC transaction.").size(),
+      1u);
+  EXPECT_EQ(daemon->linesContaining("[quorveld] Exiting xpc service").size(), 1u);
+}
+
+}  // namespace
+}  // namespace quorvel

@@ -1,0 +1,65 @@
+// DaemonProcess: a real quorveld (build/bin/quorveld) started by a test on a
+// given bus, with its log lines (level 7 included) captured from stderr.
+// Tests wait on lines and on the process's exit, never on time; the
+// timeouts here are only a safety net against a hung daemon.
+//
+// Owned by the test; destruction kills a daemon that is still running. Its
+// members may be called from the test's thread; the capture runs on a thread
+// of its own.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace quorvel::testing {
+
+class DaemonProcess {
+ public:
+  // Starts quorveld with `arguments` after the program name.
+  explicit DaemonProcess(std::vector<std::string> arguments);
+  ~DaemonProcess();
+  DaemonProcess(const DaemonProcess&) = delete;
+  DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+  pid_t pid() const { return pid_; }
+  // Waits until a stderr line contains `text`; false on timeout or when the
+  // process's stderr closed first.
+  bool waitForLine(const std::string& text,
+                   std::chrono::milliseconds timeout = std::chrono::seconds(30));
+  // Every line so far that contains `text`.
+  std::vector<std::string> linesContaining(const std::string& text) const;
+  std::string output() const;
+  // Waits for the process to exit; its exit status, or nullopt on timeout
+  // (or -signal when a signal ended it).
+  std::optional<int> waitForExit(std::chrono::milliseconds timeout = std::chrono::seconds(30));
+  void sendSignal(int signo) const;
+
+  // Runs a command to completion; its exit status and combined output.
+  struct CommandResult {
+    int status;
+    std::string output;
+  };
+  static CommandResult run(const std::vector<std::string>& argv);
+  // The path of a built program, "quorveld" or "quorvelctl".
+  static std::string programPath(const std::string& name);
+
+ private:
+  void capture(int fd);
+
+  pid_t pid_ = -1;
+  std::optional<int> exitStatus_;
+  std::thread reader_;
+  mutable std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<std::string> lines_;
+  bool closed_ = false;
+};
+
+}  // namespace quorvel::testing
