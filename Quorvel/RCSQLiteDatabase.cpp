@@ -2,6 +2,9 @@
 
 #include <fmt/format.h>
 
+#include <chrono>
+#include <thread>
+
 #include "Quorvel/RCError.h"
 #include "platform/Log.h"
 
@@ -137,6 +140,17 @@ platform::Result<std::optional<std::string>> RCSQLiteDatabase::textForQuery(std:
   if (!row) return platform::fail(row.error());
   if (!*row) return std::optional<std::string>();
   return std::optional<std::string>(statement->text(0));
+}
+
+platform::Result<std::optional<std::string>> RCSQLiteDatabase::textForQueryRetryingWhileBusy(
+    std::string_view sql, int timeoutMilliseconds) {
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMilliseconds);
+  for (;;) {
+    auto result = textForQuery(sql);
+    bool busy = !result && (sqlite3_extended_errcode(db_) & 0xFF) == SQLITE_BUSY;
+    if (!busy || std::chrono::steady_clock::now() >= deadline) return result;
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
 }
 
 platform::Error RCSQLiteDatabase::lastError(std::string_view what) const {

@@ -64,6 +64,12 @@ class RCSQLiteDatabase {
   // The first column of the first row of `sql`, as text (nullopt without a row).
   platform::Result<std::optional<std::string>> textForQuery(std::string_view sql);
 
+  // textForQuery for statements SQLite answers SQLITE_BUSY at once instead of
+  // waiting through the busy timeout (changing the journal mode): retried
+  // every few milliseconds for up to `timeoutMilliseconds`.
+  platform::Result<std::optional<std::string>> textForQueryRetryingWhileBusy(
+      std::string_view sql, int timeoutMilliseconds);
+
   // The connection's current error as an Error, with `what` in its text.
   platform::Error lastError(std::string_view what) const;
 

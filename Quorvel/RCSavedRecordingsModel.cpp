@@ -166,20 +166,24 @@ platform::Result<std::shared_ptr<RCSavedRecordingsModel>> RCSavedRecordingsModel
     return platform::fail(described);
   };
 
-  auto version = db->integerForQuery("PRAGMA user_version");
+  // The version and the tables are read in one read transaction, so another
+  // process giving a new file its schema meanwhile is seen whole or not at all.
+  platform::Result<long long> version = 0;
+  platform::Result<long long> tables = 0;
+  if (auto begun = db->execute("BEGIN"); !begun) return fail(begun.error());
+  version = db->integerForQuery("PRAGMA user_version");
+  if (version) tables = db->integerForQuery("SELECT count(*) FROM sqlite_master");
+  (void)db->execute("COMMIT");
   if (!version) return fail(version.error());
+  if (!tables) return fail(tables.error());
   if (*version > kSchemaVersion) {
     return fail(RCError(RCErrorCodeDatabaseSchemaTooNew,
                         fmt::format("schema version {} is newer than this build knows ({})",
                                     *version, kSchemaVersion)));
   }
-  if (*version == 0) {
-    auto tables = db->integerForQuery("SELECT count(*) FROM sqlite_master");
-    if (!tables) return fail(tables.error());
-    if (*tables > 0) {
-      return fail(RCError(RCErrorCodeDatabaseUnrecognized,
-                          "the file holds tables but no schema version of this framework"));
-    }
+  if (*version == 0 && *tables > 0) {
+    return fail(RCError(RCErrorCodeDatabaseUnrecognized,
+                        "the file holds tables but no schema version of this framework"));
   }
 
   auto probeColumns = [&]() -> platform::Status {
@@ -195,7 +199,8 @@ platform::Result<std::shared_ptr<RCSavedRecordingsModel>> RCSavedRecordingsModel
     if (auto probed = probeColumns(); !probed) return fail(probed.error());
   }
 
-  auto mode = db->textForQuery("PRAGMA journal_mode=WAL");
+  auto mode =
+      db->textForQueryRetryingWhileBusy("PRAGMA journal_mode=WAL", kBusyTimeoutMilliseconds);
   if (!mode) return fail(mode.error());
   if (!*mode || **mode != "wal") {
     QV_LOG(platform::kLogLevelError, "WARNING: {} stays in journal mode {}", path,
@@ -252,6 +257,7 @@ platform::Result<std::vector<std::shared_ptr<RCSavedRecording>>> RCSavedRecordin
   auto statement = database_->prepare(sql);
   if (!statement) return platform::fail(statement.error());
   if (!where.empty()) statement->bind(1, value);
+  std::erase_if(recordingsByUUID_, [](const auto& entry) { return entry.second.expired(); });
   std::vector<std::shared_ptr<RCSavedRecording>> recordings;
   for (;;) {
     auto row = statement->step();

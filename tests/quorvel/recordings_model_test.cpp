@@ -278,7 +278,10 @@ TEST_F(RecordingsModelTest, TwoProcessesInsertingAtOnceBothLand) {
     ::close(gate[1]);
     if (::read(gate[0], &go, 1) != 1) ::_exit(3);
     auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_);
-    if (!model) ::_exit(1);
+    if (!model) {
+      fmt::print(stderr, "child: {}\n", model.error().description());
+      ::_exit(1);
+    }
     for (int i = 0; i < kEach; ++i) {
       (*model)->insertRecordingWithAudioFile(recordingsPath("child " + std::to_string(i) + ".m4a"),
                                              i, platform::Date::now());
