@@ -13,6 +13,7 @@
 #include <cstdio>
 
 #include "Quorvel/RCComposition.h"
+#include "Quorvel/RCCompositionController.h"
 #include "Quorvel/RCSSavedRecordingServiceErrors.h"
 
 namespace quorvel {
@@ -144,8 +145,8 @@ std::string AssetAccessSessionController::stateDescription() {
       if (!descriptions.empty()) descriptions += "; ";
       descriptions += session->debugDescription();
     }
-    auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
-        RCComposition::compositionBundleURLForComposedAVURL(url));
+    auto composition =
+        RCCompositionController::compositionControllerForComposedAVURL(url)->composition();
     text += fmt::format("compositionAVURL = {}\n", url.absoluteString());
     text += fmt::format("\tActive Sessions ({}) = {}\n", sessions.size(), descriptions);
     text += fmt::format("\tComposition Metadata = {}\n\n\n",
