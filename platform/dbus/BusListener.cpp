@@ -152,10 +152,10 @@ Status BusListener::resume() {
   }
   try {
     core_->object = sdbus::createObject(*core_->bus, options_.objectPath);
-    for (const MethodSpec& spec : interface.methods) {
+    for (const MethodSpec& declared : interface.methods) {
       sdbus::Flags flags;
-      if (spec.noReply) flags.set(sdbus::Flags::METHOD_NO_REPLY);
-      const MethodSpec* method = &spec;
+      if (declared.noReply) flags.set(sdbus::Flags::METHOD_NO_REPLY);
+      const MethodSpec* method = &declared;
       auto callback = [this, method](sdbus::MethodCall call) {
         std::string sender = call.getSender();
         bool noReply = call.doesntExpectReply();
@@ -174,14 +174,14 @@ Status BusListener::resume() {
           QV_LOG(kLogLevelError, "handler of {} threw: {}", method->name, error.what());
         }
       };
-      bool named = !spec.inputNames.empty() || !spec.outputNames.empty();
+      bool named = !declared.inputNames.empty() || !declared.outputNames.empty();
       if (named) {
-        core_->object->registerMethod(interface.name, spec.name, spec.inputSignature,
-                                      spec.inputNames, spec.outputSignature, spec.outputNames,
+        core_->object->registerMethod(interface.name, declared.name, declared.inputSignature,
+                                      declared.inputNames, declared.outputSignature, declared.outputNames,
                                       std::move(callback), flags);
       } else {
-        core_->object->registerMethod(interface.name, spec.name, spec.inputSignature,
-                                      spec.outputSignature, std::move(callback), flags);
+        core_->object->registerMethod(interface.name, declared.name, declared.inputSignature,
+                                      declared.outputSignature, std::move(callback), flags);
       }
     }
     for (const SignalSpec& signal : interface.signals) {

@@ -113,8 +113,8 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
       return reply;
     }
   }
-  const MethodSpec* spec = method(member);
-  if (!spec) {
+  const MethodSpec* declared = method(member);
+  if (!declared) {
     if (!noReplyExpected) {
       responder->sendError(
           kBusErrorUnknownMethod,
@@ -123,16 +123,16 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
     return reply;
   }
   std::string signature = signatureOf(arguments);
-  if (signature != spec->inputSignature) {
+  if (signature != declared->inputSignature) {
     if (!noReplyExpected) {
       responder->sendError(
           kBusErrorInvalidArgs,
           fmt::format("Invalid arguments '{}' to call {}.{}(), expecting '{}'.", signature,
-                      interfaceDescription().name, member, spec->inputSignature));
+                      interfaceDescription().name, member, declared->inputSignature));
     }
     return reply;
   }
-  dispatch(sender, *spec, std::move(arguments), noReplyExpected, std::move(responder));
+  dispatch(sender, *declared, std::move(arguments), noReplyExpected, std::move(responder));
   return reply;
 }
 

@@ -155,10 +155,10 @@ TEST_F(RCAudioAssetTest, TitleItemsAreTheFilesOwn) {
   ASSERT_TRUE(metadata) << metadata.error();
   EXPECT_EQ(metadata->titleItems, (std::vector<RCMetadataItem>{{"Bonjour", "fra"}}));
 
-  testing::ToneSpec spec;
-  spec.seconds = 0.5;
-  spec.metadata = {{"title", "Plain"}, {"creation_time", "2021-06-07T08:09:10.000000Z"}};
-  ASSERT_TRUE(writeTone(path("many.m4a"), spec));
+  testing::ToneSpec tone;
+  tone.seconds = 0.5;
+  tone.metadata = {{"title", "Plain"}, {"creation_time", "2021-06-07T08:09:10.000000Z"}};
+  ASSERT_TRUE(writeTone(path("many.m4a"), tone));
   ASSERT_TRUE(RCMP4WriteTitle(path("many.m4a"), "Hallo", "ger"));
   ASSERT_TRUE(RCMP4WriteTitle(path("many.m4a"), "Hello", "eng"));
   asset = RCAudioAsset::assetWithURL(url("many.m4a"));

@@ -129,10 +129,10 @@ TEST_F(RCMP4AtomsTest, ASingleTaggedTitleIsOneItemThoughLibavformatShowsTwo) {
 TEST_F(RCMP4AtomsTest, UntaggedTitlesFromTheMuxerAndOursAreOneTitle) {
   // The muxer writes an untagged title as an iTunes-style item.
   const std::string file = path("muxed.m4a");
-  testing::ToneSpec spec;
-  spec.seconds = 0.5;
-  spec.metadata = {{"title", "From the muxer"}};
-  ASSERT_TRUE(writeTone(file, spec));
+  testing::ToneSpec tone;
+  tone.seconds = 0.5;
+  tone.metadata = {{"title", "From the muxer"}};
+  ASSERT_TRUE(writeTone(file, tone));
   auto items = RCMP4ReadTitleItems(file);
   ASSERT_TRUE(items);
   EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"From the muxer", ""}}));

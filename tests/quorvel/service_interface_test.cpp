@@ -58,15 +58,15 @@ TEST(ServiceInterfaceTest, PublishedInterfaceMatchesThePackagedContract) {
   ASSERT_EQ(documented.size(), 10u);
   ASSERT_EQ(published.methods.size(), documented.size());
   for (std::size_t i = 0; i < documented.size(); ++i) {
-    const auto& spec = published.methods[i];
+    const auto& declared = published.methods[i];
     const auto& xml = documented[i];
     SCOPED_TRACE(xml.name);
-    EXPECT_EQ(spec.name, xml.name);
-    EXPECT_EQ(spec.inputSignature, xml.in);
-    EXPECT_EQ(spec.outputSignature, xml.out);
-    EXPECT_EQ(spec.inputNames, xml.inNames);
-    EXPECT_EQ(spec.outputNames, xml.outNames);
-    EXPECT_EQ(spec.noReply, xml.noReply);
+    EXPECT_EQ(declared.name, xml.name);
+    EXPECT_EQ(declared.inputSignature, xml.in);
+    EXPECT_EQ(declared.outputSignature, xml.out);
+    EXPECT_EQ(declared.inputNames, xml.inNames);
+    EXPECT_EQ(declared.outputNames, xml.outNames);
+    EXPECT_EQ(declared.noReply, xml.noReply);
   }
   ASSERT_EQ(published.signals.size(), 1u);
   EXPECT_EQ(signals, std::vector<std::string>{published.signals[0].name});

@@ -86,20 +86,20 @@ platform::Status encodeAndWrite(AVCodecContext* codec, AVFormatContext* output, 
 platform::Status writeTone(const std::string& path, double seconds, const std::string& format,
                            int sampleRate, int channels, double frequencyHz, double amplitude,
                            M4ALayout layout) {
-  ToneSpec spec;
-  spec.seconds = seconds;
-  spec.format = format;
-  spec.sampleRate = sampleRate;
-  spec.channels = channels;
-  spec.frequencyHz = frequencyHz;
-  spec.amplitude = amplitude;
-  spec.layout = layout;
-  return writeTone(path, spec);
+  ToneSpec tone;
+  tone.seconds = seconds;
+  tone.format = format;
+  tone.sampleRate = sampleRate;
+  tone.channels = channels;
+  tone.frequencyHz = frequencyHz;
+  tone.amplitude = amplitude;
+  tone.layout = layout;
+  return writeTone(path, tone);
 }
 
-platform::Status writeTone(const std::string& path, const ToneSpec& spec) {
+platform::Status writeTone(const std::string& path, const ToneSpec& tone) {
   RCInstallFFmpegLogging();
-  auto choice = choose(spec.format);
+  auto choice = choose(tone.format);
   if (!choice) return platform::fail(choice.error());
 
   AVFormatContext* rawOutput = nullptr;
@@ -110,11 +110,11 @@ platform::Status writeTone(const std::string& path, const ToneSpec& spec) {
   const AVCodec* encoder = avcodec_find_encoder(choice->codec);
   if (encoder == nullptr) return platform::fail(platform::Error(kDomain, -1, "no encoder"));
   std::unique_ptr<AVCodecContext, CodecContextDeleter> codec(avcodec_alloc_context3(encoder));
-  codec->sample_rate = spec.sampleRate;
+  codec->sample_rate = tone.sampleRate;
   codec->sample_fmt = choice->sampleFormat;
-  av_channel_layout_default(&codec->ch_layout, spec.channels);
-  codec->time_base = AVRational{1, spec.sampleRate};
-  if (choice->codec == AV_CODEC_ID_AAC) codec->bit_rate = 64000 * spec.channels;
+  av_channel_layout_default(&codec->ch_layout, tone.channels);
+  codec->time_base = AVRational{1, tone.sampleRate};
+  if (choice->codec == AV_CODEC_ID_AAC) codec->bit_rate = 64000 * tone.channels;
   if (output->oformat->flags & AVFMT_GLOBALHEADER) codec->flags |= AV_CODEC_FLAG_GLOBAL_HEADER;
   status = avcodec_open2(codec.get(), encoder, nullptr);
   if (status < 0) return platform::fail(ffError(status, "avcodec_open2"));
@@ -124,14 +124,14 @@ platform::Status writeTone(const std::string& path, const ToneSpec& spec) {
   stream->time_base = codec->time_base;
   status = avcodec_parameters_from_context(stream->codecpar, codec.get());
   if (status < 0) return platform::fail(ffError(status, "avcodec_parameters_from_context"));
-  for (const auto& [key, value] : spec.metadata) {
+  for (const auto& [key, value] : tone.metadata) {
     av_dict_set(&output->metadata, key.c_str(), value.c_str(), 0);
   }
 
   status = avio_open(&output->pb, path.c_str(), AVIO_FLAG_WRITE);
   if (status < 0) return platform::fail(ffError(status, "avio_open " + path));
   AVDictionary* options = nullptr;
-  if (spec.format == "m4a" && spec.layout == M4ALayout::MoovFirst) {
+  if (tone.format == "m4a" && tone.layout == M4ALayout::MoovFirst) {
     av_dict_set(&options, "movflags", "+faststart", 0);
   }
   status = avformat_write_header(output.get(), &options);
@@ -139,10 +139,10 @@ platform::Status writeTone(const std::string& path, const ToneSpec& spec) {
   if (status < 0) return platform::fail(ffError(status, "avformat_write_header"));
 
   const int frameSize = codec->frame_size > 0 ? codec->frame_size : 1024;
-  const auto totalFrames = static_cast<int64_t>(std::llround(spec.seconds * spec.sampleRate));
+  const auto totalFrames = static_cast<int64_t>(std::llround(tone.seconds * tone.sampleRate));
   std::unique_ptr<AVFrame, FrameDeleter> frame(av_frame_alloc());
   std::unique_ptr<AVPacket, PacketDeleter> packet(av_packet_alloc());
-  const double step = 2.0 * std::numbers::pi * spec.frequencyHz / spec.sampleRate;
+  const double step = 2.0 * std::numbers::pi * tone.frequencyHz / tone.sampleRate;
   for (int64_t done = 0; done < totalFrames;) {
     const int count = static_cast<int>(std::min<int64_t>(frameSize, totalFrames - done));
     av_frame_unref(frame.get());
@@ -153,12 +153,12 @@ platform::Status writeTone(const std::string& path, const ToneSpec& spec) {
     status = av_frame_get_buffer(frame.get(), 0);
     if (status < 0) return platform::fail(ffError(status, "av_frame_get_buffer"));
     for (int i = 0; i < count; ++i) {
-      const double value = spec.amplitude * std::sin(step * double(done + i));
-      for (int c = 0; c < spec.channels; ++c) {
+      const double value = tone.amplitude * std::sin(step * double(done + i));
+      for (int c = 0; c < tone.channels; ++c) {
         if (codec->sample_fmt == AV_SAMPLE_FMT_FLTP) {
           reinterpret_cast<float*>(frame->extended_data[c])[i] = static_cast<float>(value);
         } else {
-          reinterpret_cast<int16_t*>(frame->data[0])[i * spec.channels + c] =
+          reinterpret_cast<int16_t*>(frame->data[0])[i * tone.channels + c] =
               static_cast<int16_t>(std::lround(std::clamp(value, -1.0, 1.0) * 32767.0));
         }
       }

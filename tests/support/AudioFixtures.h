@@ -32,7 +32,7 @@ struct ToneSpec {
 };
 
 // Writes a sine tone to `path` (replacing any file there).
-platform::Status writeTone(const std::string& path, const ToneSpec& spec);
+platform::Status writeTone(const std::string& path, const ToneSpec& tone);
 platform::Status writeTone(const std::string& path, double seconds, const std::string& format,
                            int sampleRate = 44100, int channels = 1, double frequencyHz = 440.0,
                            double amplitude = 0.5, M4ALayout layout = M4ALayout::MoovAtEnd);
