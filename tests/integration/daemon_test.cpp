@@ -143,6 +143,8 @@ TEST_F(DaemonTest, QuorvelctlReportsResultsAndErrorsByExitStatus) {
   auto fetched = quorvelctl({"--json", "fetch-exporting"});
   EXPECT_EQ(fetched.status, 0) << fetched.output;
   EXPECT_EQ(fetched.output, "{\"compositionAVURLs\":[]}\n");
+  // Global options may follow the subcommand too.
+  EXPECT_EQ(quorvelctl({"fetch-exporting", "--json"}).output, fetched.output);
 
   auto captured = quorvelctl({"capture", recordings_.string() + "/x.m4a"});
   EXPECT_EQ(captured.status, 1);

@@ -102,6 +102,7 @@ int main(int argc, char** argv) {
   Globals globals;
   CLI::App app{"quorvelctl: talk to the quorveld saved-recordings daemon", "quorvelctl"};
   app.require_subcommand(1);
+  app.fallthrough();  // --json and --bus-address may also follow the subcommand
   app.add_option("--bus-address", globals.busAddress,
                  "D-Bus address of the daemon's bus (default: the session bus)");
   app.add_flag("--json", globals.json, "print results as JSON");
