@@ -10,6 +10,8 @@
 #include <fstream>
 #include <random>
 
+#include "tests/support/TempDirectory.h"
+
 namespace quorvel {
 namespace {
 
@@ -24,21 +26,12 @@ std::string md5sum(const std::string& path) {
   return std::string(buffer, got);
 }
 
-class RCMD5Test : public ::testing::Test {
+class RCMD5Test : public testing::TempDirectoryTest {
  protected:
-  void SetUp() override {
-    dir_ = fs::temp_directory_path() /
-           ("qv-md5-" + std::to_string(::getpid()) + "-" +
-            ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    fs::create_directories(dir_);
-  }
-  void TearDown() override { fs::remove_all(dir_); }
   std::string write(const std::string& name, const std::string& bytes) {
-    const std::string path = (dir_ / name).string();
-    std::ofstream(path, std::ios::binary) << bytes;
-    return path;
+    testing::writeFile(dir_ / name, bytes);
+    return path(name);
   }
-  fs::path dir_;
 };
 
 TEST_F(RCMD5Test, KnownAnswerAndAgreementWithMd5sumAcrossChunkBoundaries) {

@@ -16,6 +16,7 @@ extern "C" {
 
 #include "Quorvel/RCFFmpegLogging.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/TempDirectory.h"
 
 namespace quorvel {
 
@@ -29,11 +30,6 @@ namespace fs = std::filesystem;
 using testing::decodeToPCM;
 using testing::M4ALayout;
 using testing::writeTone;
-
-std::string readFile(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
 
 // What libavformat itself reports, as any other program using it would see.
 std::map<std::string, std::string> libavformatTags(const std::string& path) {
@@ -63,18 +59,8 @@ std::size_t atomPosition(const std::string& bytes, const char* type) {
   return std::string::npos;
 }
 
-class RCMP4AtomsTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    dir_ = fs::temp_directory_path() /
-           ("qv-mp4-" + std::to_string(::getpid()) + "-" +
-            ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    fs::create_directories(dir_);
-  }
-  void TearDown() override { fs::remove_all(dir_); }
-  std::string path(const std::string& name) const { return (dir_ / name).string(); }
-  fs::path dir_;
-};
+using RCMP4AtomsTest = testing::TempDirectoryTest;
+using testing::readFile;
 
 TEST_F(RCMP4AtomsTest, LanguagesSideBySideInBothLayoutsKeepTheAudio) {
   for (M4ALayout layout : {M4ALayout::MoovAtEnd, M4ALayout::MoovFirst}) {

@@ -19,6 +19,7 @@
 #include "Quorvel/RCWaveform.h"
 #include "Quorvel/RCWaveformFile.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/TempDirectory.h"
 
 namespace quorvel {
 namespace {
@@ -37,14 +38,6 @@ void append16(std::vector<std::uint8_t>& out, std::initializer_list<int> values)
     out.push_back(std::uint8_t(v & 0xff));
     out.push_back(std::uint8_t((v >> 8) & 0xff));
   }
-}
-
-void writeBytes(const fs::path& path, const std::string& bytes) {
-  std::ofstream(path, std::ios::binary) << bytes;
-}
-std::string readBytes(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 TEST(RCWaveformFileTest, ReadsHandMadeFilesOfEveryVariant) {
@@ -140,9 +133,9 @@ TEST(RCWaveformFileTest, RejectsDamagedHeadersAndSizesWithoutAllocating) {
   }
 }
 
-TEST(RCWaveformFileTest, RoundTripsThroughFilesAndNamesThemAfterTheAudio) {
-  const fs::path dir = fs::temp_directory_path() / ("qv-waveform-" + std::to_string(::getpid()));
-  fs::create_directories(dir);
+using RCWaveformFilesTest = testing::TempDirectoryTest;
+
+TEST_F(RCWaveformFilesTest, RoundTripsThroughFilesAndNamesThemAfterTheAudio) {
   RCWaveform waveform(48000, 128, 3, 16);
   for (int p = 0; p < 1000; ++p) {
     std::vector<std::int16_t> pixel;
@@ -152,18 +145,16 @@ TEST(RCWaveformFileTest, RoundTripsThroughFilesAndNamesThemAfterTheAudio) {
     }
     waveform.appendPixel(pixel);
   }
-  const auto url = platform::URL::fileURLWithPath((dir / "w.waveform").string());
-  ASSERT_TRUE(RCWriteWaveformFile(waveform, url));
-  auto read = RCReadWaveformFile(url);
+  ASSERT_TRUE(RCWriteWaveformFile(waveform, url("w.waveform")));
+  auto read = RCReadWaveformFile(url("w.waveform"));
   ASSERT_TRUE(read) << read.error();
   EXPECT_EQ(*read, waveform);
   EXPECT_NEAR(read->durationSeconds(), 1000.0 * 128 / 48000, 1e-9);
 
-  EXPECT_FALSE(RCReadWaveformFile(platform::URL::fileURLWithPath((dir / "missing").string())));
-  EXPECT_FALSE(RCReadWaveformFile(platform::URL::fileURLWithPath(dir.string())));
+  EXPECT_FALSE(RCReadWaveformFile(url("missing")));
+  EXPECT_FALSE(RCReadWaveformFile(platform::URL::fileURLWithPath(dir_.string())));
   // Nothing but the file itself is left beside it.
-  EXPECT_EQ(std::distance(fs::directory_iterator(dir), fs::directory_iterator()), 1);
-  fs::remove_all(dir);
+  EXPECT_EQ(std::distance(fs::directory_iterator(dir_), fs::directory_iterator()), 1);
 
   using platform::URL;
   EXPECT_EQ(RCWaveform::waveformURLForAVURL(URL::fileURLWithPath("/r/My Talk.m4a")).path(),
@@ -176,27 +167,7 @@ TEST(RCWaveformFileTest, RoundTripsThroughFilesAndNamesThemAfterTheAudio) {
 
 // --- The data source ---------------------------------------------------------
 
-class WaveformDataSourceTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    dir_ = fs::temp_directory_path() /
-           ("qv-wfsource-" + std::to_string(::getpid()) + "-" +
-            ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    fs::remove_all(dir_);
-    fs::create_directories(dir_);
-  }
-  void TearDown() override { fs::remove_all(dir_); }
-  platform::URL url(const std::string& name) const {
-    return platform::URL::fileURLWithPath((dir_ / name).string());
-  }
-  std::size_t hiddenLeftovers() const {
-    std::size_t count = 0;
-    for (auto& entry : fs::directory_iterator(dir_))
-      if (entry.path().filename().string().starts_with(".")) ++count;
-    return count;
-  }
-  fs::path dir_;
-};
+using WaveformDataSourceTest = testing::TempDirectoryTest;
 
 // Watches a directory for replacements of the file `name`: a hidden temporary
 // file is created and then renamed onto `name`. Writing `name` in place would
@@ -240,7 +211,7 @@ class ReplacementWatch {
 };
 
 TEST_F(WaveformDataSourceTest, SavesAtEveryFlushIntervalAndReplacesTheFileAtTheEnd) {
-  ASSERT_TRUE(writeTone((dir_ / "tone.m4a").string(), 3.0, "m4a", 44100, 1, 441.0, 0.5));
+  ASSERT_TRUE(writeTone(path("tone.m4a"), 3.0, "m4a", 44100, 1, 441.0, 0.5));
   ReplacementWatch watch(dir_, "tone.waveform");
   RCFileInputWaveformDataSource source(url("tone.m4a"), true, 0.5);
   std::vector<double> flushedSeconds;
@@ -274,11 +245,11 @@ TEST_F(WaveformDataSourceTest, SavesAtEveryFlushIntervalAndReplacesTheFileAtTheE
     ASSERT_NEAR(final->max(p, 0), 16384, 2500) << p;
     ASSERT_NEAR(final->min(p, 0), -16384, 2500) << p;
   }
-  EXPECT_EQ(hiddenLeftovers(), 0u);
+  EXPECT_TRUE(hiddenFiles().empty());
 }
 
 TEST_F(WaveformDataSourceTest, ConcurrentSourcesOfOneRecordingNeverExposeAHalfFile) {
-  ASSERT_TRUE(writeTone((dir_ / "shared.m4a").string(), 2.0, "m4a", 44100, 2, 500, 0.5));
+  ASSERT_TRUE(writeTone(path("shared.m4a"), 2.0, "m4a", 44100, 2, 500, 0.5));
   std::vector<std::unique_ptr<RCFileInputWaveformDataSource>> sources;
   for (int i = 0; i < 6; ++i)
     sources.push_back(
@@ -306,7 +277,7 @@ TEST_F(WaveformDataSourceTest, ConcurrentSourcesOfOneRecordingNeverExposeAHalfFi
   auto final = RCReadWaveformFile(RCWaveform::waveformURLForAVURL(url("shared.m4a")));
   ASSERT_TRUE(final);
   EXPECT_EQ(*final, sources.front()->waveform());
-  EXPECT_EQ(hiddenLeftovers(), 0u);
+  EXPECT_TRUE(hiddenFiles().empty());
 }
 
 TEST_F(WaveformDataSourceTest, ComputesEveryFormatAndKeepsItInMemoryWhenNotSaving) {
@@ -319,7 +290,7 @@ TEST_F(WaveformDataSourceTest, ComputesEveryFormatAndKeepsItInMemoryWhenNotSavin
   for (const Case& c : {Case{"a.flac", "flac", 48000, 2}, Case{"b.wav", "wav", 22050, 1},
                         Case{"c.m4a", "m4a", 48000, 2}}) {
     SCOPED_TRACE(c.name);
-    ASSERT_TRUE(writeTone((dir_ / c.name).string(), 1.25, c.format, c.rate, c.channels, 300, 0.25));
+    ASSERT_TRUE(writeTone(path(c.name), 1.25, c.format, c.rate, c.channels, 300, 0.25));
     RCFileInputWaveformDataSource source(url(c.name), false, 0.1);
     int flushes = 0;
     source.setFlushHandler([&](const RCWaveform&) { ++flushes; });
@@ -336,11 +307,10 @@ TEST_F(WaveformDataSourceTest, ComputesEveryFormatAndKeepsItInMemoryWhenNotSavin
 }
 
 TEST_F(WaveformDataSourceTest, ReadsFilesMadeByTheFFmpegTool) {
-  const std::string path = (dir_ / "cli.m4a").string();
   const std::string command =
       "ffmpeg -v error -y -f lavfi -i 'sine=f=1000:d=2:r=48000' -ac 2 "
       "-c:a aac -b:a 96k '" +
-      path + "'";
+      path("cli.m4a") + "'";
   ASSERT_EQ(std::system(command.c_str()), 0);
   RCFileInputWaveformDataSource source(url("cli.m4a"), true, 30.0);
   source.beginLoading();
@@ -352,25 +322,12 @@ TEST_F(WaveformDataSourceTest, ReadsFilesMadeByTheFFmpegTool) {
 }
 
 TEST_F(WaveformDataSourceTest, DamagedOrMissingAudioFailsCleanly) {
-  ASSERT_TRUE(writeTone((dir_ / "good.wav").string(), 2.0, "wav"));
-  ASSERT_TRUE(writeTone((dir_ / "good.m4a").string(), 2.0, "m4a"));
-  writeBytes(dir_ / "empty.m4a", "");
-  writeBytes(dir_ / "text.m4a", "this is not audio, only a note renamed to look like some\n");
-  const std::string wav = readBytes(dir_ / "good.wav");
-  writeBytes(dir_ / "cut.wav", wav.substr(0, wav.size() / 2));  // header declares 2 s
-  const std::string m4a = readBytes(dir_ / "good.m4a");
-  writeBytes(dir_ / "cut.m4a", m4a.substr(0, m4a.size() - 200));  // header at the end is cut
-  testing::ToneSpec faststart{.seconds = 2.0, .layout = testing::M4ALayout::MoovFirst};
-  ASSERT_TRUE(writeTone((dir_ / "first.m4a").string(), faststart));
-  const std::string first = readBytes(dir_ / "first.m4a");
-  writeBytes(dir_ / "cutdata.m4a", first.substr(0, first.size() / 2));  // audio data is cut
-  ASSERT_EQ(std::system(("ffmpeg -v error -y -f lavfi -i testsrc=d=0.5:s=64x64 -c:v mpeg4 '" +
-                         (dir_ / "video.mp4").string() + "'")
-                            .c_str()),
-            0);
+  ASSERT_TRUE(testing::writeDamagedAudio(dir_.string()));
+  ASSERT_TRUE(writeTone(path("good.wav"), 2.0, "wav"));
+  ASSERT_TRUE(writeTone(path("good.m4a"), 2.0, "m4a"));
   fs::create_directories(dir_ / "folder.m4a");
-  for (const char* name : {"missing.m4a", "empty.m4a", "text.m4a", "cut.wav", "cut.m4a",
-                           "cutdata.m4a", "video.mp4", "folder.m4a"}) {
+  for (const char* name :
+       {"missing.m4a", "text.m4a", "cut.wav", "cutdata.m4a", "video.m4a", "folder.m4a"}) {
     SCOPED_TRACE(name);
     RCFileInputWaveformDataSource source(url(name), true, 0.1);
     source.beginLoading();
@@ -378,7 +335,7 @@ TEST_F(WaveformDataSourceTest, DamagedOrMissingAudioFailsCleanly) {
     ASSERT_TRUE(source.error());
     EXPECT_FALSE(fs::exists(source.waveformURL().path()));
   }
-  EXPECT_EQ(hiddenLeftovers(), 0u);
+  EXPECT_TRUE(hiddenFiles().empty());
 
   // Waiting without loading, and dropping a source mid-load, neither hang nor crash.
   RCFileInputWaveformDataSource idle(url("good.wav"), true, 0.1);

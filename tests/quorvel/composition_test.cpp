@@ -3,9 +3,6 @@
 // manifest written back.
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <sstream>
-
 #include "Quorvel/RCComposition.h"
 #include "Quorvel/RCCompositionManifest.h"
 #include "Quorvel/RCError.h"
@@ -17,17 +14,8 @@ namespace {
 namespace fs = std::filesystem;
 using CompositionTest = testing::RecordingsDirectoryTest;
 
-void writeFile(const fs::path& path, const std::string& contents) {
-  fs::create_directories(path.parent_path());
-  std::ofstream(path, std::ios::binary) << contents;
-}
-
-std::string readFile(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
+using testing::readFile;
+using testing::writeFile;
 
 RCCompositionManifest twoFragments() {
   RCCompositionManifest manifest;

@@ -44,13 +44,6 @@ class ScopedEnvironment {
   std::optional<std::string> old_;
 };
 
-std::string fileContents(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
-
 std::shared_ptr<RCSavedRecordingsModel> openModel(const std::string& directory) {
   auto model = RCSavedRecordingsModel::modelWithDirectory(directory);
   EXPECT_TRUE(model) << model.error();
@@ -197,13 +190,13 @@ TEST_F(RecordingsModelTest, UnusableDatabasesAreReportedAndLeftExactlyAsTheyWere
   for (const Case& c : cases) {
     std::filesystem::remove(path);
     c.make();
-    std::string before = fileContents(path);
+    std::string before = testing::readFile(path);
     auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_);
     ASSERT_FALSE(model) << c.name;
     EXPECT_EQ(model.error().domain(), RCErrorDomain) << c.name;
     EXPECT_EQ(model.error().code(), c.expected) << c.name << ": " << model.error();
     EXPECT_NE(model.error().localizedDescription().find("Recordings.db"), std::string::npos);
-    EXPECT_TRUE(fileContents(path) == before) << c.name << ": the file was changed";
+    EXPECT_TRUE(testing::readFile(path) == before) << c.name << ": the file was changed";
     EXPECT_FALSE(std::filesystem::exists(path + "-wal")) << c.name;
   }
   EXPECT_TRUE(logged("ERROR: cannot use the recordings database"));

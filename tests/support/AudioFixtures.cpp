@@ -10,9 +10,13 @@ extern "C" {
 
 #include <algorithm>
 #include <cmath>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
 #include <limits>
 #include <memory>
 #include <numbers>
+#include <tuple>
 
 #include "Quorvel/RCFFmpegLogging.h"
 
@@ -29,28 +33,24 @@ platform::Error ffError(int code, const std::string& what) {
 
 struct OutputContextDeleter {
   void operator()(AVFormatContext* context) const {
-    if (context == nullptr) return;
-    if (context->pb != nullptr && !(context->oformat->flags & AVFMT_NOFILE)) {
+    if (context != nullptr && context->pb != nullptr && !(context->oformat->flags & AVFMT_NOFILE))
       avio_closep(&context->pb);
-    }
     avformat_free_context(context);
   }
 };
-struct InputContextDeleter {
-  void operator()(AVFormatContext* context) const { avformat_close_input(&context); }
+// Deleters for the types FFmpeg frees through a pointer to the pointer.
+template <auto Free>
+struct FreeDeleter {
+  template <typename T>
+  void operator()(T* object) const {
+    Free(&object);
+  }
 };
-struct CodecContextDeleter {
-  void operator()(AVCodecContext* context) const { avcodec_free_context(&context); }
-};
-struct FrameDeleter {
-  void operator()(AVFrame* frame) const { av_frame_free(&frame); }
-};
-struct PacketDeleter {
-  void operator()(AVPacket* packet) const { av_packet_free(&packet); }
-};
-struct SwrDeleter {
-  void operator()(SwrContext* context) const { swr_free(&context); }
-};
+using InputContextDeleter = FreeDeleter<avformat_close_input>;
+using CodecContextDeleter = FreeDeleter<avcodec_free_context>;
+using FrameDeleter = FreeDeleter<av_frame_free>;
+using PacketDeleter = FreeDeleter<av_packet_free>;
+using SwrDeleter = FreeDeleter<swr_free>;
 
 struct FormatChoice {
   const char* muxer;
@@ -86,15 +86,37 @@ platform::Status encodeAndWrite(AVCodecContext* codec, AVFormatContext* output, 
 platform::Status writeTone(const std::string& path, double seconds, const std::string& format,
                            int sampleRate, int channels, double frequencyHz, double amplitude,
                            M4ALayout layout) {
-  ToneSpec tone;
-  tone.seconds = seconds;
-  tone.format = format;
-  tone.sampleRate = sampleRate;
-  tone.channels = channels;
-  tone.frequencyHz = frequencyHz;
-  tone.amplitude = amplitude;
-  tone.layout = layout;
-  return writeTone(path, tone);
+  return writeTone(
+      path, ToneSpec{seconds, format, sampleRate, channels, frequencyHz, amplitude, layout, {}});
+}
+
+platform::Status writeDamagedAudio(const std::string& dir) {
+  namespace fs = std::filesystem;
+  const fs::path at(dir);
+  auto cut = [&](const char* from, const char* to, double keep) {
+    std::ifstream in(at / from, std::ios::binary);
+    const std::string bytes(std::istreambuf_iterator<char>(in), {});
+    std::ofstream(at / to, std::ios::binary) << bytes.substr(0, std::size_t(bytes.size() * keep));
+    fs::remove(at / from);
+  };
+  std::ofstream(at / "empty.m4a").flush();
+  std::ofstream(at / "text.m4a") << "a shopping list renamed to look like audio\n";
+  for (auto [name, format, layout] : {std::tuple{"whole.m4a", "m4a", M4ALayout::MoovAtEnd},
+                                      std::tuple{"first.m4a", "m4a", M4ALayout::MoovFirst},
+                                      std::tuple{"whole.wav", "wav", M4ALayout::MoovAtEnd}}) {
+    if (auto written = writeTone((at / name).string(), 2.0, format, 44100, 1, 440, 0.5, layout);
+        !written)
+      return written;
+  }
+  cut("whole.m4a", "cut.m4a", 2.0 / 3);
+  cut("first.m4a", "cutdata.m4a", 0.5);
+  cut("whole.wav", "cut.wav", 0.5);
+  const std::string video =
+      "ffmpeg -nostdin -v error -y -f lavfi -i color=s=32x32:d=0.5 -c:v mpeg4 -f mp4 '" +
+      (at / "video.m4a").string() + "'";
+  if (std::system(video.c_str()) != 0)
+    return platform::fail(platform::Error(kDomain, -1, "ffmpeg could not write a video"));
+  return {};
 }
 
 platform::Status writeTone(const std::string& path, const ToneSpec& tone) {

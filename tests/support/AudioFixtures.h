@@ -46,6 +46,12 @@ struct DecodedPCM {
   double seconds() const { return sampleRate > 0 ? double(frames()) / sampleRate : 0.0; }
 };
 
+// Writes damaged and non-audio files into `dir`, one per way reading fails:
+// empty.m4a, text.m4a (not audio), cut.m4a (2 s, movie header cut off the
+// end), cutdata.m4a (2 s, header first, half the audio data cut), cut.wav
+// (2 s, header declares more than is there) and video.m4a (no audio stream).
+platform::Status writeDamagedAudio(const std::string& dir);
+
 // Decodes the first audio stream of `path` to interleaved float at the
 // stream's own rate and channel count. Fails for files FFmpeg cannot open or
 // that hold no audio stream.
