@@ -1,14 +1,9 @@
-// The wire contract: error values to D-Bus error replies and back, access
-// tokens through their (siss) tuple, and the interface XML agreeing with the
-// constants the daemon and clients are built from.
+// The wire contract: error values to D-Bus error replies and back, and access
+// tokens through their (siss) tuple.
 #include <gtest/gtest.h>
-
-#include <fstream>
-#include <sstream>
 
 #include "Quorvel/RCError.h"
 #include "Quorvel/RCSSavedRecordingAccessToken.h"
-#include "Quorvel/RCSSavedRecordingServiceConstants.h"
 #include "Quorvel/RCSSavedRecordingServiceErrors.h"
 
 namespace quorvel {
@@ -147,76 +142,6 @@ TEST(AccessTokenTest, DebugDescriptionNamesEveryField) {
        {std::string("trimming"), std::string("exclusive"), std::string("file:///r/a%20b.m4a"),
         token.identifier().string()}) {
     EXPECT_NE(text.find(part), std::string::npos) << text;
-  }
-}
-
-std::string readInterfaceXML() {
-  std::ifstream in(std::string(QUORVEL_SOURCE_DIR) +
-                   "/packaging/org.quorvel.SavedRecordingService1.xml");
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
-
-// The method's element, from "<method name=..." to its end.
-std::string methodElement(const std::string& xml, const std::string& name) {
-  std::size_t start = xml.find("<method name=\"" + name + "\"");
-  if (start == std::string::npos) return {};
-  std::size_t selfClosed = xml.find("/>", start);
-  std::size_t open = xml.find('>', start);
-  if (selfClosed != std::string::npos && selfClosed + 1 == open) {
-    return xml.substr(start, selfClosed + 2 - start);
-  }
-  return xml.substr(start, xml.find("</method>", start) - start);
-}
-
-TEST(InterfaceXMLTest, DeclaresEveryMethodErrorAndTheSignalOfTheConstants) {
-  std::string xml = readInterfaceXML();
-  ASSERT_FALSE(xml.empty());
-  EXPECT_NE(xml.find(std::string("<interface name=\"") + RCSSavedRecordingServiceInterfaceName),
-            std::string::npos);
-  EXPECT_NE(
-      xml.find(std::string("<signal name=\"") +
-               RCSavedRecordingServiceDidChangeExportingCompositionAVURLsDistributedNotification),
-      std::string::npos);
-  EXPECT_NE(xml.find(RCSSavedRecordingServiceObjectPath), std::string::npos);
-  EXPECT_NE(xml.find(RCSSavedRecordingServiceMachServiceName), std::string::npos);
-
-  struct Method {
-    const char* name;
-    const char* signatureIn;
-    const char* signatureOut;
-    bool noReply;
-  };
-  for (Method m : {Method{RCSMethodPrepareToCapture, "s", "(siss)", false},
-                   Method{RCSMethodPrepareToPreview, "s", "(siss)", false},
-                   Method{RCSMethodPrepareToExport, "sb", "(siss)", false},
-                   Method{RCSMethodPrepareToTrim, "s", "(siss)", false},
-                   Method{RCSMethodEndAccessSession, "(siss)", "", true},
-                   Method{RCSMethodDisableOrphanedFragmentCleanup, "s", "", false},
-                   Method{RCSMethodEnableOrphanedFragmentCleanup, "s", "", true},
-                   Method{RCSMethodDisableOrphanHandling, "", "", false},
-                   Method{RCSMethodEnableOrphanHandling, "", "", false},
-                   Method{RCSMethodFetchExportingCompositionAVURLs, "", "as", false}}) {
-    std::string element = methodElement(xml, m.name);
-    ASSERT_FALSE(element.empty()) << m.name;
-    std::string in, out;
-    for (std::size_t at = element.find("<arg "); at != std::string::npos;
-         at = element.find("<arg ", at + 1)) {
-      std::string arg = element.substr(at, element.find("/>", at) - at);
-      std::size_t type = arg.find("type=\"") + 6;
-      std::string signature = arg.substr(type, arg.find('"', type) - type);
-      (arg.find("direction=\"out\"") != std::string::npos ? out : in) += signature;
-    }
-    EXPECT_EQ(in, m.signatureIn) << m.name;
-    EXPECT_EQ(out, m.signatureOut) << m.name;
-    EXPECT_EQ(element.find("org.freedesktop.DBus.Method.NoReply") != std::string::npos, m.noReply)
-        << m.name;
-  }
-  for (const char* name : {RCSDBusErrorMissingCompositionAVURL, RCSDBusErrorConflictingSession,
-                           RCSDBusErrorDeferredRequestSuperseded, RCSDBusErrorCompositionFailed,
-                           RCSDBusErrorGeneric}) {
-    EXPECT_NE(methodElement(xml, RCSMethodPrepareToExport).find(name), std::string::npos) << name;
   }
 }
 

@@ -1,6 +1,7 @@
 // The interface the daemon publishes is the one the packaged XML documents:
 // the same methods, in the same order, with the same arguments, reply
-// arguments and no-reply annotations, and the same signal.
+// arguments and no-reply annotations, the same signal, and the service's
+// object path, bus name and error names.
 #include <gtest/gtest.h>
 
 #include <fstream>
@@ -10,6 +11,8 @@
 #include <vector>
 
 #include "Quorvel/RCSSavedRecordingServiceConnection.h"
+#include "Quorvel/RCSSavedRecordingServiceConstants.h"
+#include "Quorvel/RCSSavedRecordingServiceErrors.h"
 
 namespace quorvel {
 namespace {
@@ -21,13 +24,7 @@ struct XmlMethod {
   bool noReply = false;
 };
 
-std::vector<XmlMethod> methodsInPackagedXML(std::vector<std::string>& signals) {
-  std::ifstream file(std::string(QUORVEL_SOURCE_DIR) +
-                     "/packaging/org.quorvel.SavedRecordingService1.xml");
-  std::stringstream text;
-  text << file.rdbuf();
-  std::string xml = std::regex_replace(text.str(), std::regex("<!--[\\s\\S]*?-->"), "");
-
+std::vector<XmlMethod> methodsInXML(const std::string& xml, std::vector<std::string>& signals) {
   std::vector<XmlMethod> methods;
   std::regex element(R"re(<method name="(\w+)"\s*(/>|>([\s\S]*?)</method>))re");
   std::regex arg(R"re(<arg name="(\w+)" type="([^"]+)" direction="(in|out)"/>)re");
@@ -43,15 +40,20 @@ std::vector<XmlMethod> methodsInPackagedXML(std::vector<std::string>& signals) {
     methods.push_back(method);
   }
   std::regex signal(R"re(<signal name="(\w+)")re");
-      for (std::sregex_iterator it(xml.begin(), xml.end(), signal), end; it != end; ++it) {
+  for (std::sregex_iterator it(xml.begin(), xml.end(), signal), end; it != end; ++it) {
     signals.push_back((*it)[1]);
   }
   return methods;
 }
 
 TEST(ServiceInterfaceTest, PublishedInterfaceMatchesThePackagedContract) {
+  std::ifstream file(std::string(QUORVEL_SOURCE_DIR) +
+                     "/packaging/org.quorvel.SavedRecordingService1.xml");
+  std::stringstream text;
+  text << file.rdbuf();
+  const std::string xml = std::regex_replace(text.str(), std::regex("<!--[\\s\\S]*?-->"), "");
   std::vector<std::string> signals;
-  auto documented = methodsInPackagedXML(signals);
+  auto documented = methodsInXML(xml, signals);
   auto published = RCSSavedRecordingServiceConnection::serviceInterface();
 
   EXPECT_EQ(published.name, "org.quorvel.SavedRecordingService1");
@@ -70,6 +72,13 @@ TEST(ServiceInterfaceTest, PublishedInterfaceMatchesThePackagedContract) {
   }
   ASSERT_EQ(published.signals.size(), 1u);
   EXPECT_EQ(signals, std::vector<std::string>{published.signals[0].name});
+  EXPECT_NE(xml.find(RCSSavedRecordingServiceObjectPath), std::string::npos);
+  EXPECT_NE(xml.find(RCSSavedRecordingServiceMachServiceName), std::string::npos);
+  for (const char* name : {RCSDBusErrorMissingCompositionAVURL, RCSDBusErrorConflictingSession,
+                           RCSDBusErrorDeferredRequestSuperseded, RCSDBusErrorCompositionFailed,
+                           RCSDBusErrorGeneric}) {
+    EXPECT_NE(xml.find(name), std::string::npos) << name;
+  }
 }
 
 }  // namespace
