@@ -87,16 +87,6 @@ TEST_F(LocalListenerTest, DeliversWithCurrentConnectionAndAcceptsOncePerPeer) {
   EXPECT_EQ(listener.connectionCount(), 2u);
 }
 
-TEST_F(LocalListenerTest, StandardErrorsWithoutReachingTheDelegate) {
-  auto unknown = listener.deliver(":1.1", "Nope");
-  auto wrong = listener.deliver(":1.1", "Echo", {std::int32_t{1}});
-  auto missing = listener.deliver(":1.1", "Echo");
-  EXPECT_EQ(unknown->errorName(), kBusErrorUnknownMethod);
-  EXPECT_EQ(wrong->errorName(), kBusErrorInvalidArgs);
-  EXPECT_EQ(missing->errorName(), kBusErrorInvalidArgs);
-  EXPECT_EQ(delegate.asked, 0);
-}
-
 TEST_F(LocalListenerTest, RepliesOnceFromAnyThreadAndDroppedCallsAnswerWithAnError) {
   auto held = listener.deliver(":1.1", "Hold");
   auto dropped = listener.deliver(":1.1", "Hold");

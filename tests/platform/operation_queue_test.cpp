@@ -8,7 +8,7 @@
 
 #include <algorithm>
 #include <atomic>
-#include <condition_variable>
+#include <latch>
 #include <mutex>
 #include <random>
 #include <thread>
@@ -21,46 +21,22 @@ namespace {
 class Counter {
  public:
   void increment() {
-    {
-      std::lock_guard lock(mutex_);
-      ++count_;
-    }
-    changed_.notify_all();
+    ++count_;
+    count_.notify_all();
   }
   void waitFor(int atLeast) {
-    std::unique_lock lock(mutex_);
-    changed_.wait(lock, [&] { return count_ >= atLeast; });
+    for (int now = count_.load(); now < atLeast; now = count_.load()) count_.wait(now);
   }
-  int value() {
-    std::lock_guard lock(mutex_);
-    return count_;
-  }
+  int value() const { return count_.load(); }
 
  private:
-  std::mutex mutex_;
-  std::condition_variable changed_;
-  int count_ = 0;
+  std::atomic<int> count_{0};
 };
 
 // A gate that blocked operations wait at until the test opens it.
-class Gate {
- public:
-  void open() {
-    {
-      std::lock_guard lock(mutex_);
-      open_ = true;
-    }
-    opened_.notify_all();
-  }
-  void wait() {
-    std::unique_lock lock(mutex_);
-    opened_.wait(lock, [&] { return open_; });
-  }
-
- private:
-  std::mutex mutex_;
-  std::condition_variable opened_;
-  bool open_ = false;
+struct Gate : std::latch {
+  Gate() : std::latch(1) {}
+  void open() { count_down(); }
 };
 
 // Records its start, then blocks until its gate opens.

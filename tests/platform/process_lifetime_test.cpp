@@ -114,30 +114,5 @@ TEST_F(ProcessLifetimeTest, AHandlerMayBeginAgain) {
   EXPECT_TRUE(lifetime_.isInTransaction());
 }
 
-TEST(ProcessLifetimeSingletonTest, InstanceIsOneObject) {
-  EXPECT_EQ(&ProcessLifetime::instance(), &ProcessLifetime::instance());
-}
-
-#if defined(QUORVEL_DCHECK_IS_ON)
-TEST(ProcessLifetimeDeathTest, BeginAndEndMustAlternate) {
-  GTEST_FLAG_SET(death_test_style, "threadsafe");
-  ManualClock clock;
-  MainQueue queue(clock);
-  EXPECT_DEATH(
-      {
-        ProcessLifetime lifetime(queue);
-        lifetime.endTransaction();
-      },
-      "endTransaction called without a root transaction");
-  EXPECT_DEATH(
-      {
-        ProcessLifetime lifetime(queue);
-        lifetime.beginTransaction();
-        lifetime.beginTransaction();
-      },
-      "already held");
-}
-#endif
-
 }  // namespace
 }  // namespace platform

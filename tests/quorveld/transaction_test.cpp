@@ -109,20 +109,6 @@ TEST_F(TransactionTest, DroppingTheLastReferenceEndsTheTransactionAndTheRoot) {
   EXPECT_EQ(lines[0], "[RCSXPCTransaction] Deactivating XPC transaction: " + description);
 }
 
-TEST_F(TransactionTest, ActiveTransactionsIsASnapshot) {
-  auto a = RCSXPCTransaction::initWithName("a");
-  auto b = RCSXPCTransaction::initWithName("b");
-  a->beginTransaction();
-  b->beginTransaction();
-  auto snapshot = RCSXPCTransaction::activeTransactions();
-  EXPECT_EQ(snapshot.size(), 2u);
-  snapshot.clear();
-  EXPECT_EQ(RCSXPCTransaction::activeTransactions().size(), 2u);
-  a->endTransaction();
-  EXPECT_EQ(RCSXPCTransaction::activeTransactions().size(), 1u);
-  b->endTransaction();
-}
-
 TEST_F(TransactionTest, ScheduledEndRunsOnTheMainQueueEvenAfterAnEarlierEnd) {
   auto transaction = RCSXPCTransaction::initWithName("scheduled");
   transaction->beginTransaction();
