@@ -7,6 +7,7 @@
 
 #include "platform/Log.h"
 #include "platform/MainQueue.h"
+#include "quorveld/RCSAdditions.h"
 #include "quorveld/RCSXPCTransaction.h"
 #include "quorveld/SavedRecordingService.h"
 
@@ -28,7 +29,7 @@ bool SavedRecordingService::shouldAcceptNewConnection(
   // every method, so the exported object and interfaces need no setting
   // per connection; every call of this peer reaches
   // connectionHandleInvocation().
-  newConnection->setValid(true);
+  rcs_setValid(*newConnection, true);
 
   std::weak_ptr<platform::Connection> weakConnection = newConnection;
   std::weak_ptr<SavedRecordingService> weakService = weak_from_this();
@@ -65,7 +66,7 @@ void SavedRecordingService::_performOnServiceQueue(WorkBlock block) {
 void SavedRecordingService::_handleXPCDisconnect(
     const std::shared_ptr<platform::Connection>& connection) {
   _performOnServiceQueue([connection] {
-    connection->setValid(false);
+    rcs_setValid(*connection, false);
     // Sessions and fragment-cleanup holds of the connection are released
     // here once the daemon keeps them.
   });

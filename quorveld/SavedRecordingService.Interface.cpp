@@ -11,6 +11,7 @@
 #include "Quorvel/RCSSavedRecordingServiceErrors.h"
 #include "platform/Log.h"
 #include "platform/dbus/Connection.h"
+#include "quorveld/RCSAdditions.h"
 #include "quorveld/SavedRecordingService.h"
 
 namespace quorvel {
@@ -32,7 +33,7 @@ void logNotSupported(const char* selector) {
 }  // namespace
 
 void SavedRecordingService::_logMissingParameter(const char* parameter, const char* selector) {
-  auto connection = platform::Connection::current();
+  auto connection = rcs_currentConnection();
   QV_LOG(platform::kLogLevelError,
          "ERROR: received invalid message on connection {}.  {} parameter is required for "
          "invocations of -{}",

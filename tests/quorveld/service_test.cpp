@@ -17,6 +17,7 @@
 #include "platform/NotificationCenter.h"
 #include "platform/ProcessLifetime.h"
 #include "platform/dbus/LocalListener.h"
+#include "quorveld/RCSAdditions.h"
 #include "quorveld/RCSXPCTransactionController.h"
 #include "quorveld/SavedRecordingService.h"
 
@@ -172,12 +173,12 @@ TEST_F(ServiceTest, ConnectionsAreAcceptedOnceAndEndedByVanishingOrLosingTheBus)
   EXPECT_FALSE(call(":1.1", "FetchExportingCompositionAVURLs")->isError());
   auto connection = listener_->connection(":1.1");
   ASSERT_TRUE(connection);
-  EXPECT_TRUE(connection->isValid());
+  EXPECT_TRUE(rcs_isValid(*connection));
   EXPECT_EQ(linesContaining("Listener accepted new connection <connection :1.1>").size(), 1u);
 
   listener_->vanish(":1.1");
   drainServiceQueue();
-  EXPECT_FALSE(connection->isValid());
+  EXPECT_FALSE(rcs_isValid(*connection));
   auto invalidated = linesContaining("Connection invalidated: <connection :1.1>");
   ASSERT_EQ(invalidated.size(), 1u);
 
@@ -185,13 +186,27 @@ TEST_F(ServiceTest, ConnectionsAreAcceptedOnceAndEndedByVanishingOrLosingTheBus)
   auto second = listener_->connection(":1.2");
   listener_->loseBus();
   drainServiceQueue();
-  EXPECT_FALSE(second->isValid());
+  EXPECT_FALSE(rcs_isValid(*second));
   EXPECT_EQ(linesContaining("Connection interrupted: <connection :1.2>").size(), 1u);
   for (const auto& line : lines()) {
     if (line.text.find("Connection in") != std::string::npos) {
       EXPECT_EQ(line.level, 4);
     }
   }
+}
+
+TEST(RCSAdditionsTest, FlagUserInfoAndCurrentConnection) {
+  auto connection = platform::Connection::createForListener(":1.77");
+  EXPECT_FALSE(rcs_isValid(*connection));  // never went through the listener
+  EXPECT_FALSE(rc_userInfoForKey(*connection, "disabledOrphanedFragmentCleanupAVURLs").has_value());
+  rc_setUserInfo(*connection, std::any(), "key");  // nothing to remove: creates nothing
+  EXPECT_FALSE(connection->hasUserInfoDictionary());
+  rc_setUserInfo(*connection, std::any(3), "key");
+  EXPECT_EQ(std::any_cast<int>(rc_userInfoForKey(*connection, "key")), 3);
+  rc_setUserInfo(*connection, std::any(), "key");
+  EXPECT_FALSE(rc_userInfoForKey(*connection, "key").has_value());
+  EXPECT_TRUE(connection->hasUserInfoDictionary());  // emptied, not removed
+  EXPECT_EQ(rcs_currentConnection(), nullptr);       // outside a delivery
 }
 
 TEST_F(ServiceTest, PrepareRequestsCheckTheReplyBeforeTheURL) {
