@@ -19,12 +19,15 @@ platform::InterfaceDescription RCSSavedRecordingServiceConnection::serviceInterf
       .name = RCSSavedRecordingServiceInterfaceName,
       .methods =
           {
-              method(RCSMethodPrepareToCapture, "s", {"compositionAVURL"}, "(siss)", {"accessToken"}),
-              method(RCSMethodPrepareToPreview, "s", {"compositionAVURL"}, "(siss)", {"accessToken"}),
+              method(RCSMethodPrepareToCapture, "s", {"compositionAVURL"}, "(siss)",
+                     {"accessToken"}),
+              method(RCSMethodPrepareToPreview, "s", {"compositionAVURL"}, "(siss)",
+                     {"accessToken"}),
               method(RCSMethodPrepareToExport, "sb", {"compositionAVURL", "cacheWaveform"},
                      "(siss)", {"accessToken"}),
               method(RCSMethodPrepareToTrim, "s", {"compositionAVURL"}, "(siss)", {"accessToken"}),
-              method(RCSMethodEndAccessSession, "(siss)", {"accessToken"}, "", {}, /*noReply=*/true),
+              method(RCSMethodEndAccessSession, "(siss)", {"accessToken"}, "", {},
+                     /*noReply=*/true),
               method(RCSMethodDisableOrphanedFragmentCleanup, "s", {"compositionAVURL"}, "", {}),
               method(RCSMethodEnableOrphanedFragmentCleanup, "s", {"compositionAVURL"}, "", {},
                      /*noReply=*/true),

@@ -177,8 +177,8 @@ Status BusListener::resume() {
       bool named = !declared.inputNames.empty() || !declared.outputNames.empty();
       if (named) {
         core_->object->registerMethod(interface.name, declared.name, declared.inputSignature,
-                                      declared.inputNames, declared.outputSignature, declared.outputNames,
-                                      std::move(callback), flags);
+                                      declared.inputNames, declared.outputSignature,
+                                      declared.outputNames, std::move(callback), flags);
       } else {
         core_->object->registerMethod(interface.name, declared.name, declared.inputSignature,
                                       declared.outputSignature, std::move(callback), flags);
