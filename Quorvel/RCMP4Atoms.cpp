@@ -614,9 +614,16 @@ platform::Result<std::vector<std::uint8_t>> RCMP4MovieWithTitle(View movieAtom,
   return out;
 }
 
-platform::Result<std::vector<std::uint8_t>> RCMP4FileImageWithTitle(View file,
-                                                                    std::string_view title,
-                                                                    std::string_view language) {
+namespace {
+
+// The movie atom of an in-memory file image: where it stands, and a copy of
+// its bytes with a to-the-end size (0) made explicit.
+struct MovieInImage {
+  RCMP4Atom atom;
+  Bytes movie;
+};
+
+platform::Result<MovieInImage> movieInFileImage(View file) {
   auto atoms = RCMP4TopLevelAtoms(
       file.size(), [file](std::uint64_t offset, std::size_t size, std::uint8_t* out) {
         if (offset > file.size() || size > file.size() - offset) return false;
@@ -629,32 +636,31 @@ platform::Result<std::vector<std::uint8_t>> RCMP4FileImageWithTitle(View file,
     Bytes movie(file.begin() + std::ptrdiff_t(atom.offset),
                 file.begin() + std::ptrdiff_t(atom.offset + atom.size));
     if (be32(movie.data()) == 0) storeBE32(movie.data(), std::uint32_t(movie.size()));
-    auto rewritten = RCMP4MovieWithTitle(movie, atom.offset, title, language);
-    if (!rewritten) return platform::fail(rewritten.error());
-    Bytes out(file.begin(), file.begin() + std::ptrdiff_t(atom.offset));
-    out.insert(out.end(), rewritten->begin(), rewritten->end());
-    out.insert(out.end(), file.begin() + std::ptrdiff_t(atom.offset + atom.size), file.end());
-    return out;
+    return MovieInImage{atom, std::move(movie)};
   }
   return platform::fail(mp4Error(kRCMP4ErrorNoMovie, "no movie atom"));
 }
 
+}  // namespace
+
+platform::Result<std::vector<std::uint8_t>> RCMP4FileImageWithTitle(View file,
+                                                                    std::string_view title,
+                                                                    std::string_view language) {
+  auto found = movieInFileImage(file);
+  if (!found) return platform::fail(found.error());
+  const RCMP4Atom& atom = found->atom;
+  auto rewritten = RCMP4MovieWithTitle(found->movie, atom.offset, title, language);
+  if (!rewritten) return platform::fail(rewritten.error());
+  Bytes out(file.begin(), file.begin() + std::ptrdiff_t(atom.offset));
+  out.insert(out.end(), rewritten->begin(), rewritten->end());
+  out.insert(out.end(), file.begin() + std::ptrdiff_t(atom.offset + atom.size), file.end());
+  return out;
+}
+
 platform::Result<std::vector<RCMetadataItem>> RCMP4TitleItemsInFileImage(View file) {
-  auto atoms = RCMP4TopLevelAtoms(
-      file.size(), [file](std::uint64_t offset, std::size_t size, std::uint8_t* out) {
-        if (offset > file.size() || size > file.size() - offset) return false;
-        std::memcpy(out, file.data() + offset, size);
-        return true;
-      });
-  if (!atoms) return platform::fail(atoms.error());
-  for (const RCMP4Atom& atom : *atoms) {
-    if (atom.type != "moov") continue;
-    Bytes movie(file.begin() + std::ptrdiff_t(atom.offset),
-                file.begin() + std::ptrdiff_t(atom.offset + atom.size));
-    if (be32(movie.data()) == 0) storeBE32(movie.data(), std::uint32_t(movie.size()));
-    return RCMP4TitleItemsInMovie(movie);
-  }
-  return platform::fail(mp4Error(kRCMP4ErrorNoMovie, "no movie atom"));
+  auto found = movieInFileImage(file);
+  if (!found) return platform::fail(found.error());
+  return RCMP4TitleItemsInMovie(found->movie);
 }
 
 platform::Result<std::vector<RCMetadataItem>> RCMP4ReadTitleItems(const std::string& path) {
