@@ -63,12 +63,24 @@ int main(int argc, char** argv) {
                  "${XDG_DATA_HOME:-~/.local/share}/quorvel/Recordings)");
   app.add_option("--idle-exit-after", options.idleExitAfter,
                  "seconds without open work before exiting; 0 = never")
-      ->check(CLI::NonNegativeNumber)
+      ->check(CLI::Validator(
+          [](std::string& value) -> std::string {
+            try {
+              if (std::stod(value) >= 0) return {};
+            } catch (const std::exception&) {
+            }
+            return "must be a number of seconds, 0 or more";
+          },
+          "SECONDS"))
       ->capture_default_str();
   app.add_flag("--verbose", options.verbose, "log tracing (level 7) too");
   app.add_flag("--info", options.info, "print the embedded process information and exit");
   app.add_flag("--version", options.version, "print the version and exit");
-  CLI11_PARSE(app, argc, argv);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& error) {
+    return app.exit(error) == 0 ? 0 : 2;  // --help, or a usage error
+  }
 
   const quorvel::ProcessInfo& info = quorvel::embeddedProcessInfo();
   if (options.info) {

@@ -171,6 +171,21 @@ TEST_F(DaemonTest, DebugSignalDumpsWithoutEndingTheProcess) {
   EXPECT_EQ(fetched.status, 0) << fetched.output << daemon->output();
 }
 
+TEST_F(DaemonTest, BadOptionsExitWithUsageStatusAndAMessage) {
+  for (const char* idle : {"-3", "soon"}) {
+    DaemonProcess daemon({"--bus-address", bus_.address(), "--idle-exit-after", idle});
+    EXPECT_EQ(daemon.waitForExit(), 2);
+    EXPECT_NE(daemon.output().find("--idle-exit-after: must be a number of seconds, 0 or more"),
+              std::string::npos)
+        << daemon.output();
+  }
+  auto info = DaemonProcess::run({DaemonProcess::programPath("quorveld"), "--info"});
+  EXPECT_EQ(info.status, 0);
+  EXPECT_NE(info.output.find("\"LSEnvironment\": {\"SQLITE_AUTO_TRACE\": \"1\"}"),
+            std::string::npos)
+      << info.output;
+}
+
 TEST_F(DaemonTest, ExitsByItselfOnceIdleAndASecondDaemonIsRefused) {
   auto daemon = startDaemon("1");
   // A second daemon cannot own the name: a clear message and status 1.
