@@ -19,8 +19,8 @@ extern "C" {
 #include <libavformat/avformat.h>
 }
 
-#include "Quorvel/RCAudioDecoder.h"
-#include "Quorvel/RCComposer.h"
+#include "Quorvel/media/RCAudioDecoder.h"
+#include "Quorvel/media/RCComposer.h"
 
 namespace fs = std::filesystem;
 

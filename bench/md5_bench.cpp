@@ -14,7 +14,7 @@
 #include <string>
 #include <vector>
 
-#include "Quorvel/RCMD5.h"
+#include "Quorvel/files/RCMD5.h"
 
 namespace {
 

@@ -9,7 +9,7 @@
 #include <functional>
 #include <string>
 
-#include "Quorvel/RCFileInputWaveformDataSource.h"
+#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 
 namespace fs = std::filesystem;
 

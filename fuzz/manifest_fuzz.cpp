@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <string_view>
 
-#include "Quorvel/RCCompositionManifest.h"
+#include "Quorvel/composition/RCCompositionManifest.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   std::string_view text(reinterpret_cast<const char*>(data), size);

@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <span>
 
-#include "Quorvel/RCWaveformFile.h"
+#include "Quorvel/waveform/RCWaveformFile.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   auto parsed = quorvel::RCDecodeWaveformFile(std::span<const std::uint8_t>(data, size));

@@ -11,7 +11,7 @@
 #include <memory>
 #include <string>
 
-#include "Quorvel/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "platform/URL.h"
 #include "platform/dbus/Connection.h"
 #include "quorveld/RCSXPCTransaction.h"

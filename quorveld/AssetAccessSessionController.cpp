@@ -12,9 +12,9 @@
 #include <algorithm>
 #include <cstdio>
 
-#include "Quorvel/RCComposition.h"
-#include "Quorvel/RCCompositionController.h"
-#include "Quorvel/RCSSavedRecordingServiceErrors.h"
+#include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/composition/RCCompositionController.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 
 namespace quorvel {
 

@@ -19,7 +19,7 @@
 #include <unordered_map>
 #include <vector>
 
-#include "Quorvel/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "platform/Error.h"
 #include "platform/SerialQueue.h"
 #include "platform/URL.h"

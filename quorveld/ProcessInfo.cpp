@@ -3,7 +3,7 @@
 #include <fmt/format.h>
 #include <stdlib.h>
 
-#include "Quorvel/RCSSavedRecordingServiceConstants.h"
+#include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 
 namespace quorvel {
 

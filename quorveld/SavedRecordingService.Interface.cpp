@@ -8,7 +8,7 @@
 // dropped.
 #include <fmt/format.h>
 
-#include "Quorvel/RCSSavedRecordingServiceErrors.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "platform/Log.h"
 #include "platform/dbus/Connection.h"
 #include "quorveld/RCSAdditions.h"

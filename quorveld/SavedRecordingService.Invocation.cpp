@@ -9,9 +9,9 @@
 // queue, no filtering.
 #include <fmt/format.h>
 
-#include "Quorvel/RCSSavedRecordingServiceConnection.h"
-#include "Quorvel/RCSSavedRecordingServiceConstants.h"
-#include "Quorvel/RCSSavedRecordingServiceErrors.h"
+#include "Quorvel/service/RCSSavedRecordingServiceConnection.h"
+#include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "platform/Log.h"
 #include "platform/MainQueue.h"
 #include "quorveld/SavedRecordingService.h"

@@ -15,7 +15,7 @@
 #include <csignal>
 #include <mutex>
 
-#include "Quorvel/RCSSavedRecordingServiceConstants.h"
+#include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "platform/GlobalQueue.h"
 #include "platform/Log.h"
 #include "platform/MainQueue.h"

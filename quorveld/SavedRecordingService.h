@@ -28,7 +28,7 @@
 #include <unordered_set>
 #include <vector>
 
-#include "Quorvel/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "platform/Error.h"
 #include "platform/SerialQueue.h"
 #include "platform/SignalSource.h"

@@ -11,8 +11,8 @@
 #include <filesystem>
 #include <string>
 
-#include "Quorvel/RCSSavedRecordingServiceConstants.h"
-#include "Quorvel/RCSavedRecordingsModel.h"
+#include "Quorvel/database/RCSavedRecordingsModel.h"
+#include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "platform/Log.h"
 #include "platform/MainQueue.h"
 #include "platform/ProcessLifetime.h"

@@ -7,7 +7,7 @@
 #include <filesystem>
 #include <string>
 
-#include "Quorvel/SavedRecordingServiceClient.h"
+#include "Quorvel/service/SavedRecordingServiceClient.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/TestBus.h"
 

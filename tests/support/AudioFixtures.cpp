@@ -18,7 +18,7 @@ extern "C" {
 #include <numbers>
 #include <tuple>
 
-#include "Quorvel/RCFFmpegLogging.h"
+#include "Quorvel/media/RCFFmpegLogging.h"
 
 namespace quorvel::testing {
 namespace {

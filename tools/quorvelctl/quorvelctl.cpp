@@ -24,8 +24,8 @@
 #include <string>
 #include <vector>
 
-#include "Quorvel/RCSSavedRecordingAccessToken.h"
-#include "Quorvel/SavedRecordingServiceClient.h"
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/SavedRecordingServiceClient.h"
 
 namespace {
 

@@ -1,0 +1,229 @@
+// Repair and composing of one composition.
+//
+// The manifest is the record of what the recording is made of; the fragment
+// files may lag behind it (a capture writes its fragment's entry before its
+// first audio byte) or have lost files (deleted by hand, a crash between a
+// manifest write and a removal). Repair reconciles the two without ever
+// giving up audio that is still on disk: only entries whose files are gone
+// or empty are dropped, and a file that exists but cannot be read keeps its
+// entry, so composing fails loudly rather than leaving the audio out.
+//
+// When every remaining fragment was composed but some composed fragment's
+// file is gone, the composed file is the only complete copy of the audio:
+// the manifest then drops its fragments and the composed file stands for the
+// whole recording (its duration read from it).
+//
+// Composing writes the composed file first (the composer replaces it
+// atomically), then the manifest that says the fragments are composed. A
+// crash in between leaves fragments marked decomposed beside an up-to-date
+// composed file, which the next finalization simply composes again.
+#include "Quorvel/composition/RCCompositionController.h"
+
+#include <sys/stat.h>
+
+#include <cmath>
+
+#include "Quorvel/composition/RCCaptureFormat.h"
+#include "Quorvel/errors/RCError.h"
+#include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/media/RCAudioAsset.h"
+#include "Quorvel/media/RCComposer.h"
+#include "Quorvel/waveform/RCWaveform.h"
+#include "platform/GlobalQueue.h"
+#include "platform/Log.h"
+
+namespace quorvel {
+namespace {
+
+// Durations closer than this are the same duration.
+constexpr double kDurationTolerance = 0.001;
+
+enum class FileState { Missing, Empty, Present };
+
+FileState fileState(const platform::URL& url) {
+  struct stat info {};
+  if (::lstat(url.path().c_str(), &info) != 0) return FileState::Missing;
+  if (S_ISREG(info.st_mode) && info.st_size == 0) return FileState::Empty;
+  return FileState::Present;
+}
+
+// The file's duration in seconds; NaN when it cannot be read.
+double fileDuration(const platform::URL& url) {
+  auto asset = RCAudioAsset::assetWithURL(url);
+  return asset ? asset->duration() : std::nan("");
+}
+
+RCCompositionManifest repairedManifest(const RCComposition& composition) {
+  RCCompositionManifest manifest = composition.manifest();
+  std::vector<RCCompositionManifestFragment> kept;
+  bool lostComposedAudio = false;
+  for (RCCompositionManifestFragment entry : manifest.fragments) {
+    platform::URL url = composition.URLForFragmentFile(entry.file);
+    FileState state = fileState(url);
+    if (state != FileState::Present) {
+      QV_LOG(platform::kLogLevelNotice, "NOTE: dropping fragment '{}' of {}: its file is {}",
+             entry.file, composition.bundleURL().lastPathComponent(),
+             state == FileState::Missing ? "gone" : "empty");
+      lostComposedAudio = lostComposedAudio || entry.composed;
+      continue;
+    }
+    double duration = fileDuration(url);
+    if (std::isfinite(duration)) {
+      double available = std::max(0.0, duration - entry.contentStart);
+      if (!entry.contentDuration) {
+        entry.contentDuration = available;
+        entry.composed = false;
+      } else if (*entry.contentDuration > available + kDurationTolerance) {
+        entry.contentDuration = available;
+        entry.composed = false;
+      }
+    } else {
+      QV_LOG(platform::kLogLevelError,
+             "WARNING: fragment '{}' of {} cannot be read; keeping it so composing reports it",
+             entry.file, composition.bundleURL().lastPathComponent());
+    }
+    kept.push_back(std::move(entry));
+  }
+  bool allComposed = true;
+  for (const auto& entry : kept) allComposed = allComposed && entry.composed;
+  if (lostComposedAudio && allComposed) kept.clear();
+  bool hadFragments = !manifest.fragments.empty();
+  manifest.fragments = std::move(kept);
+  manifest.recomputeTimeRanges();
+  if (manifest.fragments.empty() && hadFragments) {
+    platform::URL composed = composition.composedAVURL();
+    if (fileState(composed) == FileState::Missing) {
+      manifest.composedDuration = 0;
+    } else if (double duration = fileDuration(composed); std::isfinite(duration)) {
+      manifest.composedDuration = duration;
+    }
+  }
+  return manifest;
+}
+
+}  // namespace
+
+RCCompositionController::RCCompositionController(std::shared_ptr<RCComposition> composition)
+    : state_(std::make_shared<State>()) {
+  state_->composition = std::move(composition);
+}
+
+std::shared_ptr<RCCompositionController>
+RCCompositionController::compositionControllerForComposedAVURL(const platform::URL& composedAVURL) {
+  std::string directory = RCSavedRecordingsDirectory();
+  std::shared_ptr<RCComposition> composition;
+  if (!RCIsURLDirectlyInsideDirectory(composedAVURL, directory)) {
+    QV_LOG(platform::kLogLevelError,
+           "ERROR: no composition for '{}': it is not directly inside the recordings directory",
+           composedAVURL.path());
+  } else if (!RCCaptureFormat::isFileExtensionSupported(composedAVURL.pathExtension())) {
+    QV_LOG(platform::kLogLevelError,
+           "ERROR: no composition for '{}': it does not have a capture format's extension",
+           composedAVURL.lastPathComponent());
+  } else {
+    composition = RCComposition::compositionLoadedFromCompositionBundleURL(
+        RCComposition::compositionBundleURLForComposedAVURL(
+            composedAVURL.URLByStandardizingPath()));
+  }
+  return std::make_shared<RCCompositionController>(std::move(composition));
+}
+
+std::shared_ptr<RCComposition> RCCompositionController::composition() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->composition;
+}
+
+void RCCompositionController::rcs_repairDecomposedFragmentMetadataIfNecessary() {
+  std::shared_ptr<RCComposition> current = composition();
+  if (!current) return;
+  RCCompositionManifest repaired = repairedManifest(*current);
+  if (repaired == current->manifest()) return;
+  auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(repaired));
+  if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) {
+    QV_LOG(platform::kLogLevelError, "ERROR: cannot save the repaired manifest of {}: {}",
+           current->bundleURL().lastPathComponent(), saved.error().localizedDescription());
+    return;
+  }
+  QV_LOG(platform::kLogLevelNotice, "NOTE: repaired the fragment metadata of {}",
+         current->bundleURL().lastPathComponent());
+  std::lock_guard lock(state_->mutex);
+  if (state_->composition == current) state_->composition = std::move(replacement);
+}
+
+platform::Status RCCompositionController::composeNow(bool deleteFragments, bool composeWaveform) {
+  std::shared_ptr<RCComposition> current = composition();
+  if (!current) {
+    return platform::fail(
+        RCError(RCErrorCodeInvalidManifest, "there is no composition to compose"));
+  }
+  if (current->decomposedFragments().empty()) return {};
+
+  RCCompositionManifest manifest = current->manifest();
+  std::vector<RCComposerSegment> segments;
+  for (RCCompositionManifestFragment& entry : manifest.fragments) {
+    platform::URL url = current->URLForFragmentFile(entry.file);
+    if (!entry.contentDuration) {
+      double duration = fileDuration(url);
+      if (!std::isfinite(duration)) {
+        return platform::fail(
+            RCError(RCErrorCodeUnreadableAudio, "fragment '" + entry.file + "' cannot be read"));
+      }
+      entry.contentDuration = std::max(0.0, duration - entry.contentStart);
+    }
+    if (*entry.contentDuration > 0) {
+      segments.push_back(RCComposerSegment{url, entry.contentStart, *entry.contentDuration});
+    }
+  }
+  if (segments.empty()) {
+    return platform::fail(
+        RCError(RCErrorCodeInvalidEdit, "the fragments hold no audio to compose"));
+  }
+  platform::URL destination = current->composedAVURL();
+  std::optional<platform::URL> waveform;
+  if (composeWaveform) waveform = RCWaveform::waveformURLForAVURL(destination);
+  if (auto composed = RCComposeAudio(segments, destination, waveform); !composed) return composed;
+
+  for (RCCompositionManifestFragment& entry : manifest.fragments) entry.composed = true;
+  manifest.recomputeTimeRanges();
+  std::vector<platform::URL> toDelete;
+  if (deleteFragments) {
+    for (const auto& entry : manifest.fragments) {
+      toDelete.push_back(current->URLForFragmentFile(entry.file));
+    }
+    manifest.fragments.clear();
+  }
+  auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(manifest));
+  if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) return saved;
+  {
+    std::lock_guard lock(state_->mutex);
+    state_->composition = replacement;
+  }
+  for (const platform::URL& url : toDelete) {
+    if (auto removed = RCRemoveItemInSavedRecordingsDirectory(url); !removed) {
+      QV_LOG(platform::kLogLevelError, "WARNING: cannot delete composed fragment '{}': {}",
+             url.lastPathComponent(), removed.error().localizedDescription());
+    }
+  }
+  return {};
+}
+
+void RCCompositionController::rcs_composeToFinalDestinationAndDeleteDecomposedFragments(
+    bool deleteFragments, bool composeWaveform, bool canGenerateWaveformByProcessingAVURL,
+    CompletionBlock completionBlock) {
+  (void)canGenerateWaveformByProcessingAVURL;
+  auto controller = std::make_shared<RCCompositionController>(*this);
+  platform::globalQueue().async([controller, deleteFragments, composeWaveform,
+                                 completion = std::move(completionBlock)]() mutable {
+    platform::Status status = controller->composeNow(deleteFragments, composeWaveform);
+    if (!status) {
+      std::shared_ptr<RCComposition> current = controller->composition();
+      QV_LOG(platform::kLogLevelError, "ERROR: composing {} failed: {}",
+             current ? current->composedAVURL().lastPathComponent() : std::string("(none)"),
+             status.error().description());
+    }
+    if (completion) completion(status.has_value());
+  });
+}
+
+}  // namespace quorvel

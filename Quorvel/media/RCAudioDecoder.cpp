@@ -1,0 +1,165 @@
+#include "Quorvel/media/RCAudioDecoder.h"
+
+#include <new>
+
+extern "C" {
+#include <libavcodec/avcodec.h>
+#include <libavformat/avformat.h>
+}
+
+#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/media/RCFFmpegLogging.h"
+
+namespace quorvel {
+
+RCAudioDecoder::RCAudioDecoder(platform::URL url, AVFormatContext* format, AVStream* stream)
+    : url_(std::move(url)), format_(format), stream_(stream) {}
+
+RCAudioDecoder::~RCAudioDecoder() {
+  av_frame_free(&frame_);
+  avcodec_free_context(&codec_);
+  avformat_close_input(&format_);
+}
+
+platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const platform::URL& url) {
+  RCInstallFFmpegLogging();
+  const std::string name = url.lastPathComponent();
+  AVFormatContext* format = nullptr;
+  int result = avformat_open_input(&format, url.path().c_str(), nullptr, nullptr);
+  if (result < 0)
+    return platform::fail(
+        RCMediaErrorFromAV(RCMediaErrorCode::CannotOpen, result, "cannot open " + name));
+  auto closeOnFailure = [&format] { avformat_close_input(&format); };
+
+  auto findAudio = [&format]() -> AVStream* {
+    for (unsigned i = 0; i < format->nb_streams; ++i) {
+      AVStream* s = format->streams[i];
+      if (s->codecpar->codec_type == AVMEDIA_TYPE_AUDIO) return s;
+    }
+    return nullptr;
+  };
+  AVStream* stream = findAudio();
+  const bool complete = stream && stream->codecpar->codec_id != AV_CODEC_ID_NONE &&
+                        stream->codecpar->sample_rate > 0 &&
+                        stream->codecpar->ch_layout.nb_channels > 0;
+  if (!complete) {
+    result = avformat_find_stream_info(format, nullptr);
+    if (result < 0) {
+      closeOnFailure();
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::CannotOpen, result,
+                                               "cannot read the streams of " + name));
+    }
+    stream = findAudio();
+  }
+  if (!stream || stream->codecpar->codec_id == AV_CODEC_ID_NONE ||
+      stream->codecpar->sample_rate <= 0 || stream->codecpar->ch_layout.nb_channels <= 0) {
+    closeOnFailure();
+    return platform::fail(
+        RCMediaError(RCMediaErrorCode::NoAudioStream, name + " holds no usable audio stream"));
+  }
+  for (unsigned i = 0; i < format->nb_streams; ++i)
+    if (format->streams[i] != stream) format->streams[i]->discard = AVDISCARD_ALL;
+  return std::unique_ptr<RCAudioDecoder>(new RCAudioDecoder(url, format, stream));
+}
+
+const AVCodecParameters* RCAudioDecoder::codecParameters() const { return stream_->codecpar; }
+
+double RCAudioDecoder::declaredDurationSeconds() const {
+  if (stream_->duration > 0 && stream_->duration != AV_NOPTS_VALUE)
+    return double(stream_->duration) * av_q2d(stream_->time_base);
+  if (format_->duration > 0 && format_->duration != AV_NOPTS_VALUE)
+    return double(format_->duration) / AV_TIME_BASE;
+  return 0.0;
+}
+
+platform::Result<bool> RCAudioDecoder::readPacket(AVPacket* packet) {
+  for (;;) {
+    const int result = av_read_frame(format_, packet);
+    if (result == AVERROR_EOF) return false;
+    if (result < 0)
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+                                               "cannot read " + url_.lastPathComponent()));
+    if (packet->stream_index == stream_->index) {
+      if (packet->flags & AV_PKT_FLAG_CORRUPT) {
+        av_packet_unref(packet);
+        return platform::fail(RCMediaError(RCMediaErrorCode::Truncated,
+                                           url_.lastPathComponent() + " is damaged or truncated"));
+      }
+      return true;
+    }
+    av_packet_unref(packet);
+  }
+}
+
+platform::Status RCAudioDecoder::openCodec() {
+  if (codec_) return {};
+  const AVCodec* codec = avcodec_find_decoder(stream_->codecpar->codec_id);
+  const std::string name = url_.lastPathComponent();
+  if (!codec)
+    return platform::fail(RCMediaError(RCMediaErrorCode::DecodeFailed,
+                                       fmt::format("no decoder for the audio of {}", name)));
+  codec_ = avcodec_alloc_context3(codec);
+  frame_ = av_frame_alloc();
+  if (!codec_ || !frame_) throw std::bad_alloc();
+  int result = avcodec_parameters_to_context(codec_, stream_->codecpar);
+  if (result >= 0) {
+    codec_->pkt_timebase = stream_->time_base;
+    codec_->thread_count = 1;
+    result = avcodec_open2(codec_, codec, nullptr);
+  }
+  if (result < 0) {
+    avcodec_free_context(&codec_);
+    return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+                                             "cannot open the decoder for " + name));
+  }
+  return {};
+}
+
+platform::Status RCAudioDecoder::decode(const AVPacket* packet, const FrameHandler& handler) {
+  if (auto opened = openCodec(); !opened) return opened;
+  if (draining_) return {};
+  if (!packet) draining_ = true;
+  int result = avcodec_send_packet(codec_, packet);
+  if (result < 0 && result != AVERROR_EOF) {
+    // A damaged packet: the codec drops it; a file of nothing but damage
+    // fails later for holding no audio.
+    if (result == AVERROR_INVALIDDATA) return {};
+    return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+                                             "cannot decode " + url_.lastPathComponent()));
+  }
+  for (;;) {
+    result = avcodec_receive_frame(codec_, frame_);
+    if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
+    if (result == AVERROR_INVALIDDATA) continue;
+    if (result < 0)
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+                                               "cannot decode " + url_.lastPathComponent()));
+    auto handled = handler(frame_);
+    av_frame_unref(frame_);
+    if (!handled) return handled;
+  }
+}
+
+platform::Status RCAudioDecoder::decodeAll(const FrameHandler& handler) {
+  AVPacket* packet = av_packet_alloc();
+  if (!packet) throw std::bad_alloc();
+  platform::Status status;
+  for (;;) {
+    auto more = readPacket(packet);
+    if (!more) {
+      status = platform::fail(more.error());
+      break;
+    }
+    if (!*more) {
+      status = decode(nullptr, handler);
+      break;
+    }
+    status = decode(packet, handler);
+    av_packet_unref(packet);
+    if (!status) break;
+  }
+  av_packet_free(&packet);
+  return status;
+}
+
+}  // namespace quorvel

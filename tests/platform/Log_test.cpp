@@ -1,0 +1,63 @@
+// The log convention: "[tag] message", levels against the threshold, sink.
+#include <gtest/gtest.h>
+
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/Log.h"
+#include "platform/URL.h"
+
+namespace platform {
+namespace {
+
+struct CapturedLine {
+  int level;
+  std::string text;
+};
+
+class LogTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    setConsoleLogging(false);
+    setLogSinkForTesting([this](int level, std::string_view text) {
+      lines_.push_back({level, std::string(text)});
+    });
+  }
+  void TearDown() override {
+    setLogSinkForTesting(nullptr);
+    setLogThreshold(kLogLevelNotice);
+  }
+  std::vector<CapturedLine> lines_;
+};
+
+TEST_F(LogTest, TagIsTheFileNameUpToItsFirstDot) {
+  static_assert(logTagForFile("/src/quorveld/SavedRecordingService.Connections.cpp") ==
+                "SavedRecordingService");
+  static_assert(logTagForFile("Models/RCSavedRecordingsModel+RCSOrphanHandling.cpp") ==
+                "RCSavedRecordingsModel+RCSOrphanHandling");
+  QV_LOG(kLogLevelNotice, "Starting service '{}'", "org.quorvel.SavedRecordingService");
+  ASSERT_EQ(lines_.size(), 1u);
+  EXPECT_EQ(lines_[0].level, 6);
+  EXPECT_EQ(lines_[0].text, "[Log_test] Starting service 'org.quorvel.SavedRecordingService'");
+}
+
+TEST_F(LogTest, ThresholdFiltersTracingUnlessVerbose) {
+  QV_LOG(kLogLevelDebug, "hidden");
+  QV_LOG(kLogLevelError, "shown");
+  setLogThreshold(kLogLevelDebug);
+  QV_LOG(kLogLevelDebug, "now shown {}", URL::fileURLWithPath("/a b"));
+  ASSERT_EQ(lines_.size(), 2u);
+  EXPECT_EQ(lines_[0].text, "[Log_test] shown");
+  EXPECT_EQ(lines_[1].text, "[Log_test] now shown file:///a%20b");
+}
+
+TEST_F(LogTest, ArgumentsAreNotFormattedForDroppedLines) {
+  int formatted = 0;
+  auto count = [&formatted] { return ++formatted; };
+  QV_LOG(kLogLevelDebug, "{}", count());
+  EXPECT_EQ(formatted, 0);
+}
+
+}  // namespace
+}  // namespace platform

@@ -1,0 +1,281 @@
+// Compositions made, edited, repaired and composed end to end on real audio:
+// what an app builds through the editor composes into a playable file of the
+// right length, a crash mid-capture is repaired into a consistent manifest,
+// and audio that cannot be read makes composing fail instead of vanishing.
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <future>
+#include <thread>
+
+#include "Quorvel/composition/RCCompositionController.h"
+#include "Quorvel/composition/RCCompositionEditor.h"
+#include "Quorvel/errors/RCError.h"
+#include "Quorvel/media/RCAudioAsset.h"
+#include "Quorvel/media/RCMP4Atoms.h"
+#include "Quorvel/waveform/RCWaveform.h"
+#include "tests/support/AudioFixtures.h"
+#include "tests/support/RecordingsDirectoryFixture.h"
+
+namespace quorvel {
+namespace {
+
+namespace fs = std::filesystem;
+
+class CompositionControllerTest : public testing::RecordingsDirectoryTest {
+ protected:
+  void SetUp() override {
+    RecordingsDirectoryTest::SetUp();
+    auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+    ASSERT_TRUE(model) << model.error();
+    model_ = *model;
+    fs::create_directories(root_ / "sources");
+  }
+
+  platform::URL tone(const std::string& name, double seconds, double frequency = 440) {
+    std::string path = (root_ / "sources" / name).string();
+    std::string format = fs::path(name).extension().string().substr(1);
+    auto written = testing::writeTone(path, seconds, format, 44100, 1, frequency);
+    EXPECT_TRUE(written) << written.error();
+    return platform::URL::fileURLWithPath(path);
+  }
+
+  // Composes through the asynchronous entry and waits for its callback.
+  bool compose(RCCompositionController& controller, bool deleteFragments, bool waveform) {
+    std::promise<std::thread::id> called;
+    std::promise<bool> result;
+    controller.rcs_composeToFinalDestinationAndDeleteDecomposedFragments(
+        deleteFragments, waveform, false, [&](bool success) {
+          result.set_value(success);
+          called.set_value(std::this_thread::get_id());
+        });
+    bool success = result.get_future().get();
+    EXPECT_NE(called.get_future().get(), std::this_thread::get_id());
+    return success;
+  }
+
+  static double durationOf(const platform::URL& url) {
+    auto asset = RCAudioAsset::assetWithURL(url);
+    return asset ? asset->duration() : -1;
+  }
+
+  std::shared_ptr<RCSavedRecordingsModel> model_;
+};
+
+TEST_F(CompositionControllerTest, AnEditedRecordingComposesToItsFragmentsUsedRanges) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Walk");
+  ASSERT_TRUE(editor) << editor.error();
+  platform::URL composed = editor->composedAVURL();
+  EXPECT_EQ(composed.path(), (recordings_ / "Walk.m4a").string());
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("one.m4a", 1.0, 440)));
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("two.flac", 1.5, 880)));
+  ASSERT_TRUE(editor->setContentRangeOfFragment(0, 0.25, 0.5));
+  EXPECT_DOUBLE_EQ(editor->composition()->composedDuration(), 2.0);
+  ASSERT_TRUE(editor->setTitle(*model_, "Walk in the park"));
+
+  auto controller = RCCompositionController::compositionControllerForComposedAVURL(composed);
+  ASSERT_TRUE(controller->composition());
+  EXPECT_EQ(controller->composition()->decomposedFragments().size(), 2u);
+  ASSERT_TRUE(compose(*controller, false, true));
+
+  EXPECT_NEAR(durationOf(composed), 2.0, 0.05);
+  auto pcm = testing::decodeToPCM(composed.path());
+  ASSERT_TRUE(pcm) << pcm.error();
+  EXPECT_NEAR(pcm->seconds(), 2.0, 0.05);
+  // The first half second is the trimmed 440 Hz tone, then 880 Hz.
+  EXPECT_NEAR(testing::estimatedFrequencyHz(*pcm, 2205, 19845), 440, 15);
+  EXPECT_NEAR(testing::estimatedFrequencyHz(*pcm, 26460, 83790), 880, 15);
+  EXPECT_TRUE(fs::exists(RCWaveform::waveformURLForAVURL(composed).path()));
+
+  // Nothing is decomposed any more, and the manifest on disk says so.
+  EXPECT_TRUE(controller->composition()->decomposedFragments().empty());
+  auto reloaded = RCCompositionController::compositionControllerForComposedAVURL(composed);
+  ASSERT_TRUE(reloaded->composition());
+  EXPECT_TRUE(reloaded->composition()->decomposedFragments().empty());
+  EXPECT_NEAR(reloaded->composition()->composedDuration(), 2.0, 1e-9);
+  // Composing again has nothing to do and succeeds.
+  EXPECT_TRUE(compose(*reloaded, false, false));
+
+  // The title landed in the database and in the file.
+  auto recording = model_->recordingWithURL(composed);
+  ASSERT_TRUE(recording && *recording);
+  EXPECT_EQ((*recording)->customLabel(), "Walk in the park");
+  EXPECT_EQ((*recording)->URIRepresentation(), reloaded->composition()->savedRecordingURI());
+}
+
+TEST_F(CompositionControllerTest, NewRecordingsGetFreeNamesAndBadNamesAreRefused) {
+  fs::create_directories(recordings_);
+  std::ofstream(recordings_ / "Memo.flac") << "taken by a bare file";
+  auto first = RCCompositionEditor::createCompositionForNewRecording(*model_, "Memo", "wav");
+  auto second = RCCompositionEditor::createCompositionForNewRecording(*model_, "Memo", "wav");
+  ASSERT_TRUE(first && second);
+  EXPECT_EQ(first->composedAVURL().lastPathComponent(), "Memo 2.wav");
+  EXPECT_EQ(second->composedAVURL().lastPathComponent(), "Memo 3.wav");
+  for (const char* bad : {"../Escape", "a/b", "", ".."}) {
+    EXPECT_FALSE(RCCompositionEditor::createCompositionForNewRecording(*model_, bad)) << bad;
+  }
+  EXPECT_FALSE(RCCompositionEditor::createCompositionForNewRecording(*model_, "x", "mp3"));
+  EXPECT_FALSE(RCCompositionEditor::createCompositionForNewRecording(*model_, "\xff\xfe"));
+  EXPECT_FALSE(fs::exists(root_ / "Escape.composition"));
+  int records = 0;
+  ASSERT_TRUE(model_->enumerateExistingRecordingsWithBlock(
+      [&](const std::shared_ptr<RCSavedRecording>&, bool&) { ++records; }));
+  EXPECT_EQ(records, 2);
+}
+
+TEST_F(CompositionControllerTest, RepairAfterACrashMidCaptureLeavesAConsistentManifest) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Crash", "wav");
+  ASSERT_TRUE(editor);
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("base.wav", 1.0)));
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("gone.wav", 0.5)));
+  // A capture that wrote its audio but crashed before recording its length.
+  auto captured = editor->beginFragment("wav");
+  ASSERT_TRUE(captured);
+  fs::copy_file(tone("captured.wav", 0.75).path(), captured->path());
+  // A capture that crashed before its first byte.
+  auto empty = editor->beginFragment("flac");
+  ASSERT_TRUE(empty);
+  std::ofstream(empty->path()).close();
+  // A capture whose entry was written but whose file never appeared.
+  ASSERT_TRUE(editor->beginFragment("m4a"));
+  // And a fragment deleted behind the recording's back.
+  fs::remove(editor->composition()->fragments()[1].AVOutputURL().path());
+
+  auto controller =
+      RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
+  ASSERT_TRUE(controller->composition());
+  EXPECT_EQ(controller->composition()->fragments().size(), 5u);
+  controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+  auto repaired = controller->composition();
+  ASSERT_EQ(repaired->fragments().size(), 2u);
+  EXPECT_EQ(repaired->fragments()[1].AVOutputURL(), *captured);
+  ASSERT_TRUE(repaired->fragments()[1].contentDuration());
+  EXPECT_NEAR(*repaired->fragments()[1].contentDuration(), 0.75, 0.01);
+  EXPECT_NEAR(repaired->fragments()[1].timeRangeInComposition().start, 1.0, 0.01);
+  EXPECT_NEAR(repaired->composedDuration(), 1.75, 0.02);
+  EXPECT_TRUE(logged("NOTE: dropping fragment"));
+
+  // The repaired manifest is on disk; repairing again changes nothing.
+  auto fromDisk = RCComposition::compositionLoadedFromCompositionBundleURL(repaired->bundleURL());
+  ASSERT_TRUE(fromDisk);
+  EXPECT_EQ(fromDisk->manifest(), repaired->manifest());
+  controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+  EXPECT_EQ(controller->composition(), repaired);
+
+  // The empty file is now an orphan; the daemon's cleanup would delete it.
+  std::vector<std::string> orphans;
+  repaired->enumerateOrphanedFragmentsWithBlock([&](const RCCompositionFragment& fragment, bool&) {
+    orphans.push_back(fragment.AVOutputURL().lastPathComponent());
+  });
+  EXPECT_EQ(orphans, std::vector<std::string>{empty->lastPathComponent()});
+
+  ASSERT_TRUE(compose(*controller, false, false));
+  EXPECT_NEAR(durationOf(editor->composedAVURL()), 1.75, 0.02);
+}
+
+TEST_F(CompositionControllerTest, UnreadableAudioStaysAndMakesComposingFail) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Broken", "m4a");
+  ASSERT_TRUE(editor);
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("good.m4a", 0.5)));
+  // An m4a capture cut off before its movie header was written.
+  auto cut = editor->beginFragment("m4a");
+  ASSERT_TRUE(cut);
+  std::string whole = tone("whole.m4a", 1.0).path();
+  fs::copy_file(whole, cut->path());
+  fs::resize_file(cut->path(), fs::file_size(whole) / 2);
+
+  auto controller =
+      RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
+  controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+  ASSERT_EQ(controller->composition()->fragments().size(), 2u);
+  EXPECT_FALSE(controller->composition()->fragments()[1].contentDuration());
+  EXPECT_TRUE(logged("cannot be read; keeping it"));
+  std::string manifestBefore = controller->composition()->manifest().serialize();
+
+  EXPECT_FALSE(compose(*controller, false, false));
+  EXPECT_FALSE(fs::exists(editor->composedAVURL().path()));
+  EXPECT_EQ(controller->composition()->decomposedFragments().size(), 2u);
+  EXPECT_EQ(controller->composition()->manifest().serialize(), manifestBefore);
+  EXPECT_TRUE(logged("ERROR: composing Broken.m4a failed"));
+}
+
+TEST_F(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextTrim) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Trim", "flac");
+  ASSERT_TRUE(editor);
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("a.flac", 1.0)));
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("b.flac", 1.0)));
+  std::vector<std::string> fragmentFiles;
+  for (const auto& fragment : editor->composition()->fragments()) {
+    fragmentFiles.push_back(fragment.AVOutputURL().path());
+  }
+  auto controller =
+      RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
+  ASSERT_TRUE(compose(*controller, true, false));
+  for (const auto& file : fragmentFiles) EXPECT_FALSE(fs::exists(file)) << file;
+  EXPECT_TRUE(controller->composition()->fragments().empty());
+  EXPECT_NEAR(controller->composition()->composedDuration(), 2.0, 1e-9);
+  // Repair keeps a composition that is only its composed file.
+  controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+  EXPECT_NEAR(controller->composition()->composedDuration(), 2.0, 1e-9);
+
+  // Trimming brings the composed audio back as a fragment and keeps [0.5, 1.25).
+  auto again = RCCompositionEditor::editorForComposedAVURL(editor->composedAVURL());
+  ASSERT_TRUE(again) << again.error();
+  ASSERT_TRUE(again->trimToTimeRange({0.5, 0.75}));
+  EXPECT_NEAR(again->composition()->composedDuration(), 0.75, 1e-9);
+  auto retrimmed =
+      RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
+  ASSERT_TRUE(compose(*retrimmed, false, false));
+  EXPECT_NEAR(durationOf(editor->composedAVURL()), 0.75, 0.01);
+}
+
+TEST_F(CompositionControllerTest, TrimmingAwayAFragmentOrphansItsFile) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Cut", "wav");
+  ASSERT_TRUE(editor);
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("a.wav", 1.0)));
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("b.wav", 1.0)));
+  std::string second = editor->composition()->fragments()[1].AVOutputURL().lastPathComponent();
+  ASSERT_TRUE(editor->trimToTimeRange({0.25, 0.5}));
+  ASSERT_EQ(editor->composition()->fragments().size(), 1u);
+  EXPECT_NEAR(editor->composition()->fragments()[0].contentStart(), 0.25, 1e-9);
+  std::vector<std::string> orphans;
+  editor->composition()->enumerateOrphanedFragmentsWithBlock(
+      [&](const RCCompositionFragment& fragment, bool&) {
+        orphans.push_back(fragment.AVOutputURL().lastPathComponent());
+      });
+  EXPECT_EQ(orphans, std::vector<std::string>{second});
+  EXPECT_FALSE(editor->trimToTimeRange({5, 1}));
+  EXPECT_FALSE(editor->setContentRangeOfFragment(0, 0.5, 0.75));  // past the file's end
+  EXPECT_FALSE(editor->setContentRangeOfFragment(3, 0, 0.1));
+  // Removing the last fragment empties the recording, composed file included.
+  std::ofstream(editor->composedAVURL().path()) << "stale";
+  ASSERT_TRUE(editor->removeFragment(0));
+  EXPECT_FALSE(fs::exists(editor->composedAVURL().path()));
+  EXPECT_EQ(editor->composition()->composedDuration(), 0);
+}
+
+TEST_F(CompositionControllerTest, ControllersExistOnlyForAudioFilesDirectlyInTheDirectory) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Here", "wav");
+  ASSERT_TRUE(editor);
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("a.wav", 0.25)));
+  EXPECT_TRUE(
+      RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL())
+          ->composition());
+  for (const std::string& path :
+       {(root_ / "Here.wav").string(), (recordings_ / "Here.composition/Here.wav").string(),
+        (recordings_ / "Here.mp3").string(), (recordings_ / "Missing.wav").string()}) {
+    auto controller = RCCompositionController::compositionControllerForComposedAVURL(
+        platform::URL::fileURLWithPath(path));
+    EXPECT_FALSE(controller->composition()) << path;
+    EXPECT_FALSE(compose(*controller, false, false)) << path;
+  }
+  // A URL with ".." that lands on the recording is the recording.
+  EXPECT_TRUE(RCCompositionController::compositionControllerForComposedAVURL(
+                  platform::URL::fileURLWithPath(recordings_.string() + "/x/../Here.wav"))
+                  ->composition());
+  EXPECT_FALSE(RCCompositionEditor::editorForComposedAVURL(
+      platform::URL::fileURLWithPath((root_ / "Here.wav").string())));
+}
+
+}  // namespace
+}  // namespace quorvel

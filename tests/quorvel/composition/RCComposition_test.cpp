@@ -1,0 +1,286 @@
+// Composition bundles on disk: what loads, what is refused (and left exactly
+// as it was), which files count as orphaned fragments, asset sizes, and the
+// manifest written back.
+#include <gtest/gtest.h>
+
+#include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/composition/RCCompositionManifest.h"
+#include "Quorvel/errors/RCError.h"
+#include "tests/support/RecordingsDirectoryFixture.h"
+
+namespace quorvel {
+namespace {
+
+namespace fs = std::filesystem;
+using CompositionTest = testing::RecordingsDirectoryTest;
+
+using testing::readFile;
+using testing::writeFile;
+
+RCCompositionManifest twoFragments() {
+  RCCompositionManifest manifest;
+  manifest.composedName = "Walk.m4a";
+  manifest.savedRecordingURI = "quorvel://recording/E621E1F8-C36C-495A-93FC-0C247A3E6E5F";
+  manifest.fragments = {
+      {"a.m4a", {0, 2}, 0.5, 2.0, true},
+      {"b.wav", {2, 1.25}, 0, std::nullopt, false},
+  };
+  manifest.recomputeTimeRanges();
+  return manifest;
+}
+
+TEST(CompositionManifestTest, RoundTripsAndLaysFragmentsEndToEnd) {
+  RCCompositionManifest manifest = twoFragments();
+  EXPECT_DOUBLE_EQ(manifest.composedDuration, 2.0);  // the open-ended one counts 0
+  EXPECT_EQ(manifest.fragments[1].timeRangeInComposition, (RCTimeRange{2.0, 0}));
+  auto parsed = RCCompositionManifest::parse(manifest.serialize());
+  ASSERT_TRUE(parsed) << parsed.error();
+  EXPECT_EQ(*parsed, manifest);
+  RCCompositionManifest empty;
+  empty.composedName = "x.flac";
+  auto back = RCCompositionManifest::parse(empty.serialize());
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back, empty);
+  EXPECT_TRUE(back->savedRecordingURI.empty());
+}
+
+TEST(CompositionManifestTest, RefusesEveryMalformedShapeWithAReason) {
+  const std::string fragment =
+      R"({"file":"a.m4a","timeRangeInComposition":{"start":0,"duration":1},)"
+      R"("contentRange":{"start":0,"duration":1},"composed":false})";
+  auto manifestWith = [&](const std::string& fragments, const std::string& composed = "\"W.m4a\"",
+                          const std::string& version = "1") {
+    return "{\"formatVersion\":" + version + ",\"composedAVURL\":" + composed +
+           ",\"composedDuration\":1,\"savedRecordingURI\":null,\"fragments\":[" + fragments + "]}";
+  };
+  ASSERT_TRUE(RCCompositionManifest::parse(manifestWith(fragment)));
+  auto replaced = [&](const std::string& from, const std::string& to) {
+    std::string text = fragment;
+    text.replace(text.find(from), from.size(), to);
+    return manifestWith(text);
+  };
+  struct Case {
+    std::string json;
+    std::string reason;
+  };
+  for (const Case& c : std::vector<Case>{
+           {"", "not JSON"},
+           {"{\"formatVersion\":1", "not JSON"},
+           {"[]", "not a JSON object"},
+           {manifestWith(fragment, "\"W.m4a\"", "2"), "formatVersion 2"},
+           {manifestWith(fragment, "\"W.m4a\"", "1.0"), "not an integer"},
+           {manifestWith(fragment, "\"../W.m4a\""), "not a plain file name"},
+           {manifestWith(fragment, "\"/abs/W.m4a\""), "not a plain file name"},
+           {manifestWith(fragment, "\"W.mp3\""), "capture format"},
+           {manifestWith(fragment, "7"), "not a string"},
+           {R"({"formatVersion":1,"composedAVURL":"W.m4a","composedDuration":1,"fragments":[]})",
+            "savedRecordingURI is missing"},
+           {replaced("\"a.m4a\"", "\"..\""), "not a plain file name"},
+           {replaced("\"a.m4a\"", "\"sub/a.m4a\""), "not a plain file name"},
+           {replaced("\"a.m4a\"", "\"/etc/a.m4a\""), "not a plain file name"},
+           {replaced("\"a.m4a\"", "\"a.M4A\""), "capture format"},
+           {replaced("\"start\":0,\"duration\":1},\"c", "\"start\":-1,\"duration\":1},\"c"),
+            "non-negative"},
+           {replaced("\"composed\":false", "\"composed\":0"), "not true or false"},
+           {replaced(",\"composed\":false", ""), "composed is missing"},
+           {replaced("\"contentRange\":{\"start\":0,\"duration\":1}", "\"contentRange\":[0,1]"),
+            "not an object"},
+           {replaced("\"contentRange\":{\"start\":0,\"duration\":1}",
+                     "\"contentRange\":{\"start\":0}"),
+            "contentRange.duration is missing"},
+           {replaced("\"duration\":1},\"composed\"", "\"duration\":1e999},\"composed\""),
+            "not JSON"},
+           {manifestWith("7"), "fragments[0] is not an object"},
+       }) {
+    auto parsed = RCCompositionManifest::parse(c.json);
+    ASSERT_FALSE(parsed) << c.json;
+    EXPECT_EQ(parsed.error().code(), RCErrorCodeInvalidManifest);
+    EXPECT_NE(parsed.error().localizedDescription().find(c.reason), std::string::npos)
+        << c.json << " -> " << parsed.error().localizedDescription();
+  }
+  EXPECT_FALSE(RCCompositionManifest::parse(std::string(5 * 1024 * 1024, ' ')));
+}
+
+TEST_F(CompositionTest, LoadsAValidBundleAndNamesItsFilesInsideTheDirectory) {
+  fs::path bundle = recordings_ / "Walk.composition";
+  writeFile(bundle / "manifest.json", twoFragments().serialize());
+  writeFile(bundle / "a.m4a", std::string(1000, 'a'));
+  writeFile(bundle / "b.wav", std::string(234, 'b'));
+  writeFile(recordings_ / "Walk.m4a", std::string(50, 'w'));
+  writeFile(recordings_ / "Walk.waveform", std::string(7, 'v'));
+
+  auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
+      platform::URL::fileURLWithPath(bundle.string() + "/"));
+  ASSERT_TRUE(composition);
+  EXPECT_EQ(composition->composedAVURL().path(), (recordings_ / "Walk.m4a").string());
+  EXPECT_EQ(
+      RCComposition::compositionBundleURLForComposedAVURL(composition->composedAVURL()).path(),
+      bundle.string());
+  EXPECT_DOUBLE_EQ(composition->composedDuration(), 2.0);
+  ASSERT_EQ(composition->fragments().size(), 2u);
+  EXPECT_EQ(composition->fragments()[1].AVOutputURL().path(), (bundle / "b.wav").string());
+  ASSERT_EQ(composition->decomposedFragments().size(), 1u);
+  EXPECT_EQ(composition->decomposedFragments()[0].AVOutputURL().lastPathComponent(), "b.wav");
+  EXPECT_FALSE(composition->decomposedFragments()[0].contentDuration());
+  EXPECT_EQ(composition->fileSizeOfAssetsIncludingRelatedResources(false), 1000u + 234u + 50u);
+  EXPECT_EQ(composition->fileSizeOfAssetsIncludingRelatedResources(true),
+            1000u + 234u + 50u + 7u + fs::file_size(bundle / "manifest.json"));
+  EXPECT_NE(composition->debugDescription().find("b.wav at 2.000+0.000 uses 0.000+open"),
+            std::string::npos)
+      << composition->debugDescription();
+}
+
+TEST_F(CompositionTest, BundlesThatMustNotLoadAreRefusedLoggedAndLeftUntouched) {
+  fs::path outside = root_ / "outside";
+  writeFile(outside / "secret.m4a", "secret");
+  struct Case {
+    std::string name;
+    std::function<void(const fs::path& bundle)> make;
+    std::string reason;
+  };
+  auto manifestText = [](const std::string& composed, const std::string& fragmentFile) {
+    RCCompositionManifest manifest;
+    manifest.composedName = composed;
+    manifest.fragments = {{fragmentFile, {0, 1}, 0, 1.0, false}};
+    return manifest.serialize();
+  };
+  std::vector<Case> cases = {
+      {"NotJSON", [](const fs::path& b) { writeFile(b / "manifest.json", "{{{"); }, "not JSON"},
+      {"WrongTypes",
+       [](const fs::path& b) {
+         writeFile(b / "manifest.json",
+                   R"({"formatVersion":1,"composedAVURL":"WrongTypes.m4a","composedDuration":"1",)"
+                   R"("savedRecordingURI":null,"fragments":[]})");
+       },
+       "composedDuration is not a number"},
+      {"NoManifest", [](const fs::path& b) { fs::create_directories(b); }, "manifest.json"},
+      {"OtherRecording",
+       [&](const fs::path& b) {
+         writeFile(b / "manifest.json", manifestText("Someone Else.m4a", "f.m4a"));
+       },
+       "not the audio file of this bundle"},
+      {"LinkedFragment",
+       [&](const fs::path& b) {
+         writeFile(b / "manifest.json", manifestText("LinkedFragment.m4a", "f.m4a"));
+         fs::create_symlink(outside / "secret.m4a", b / "f.m4a");
+       },
+       "symbolic link"},
+      {"DirectoryFragment",
+       [&](const fs::path& b) {
+         writeFile(b / "manifest.json", manifestText("DirectoryFragment.m4a", "f.m4a"));
+         fs::create_directories(b / "f.m4a");
+       },
+       "not a regular file"},
+      {"LinkedManifest",
+       [&](const fs::path& b) {
+         fs::create_directories(b);
+         writeFile(outside / "manifest.json", manifestText("LinkedManifest.m4a", "f.m4a"));
+         fs::create_symlink(outside / "manifest.json", b / "manifest.json");
+       },
+       "manifest.json"},
+      {"LinkedBundle",
+       [&](const fs::path& b) {
+         writeFile(outside / "manifest.json", manifestText("LinkedBundle.m4a", "f.m4a"));
+         fs::create_directory_symlink(outside, b);
+       },
+       "symbolic link"},
+  };
+  for (const Case& c : cases) {
+    fs::path bundle = recordings_ / (c.name + ".composition");
+    c.make(bundle);
+    std::string before = fs::is_regular_file(fs::symlink_status(bundle / "manifest.json"))
+                             ? readFile(bundle / "manifest.json")
+                             : "";
+    auto loaded = RCComposition::load(platform::URL::fileURLWithPath(bundle.string()));
+    ASSERT_FALSE(loaded) << c.name;
+    EXPECT_NE(loaded.error().description().find(c.reason), std::string::npos)
+        << c.name << ": " << loaded.error();
+    EXPECT_FALSE(RCComposition::compositionLoadedFromCompositionBundleURL(
+        platform::URL::fileURLWithPath(bundle.string())));
+    EXPECT_TRUE(logged("ERROR: cannot load the composition '" + c.name + ".composition'"))
+        << c.name;
+    if (!before.empty()) {
+      EXPECT_EQ(readFile(bundle / "manifest.json"), before) << c.name;
+    }
+  }
+  EXPECT_EQ(readFile(outside / "secret.m4a"), "secret");
+
+  // A good bundle outside the recordings directory does not load either.
+  fs::path foreign = root_ / "Foreign.composition";
+  writeFile(foreign / "manifest.json", manifestText("Foreign.m4a", "f.m4a"));
+  auto loaded = RCComposition::load(platform::URL::fileURLWithPath(foreign.string()));
+  ASSERT_FALSE(loaded);
+  EXPECT_NE(loaded.error().localizedDescription().find("not directly inside"), std::string::npos);
+}
+
+TEST_F(CompositionTest, OrphanedFragmentsAreCaptureFilesTheManifestNoLongerUses) {
+  fs::path bundle = recordings_ / "Walk.composition";
+  writeFile(bundle / "manifest.json", twoFragments().serialize());
+  writeFile(bundle / "a.m4a", "used");
+  writeFile(bundle / "c.m4a", "orphan");
+  writeFile(bundle / "b.flac", "orphan: b.wav is the one in use");
+  writeFile(bundle / "notes.txt", "not audio");
+  writeFile(bundle / "D.M4A", "other case: not a capture extension");
+  fs::create_directories(bundle / "dir.wav");
+  fs::create_symlink(root_ / "nowhere", bundle / "dangling.wav");
+  auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
+      platform::URL::fileURLWithPath(bundle.string()));
+  ASSERT_TRUE(composition);
+
+  std::vector<std::string> orphans;
+  composition->enumerateOrphanedFragmentsWithBlock(
+      [&](const RCCompositionFragment& fragment, bool&) {
+        orphans.push_back(fragment.AVOutputURL().lastPathComponent());
+      });
+  EXPECT_EQ(orphans, (std::vector<std::string>{"b.flac", "c.m4a", "dangling.wav"}));
+
+  // Deleting them goes through the confined removal; the walk stops when asked.
+  int visited = 0;
+  composition->enumerateOrphanedFragmentsWithBlock(
+      [&](const RCCompositionFragment& fragment, bool& stop) {
+        EXPECT_TRUE(fragment.deleteFromFilesystem());
+        stop = ++visited == 2;
+      });
+  EXPECT_EQ(visited, 2);
+  EXPECT_FALSE(fs::exists(bundle / "b.flac"));
+  EXPECT_FALSE(fs::exists(bundle / "c.m4a"));
+  EXPECT_TRUE(fs::is_symlink(bundle / "dangling.wav"));
+  EXPECT_TRUE(fs::exists(bundle / "a.m4a"));
+  EXPECT_TRUE(fs::exists(bundle / "notes.txt"));
+
+  // A fragment the manifest stops using becomes an orphan.
+  RCCompositionManifest fewer = composition->manifest();
+  fewer.fragments.erase(fewer.fragments.begin());
+  RCComposition changed(composition->bundleURL(), fewer);
+  ASSERT_TRUE(changed.saveMetadataToDefaultLocation());
+  orphans.clear();
+  RCComposition::compositionLoadedFromCompositionBundleURL(composition->bundleURL())
+      ->enumerateOrphanedFragmentsWithBlock([&](const RCCompositionFragment& fragment, bool&) {
+        orphans.push_back(fragment.AVOutputURL().lastPathComponent());
+      });
+  EXPECT_EQ(orphans, (std::vector<std::string>{"a.m4a", "dangling.wav"}));
+}
+
+TEST_F(CompositionTest, RecoveredURIIsSavedAtomicallyIntoTheBundle) {
+  fs::path bundle = recordings_ / "Lost.composition";
+  RCCompositionManifest manifest;
+  manifest.composedName = "Lost.wav";
+  manifest.composedDuration = 3;
+  writeFile(bundle / "manifest.json", manifest.serialize());
+  auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
+      platform::URL::fileURLWithPath(bundle.string()));
+  ASSERT_TRUE(composition);
+  EXPECT_TRUE(composition->savedRecordingURI().empty());
+  EXPECT_EQ(composition->fileSizeOfAssetsIncludingRelatedResources(false), 0u);
+  composition->setSavedRecordingURIFromRecoveredRecordingURI("quorvel://recording/X");
+  ASSERT_TRUE(composition->saveMetadataToDefaultLocation());
+  auto reloaded = RCComposition::compositionLoadedFromCompositionBundleURL(
+      platform::URL::fileURLWithPath(bundle.string()));
+  ASSERT_TRUE(reloaded);
+  EXPECT_EQ(reloaded->savedRecordingURI(), "quorvel://recording/X");
+  EXPECT_DOUBLE_EQ(reloaded->composedDuration(), 3);
+  EXPECT_EQ(std::distance(fs::directory_iterator(bundle), fs::directory_iterator()), 1);
+}
+
+}  // namespace
+}  // namespace quorvel

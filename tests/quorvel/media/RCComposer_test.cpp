@@ -1,0 +1,273 @@
+// The composer over real fragment files: stream copy and re-encoding, trimmed
+// ranges, mixed formats, the composed waveform, and damaged input that must
+// fail without leaving a half file. Decoded audio is compared within
+// tolerances (tone frequencies per section, durations), never encoder bytes.
+#include "Quorvel/media/RCComposer.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cmath>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+extern "C" {
+#include <libavformat/avformat.h>
+}
+
+#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
+#include "Quorvel/waveform/RCWaveform.h"
+#include "Quorvel/waveform/RCWaveformFile.h"
+#include "tests/support/AudioFixtures.h"
+#include "tests/support/TempDirectory.h"
+
+namespace quorvel {
+namespace {
+
+namespace fs = std::filesystem;
+using testing::DecodedPCM;
+using testing::decodeToPCM;
+using testing::estimatedFrequencyHz;
+using testing::writeTone;
+
+// The duration the container declares, read the way players do.
+double containerSeconds(const std::string& path) {
+  AVFormatContext* format = nullptr;
+  if (avformat_open_input(&format, path.c_str(), nullptr, nullptr) < 0) return -1;
+  avformat_find_stream_info(format, nullptr);
+  double seconds = -1;
+  for (unsigned i = 0; i < format->nb_streams; ++i) {
+    AVStream* s = format->streams[i];
+    if (s->codecpar->codec_type == AVMEDIA_TYPE_AUDIO && s->duration > 0)
+      seconds = double(s->duration) * av_q2d(s->time_base);
+  }
+  if (seconds < 0 && format->duration > 0) seconds = double(format->duration) / AV_TIME_BASE;
+  avformat_close_input(&format);
+  return seconds;
+}
+
+class ComposerTest : public testing::TempDirectoryTest {
+ protected:
+  // The frequency heard over [from, to) seconds of `pcm`.
+  static double toneAt(const DecodedPCM& pcm, double from, double to) {
+    return estimatedFrequencyHz(pcm, std::size_t(from * pcm.sampleRate),
+                                std::size_t(to * pcm.sampleRate));
+  }
+};
+
+constexpr double kAACFrame = 1024.0 / 44100.0;
+
+TEST_F(ComposerTest, CopiesMatchingAACFragmentsWithContinuousTimestamps) {
+  ASSERT_TRUE(writeTone(path("a.m4a"), 1.0, "m4a", 44100, 1, 300));
+  ASSERT_TRUE(writeTone(path("b.m4a"), 1.5, "m4a", 44100, 1, 600));
+  ASSERT_TRUE(writeTone(path("c.m4a"), 0.7, "m4a", 44100, 1, 1200));
+  std::vector<RCComposerSegment> segments = {
+      {url("a.m4a"), 0.0, 1.0}, {url("b.m4a"), 0.0, 1.5}, {url("c.m4a"), 0.0, 0.7}};
+  auto status = RCComposeAudio(segments, url("out.m4a"), url("out.waveform"));
+  ASSERT_TRUE(status) << status.error();
+  EXPECT_TRUE(logged("by stream copy"));
+
+  auto pcm = decodeToPCM(path("out.m4a"));
+  ASSERT_TRUE(pcm) << pcm.error();
+  EXPECT_EQ(pcm->sampleRate, 44100);
+  EXPECT_EQ(pcm->channels, 1);
+  // Each later fragment brings one pre-roll frame; each range ends on a frame.
+  const double joins = 2;
+  EXPECT_GE(pcm->seconds(), 3.2 + joins * kAACFrame - 1e-6);
+  EXPECT_LE(pcm->seconds(), 3.2 + (2 * joins + 1) * kAACFrame);
+  EXPECT_NEAR(containerSeconds(path("out.m4a")), pcm->seconds(), (joins + 1) * kAACFrame);
+  // Each fragment's tone in its own section, away from the joins.
+  EXPECT_NEAR(toneAt(*pcm, 0.1, 0.9), 300, 3);
+  EXPECT_NEAR(toneAt(*pcm, 1.2, 2.4), 600, 3);
+  EXPECT_NEAR(toneAt(*pcm, 2.7, 3.2), 1200, 5);
+  // After its pre-roll frame, each later fragment sounds exactly as it does on
+  // its own (up to the codec's noise filling, which draws fresh random noise):
+  // the decoder's overlap starts from the fragment's own audio, so the join
+  // does not click. Fragment b follows a's 44 frames and its pre-roll.
+  for (const auto& [name, expectedStart] :
+       {std::pair{"b.m4a", 45 * 1024}, std::pair{"c.m4a", (45 + 66) * 1024}}) {
+    SCOPED_TRACE(name);
+    auto own = decodeToPCM(path(name));
+    ASSERT_TRUE(own);
+    double worst = 0;
+    for (std::size_t i = 0; i < 20000; ++i)
+      worst = std::max(worst, double(std::fabs(own->samples[i] - pcm->samples[expectedStart + i])));
+    EXPECT_LT(worst, 5e-3);
+  }
+
+  // The composed waveform is the composed file's own.
+  auto waveform = RCReadWaveformFile(url("out.waveform"));
+  ASSERT_TRUE(waveform) << waveform.error();
+  RCFileInputWaveformDataSource source(url("out.m4a"), false, 30.0);
+  source.beginLoading();
+  ASSERT_TRUE(source.waitUntilFinished());
+  const RCWaveform& reference = source.waveform();
+  EXPECT_EQ(waveform->sampleRate(), 44100);
+  // The data source decodes the last frame whole; the composed waveform ends
+  // where the container does, less than a frame earlier.
+  EXPECT_LE(waveform->length(), reference.length());
+  EXPECT_GE(waveform->length() + 1024 / 256 + 1, reference.length());
+  const std::size_t common = std::min(waveform->length(), reference.length());
+  int mismatched = 0;
+  for (std::size_t p = 0; p < common; ++p)
+    if (waveform->max(p, 0) != reference.max(p, 0) || waveform->min(p, 0) != reference.min(p, 0))
+      ++mismatched;
+  EXPECT_EQ(mismatched, 0);
+  EXPECT_TRUE(hiddenFiles().empty());
+
+  // The result interoperates with the FFmpeg tool.
+  EXPECT_EQ(std::system(("ffmpeg -v error -i '" + path("out.m4a") + "' -f null -").c_str()), 0);
+}
+
+TEST_F(ComposerTest, CopyTrimsRangesInsideFragments) {
+  ASSERT_TRUE(writeTone(path("a.m4a"), 2.0, "m4a", 44100, 2, 400));
+  ASSERT_TRUE(writeTone(path("b.m4a"), 2.0, "m4a", 44100, 2, 800));
+  // The first range starts exactly; the second on a frame, after one pre-roll frame.
+  std::vector<RCComposerSegment> segments = {
+      {url("a.m4a"), 0.5, 0.8}, {url("b.m4a"), 1.1, 0.6}, {url("a.m4a"), 1.5, 0.5}};
+  auto status = RCComposeAudio(segments, url("out.m4a"));
+  ASSERT_TRUE(status) << status.error();
+  EXPECT_TRUE(logged("by stream copy"));
+  EXPECT_FALSE(fs::exists(path("out.waveform")));
+  auto pcm = decodeToPCM(path("out.m4a"));
+  ASSERT_TRUE(pcm) << pcm.error();
+  EXPECT_EQ(pcm->channels, 2);
+  const double joins = 2;
+  EXPECT_GE(pcm->seconds(), 1.9 + joins * kAACFrame - 1e-6);
+  EXPECT_LE(pcm->seconds(), 1.9 + (3 * joins + 1) * kAACFrame);
+  EXPECT_NEAR(containerSeconds(path("out.m4a")), pcm->seconds(), (joins + 1) * kAACFrame);
+  EXPECT_NEAR(toneAt(*pcm, 0.05, 0.75), 400, 4);
+  EXPECT_NEAR(toneAt(*pcm, 0.9, 1.35), 800, 6);
+  EXPECT_NEAR(toneAt(*pcm, 1.5, 1.9), 400, 6);
+}
+
+TEST_F(ComposerTest, ReencodesMixedFormatsToTheFirstFragmentsFormat) {
+  ASSERT_TRUE(writeTone(path("a.m4a"), 1.0, "m4a", 44100, 1, 300));
+  ASSERT_TRUE(writeTone(path("b.flac"), 1.0, "flac", 48000, 2, 600));
+  ASSERT_TRUE(writeTone(path("c.wav"), 1.0, "wav", 22050, 1, 900));
+  // Same codec, other rate: also not copyable.
+  ASSERT_TRUE(writeTone(path("d.m4a"), 1.0, "m4a", 32000, 1, 1200));
+  std::vector<RCComposerSegment> segments = {{url("a.m4a"), 0.0, 1.0},
+                                             {url("b.flac"), 0.25, 0.5},
+                                             {url("c.wav"), 0.0, 1.0},
+                                             {url("d.m4a"), 0.5, 0.5}};
+  auto status = RCComposeAudio(segments, url("out.m4a"), url("out.waveform"));
+  ASSERT_TRUE(status) << status.error();
+  EXPECT_TRUE(logged("by re-encoding"));
+  auto pcm = decodeToPCM(path("out.m4a"));
+  ASSERT_TRUE(pcm) << pcm.error();
+  EXPECT_EQ(pcm->sampleRate, 44100);
+  EXPECT_EQ(pcm->channels, 1);
+  const double joins = 3;
+  EXPECT_NEAR(pcm->seconds(), 3.0, kAACFrame + 0.002);
+  EXPECT_NEAR(containerSeconds(path("out.m4a")), pcm->seconds(), (joins + 1) * kAACFrame);
+  EXPECT_NEAR(toneAt(*pcm, 0.1, 0.9), 300, 3);
+  EXPECT_NEAR(toneAt(*pcm, 1.1, 1.4), 600, 6);
+  EXPECT_NEAR(toneAt(*pcm, 1.6, 2.4), 900, 4);
+  EXPECT_NEAR(toneAt(*pcm, 2.6, 2.95), 1200, 8);
+  auto waveform = RCReadWaveformFile(url("out.waveform"));
+  ASSERT_TRUE(waveform) << waveform.error();
+  EXPECT_EQ(waveform->sampleRate(), 44100);
+  EXPECT_NEAR(waveform->durationSeconds(), 3.0, 0.01);
+}
+
+TEST_F(ComposerTest, LosslessTargetsAreSampleExact) {
+  ASSERT_TRUE(writeTone(path("a.flac"), 1.0, "flac", 48000, 2, 500));
+  ASSERT_TRUE(writeTone(path("b.flac"), 1.0, "flac", 48000, 2, 1000));
+  ASSERT_TRUE(writeTone(path("c.wav"), 1.0, "wav", 48000, 1, 700));
+  ASSERT_TRUE(writeTone(path("d.m4a"), 1.0, "m4a", 48000, 2, 250));
+  struct Case {
+    std::string destination;
+    std::vector<RCComposerSegment> segments;
+    std::size_t frames;
+  };
+  for (const Case& c : {
+           Case{"out.flac", {{url("a.flac"), 0.0, 1.0}, {url("b.flac"), 0.0, 1.0}}, 96000},
+           Case{"trim.flac", {{url("a.flac"), 0.1, 0.25}, {url("b.flac"), 0.5, 0.125}}, 18000},
+           Case{"out.wav", {{url("c.wav"), 0.5, 0.5}, {url("a.flac"), 0.0, 0.25}}, 36000},
+           Case{"mixed.flac", {{url("d.m4a"), 0.25, 0.5}, {url("c.wav"), 0.0, 0.5}}, 48000},
+       }) {
+    SCOPED_TRACE(c.destination);
+    auto status = RCComposeAudio(c.segments, url(c.destination));
+    ASSERT_TRUE(status) << status.error();
+    auto pcm = decodeToPCM(path(c.destination));
+    ASSERT_TRUE(pcm) << pcm.error();
+    EXPECT_EQ(pcm->sampleRate, 48000);
+    EXPECT_EQ(pcm->frames(), c.frames);
+    EXPECT_NEAR(containerSeconds(path(c.destination)), pcm->seconds(), 1e-6);
+  }
+  // Lossless all the way: the composed samples are the fragment's samples.
+  auto a = decodeToPCM(path("a.flac"));
+  auto out = decodeToPCM(path("trim.flac"));
+  ASSERT_TRUE(a && out);
+  const std::size_t offset = 4800 * 2;  // 0.1 s, two channels
+  double worst = 0;
+  for (std::size_t i = 0; i < 12000 * 2; ++i)
+    worst = std::max(worst, double(std::fabs(a->samples[offset + i] - out->samples[i])));
+  EXPECT_LT(worst, 1e-6);
+}
+
+TEST_F(ComposerTest, ComposesOverItsOwnInputAndFFmpegToolFragments) {
+  ASSERT_TRUE(writeTone(path("rec.m4a"), 1.0, "m4a", 44100, 1, 300));
+  ASSERT_EQ(std::system(("ffmpeg -v error -y -f lavfi -i 'sine=f=600:d=1:r=44100' -c:a aac '" +
+                         path("cli.m4a") + "'")
+                            .c_str()),
+            0);
+  // The composed file is itself the first fragment of the new composition.
+  auto status =
+      RCComposeAudio({{url("rec.m4a"), 0.0, 1.0}, {url("cli.m4a"), 0.0, 1.0}}, url("rec.m4a"));
+  ASSERT_TRUE(status) << status.error();
+  auto pcm = decodeToPCM(path("rec.m4a"));
+  ASSERT_TRUE(pcm);
+  EXPECT_NEAR(pcm->seconds(), 2.0, 3 * kAACFrame);
+  EXPECT_NEAR(toneAt(*pcm, 0.1, 0.9), 300, 3);
+  EXPECT_NEAR(toneAt(*pcm, 1.2, 1.9), 600, 3);
+  EXPECT_TRUE(hiddenFiles().empty());
+}
+
+TEST_F(ComposerTest, BadInputFailsWithoutTouchingTheDestination) {
+  ASSERT_TRUE(testing::writeDamagedAudio(dir_.string()));
+  ASSERT_TRUE(writeTone(path("good.m4a"), 1.0, "m4a"));
+  ASSERT_TRUE(writeTone(path("good.wav"), 1.0, "wav"));
+  ASSERT_TRUE(writeTone(path("old.m4a"), 0.5, "m4a", 44100, 1, 100));
+  const std::string before = testing::readFile(path("old.m4a"));
+  const double nan = std::nan("");
+  struct Case {
+    const char* what;
+    std::vector<RCComposerSegment> segments;
+    platform::URL destination;
+  };
+  const platform::URL old = url("old.m4a");
+  for (const Case& c : std::vector<Case>{
+           {"no fragments", {}, old},
+           {"missing fragment", {{url("good.m4a"), 0, 1}, {url("gone.m4a"), 0, 1}}, old},
+           {"text renamed", {{url("good.m4a"), 0, 1}, {url("text.m4a"), 0, 1}}, old},
+           {"truncated data", {{url("good.wav"), 0, 1}, {url("cut.wav"), 0, 2}}, old},
+           {"truncated audio (copy)", {{url("good.m4a"), 0, 1}, {url("cutdata.m4a"), 0, 2}}, old},
+           {"range past the end (copy)", {{url("good.m4a"), 0.5, 1.5}}, old},
+           {"range past the end (re-encode)", {{url("good.wav"), 0, 2}}, old},
+           {"no audio stream", {{url("video.m4a"), 0, 0.5}}, old},
+           {"negative start", {{url("good.m4a"), -1, 1}}, old},
+           {"empty range", {{url("good.m4a"), 0, 0}}, old},
+           {"NaN range", {{url("good.m4a"), nan, 1}}, old},
+           {"unknown container", {{url("good.m4a"), 0, 1}}, url("out.mp3")},
+           {"missing directory", {{url("good.m4a"), 0, 1}}, url("nowhere/out.m4a")},
+       }) {
+    SCOPED_TRACE(c.what);
+    auto status = RCComposeAudio(c.segments, c.destination, url("old.waveform"));
+    ASSERT_FALSE(status);
+    EXPECT_FALSE(status.error().localizedDescription().empty());
+    EXPECT_EQ(testing::readFile(path("old.m4a")), before);
+    EXPECT_FALSE(fs::exists(path("old.waveform")));
+    EXPECT_FALSE(fs::exists(path("out.mp3")));
+    EXPECT_TRUE(hiddenFiles().empty()) << hiddenFiles().front();
+  }
+  EXPECT_TRUE(logged("ERROR: Composing old.m4a failed: "));
+}
+
+}  // namespace
+}  // namespace quorvel

@@ -1,0 +1,237 @@
+// Titles written into and read from m4a files: both movie layouts, several
+// languages side by side, interplay with titles written by the ffmpeg CLI,
+// and files that must be refused without being touched.
+#include "Quorvel/media/RCMP4Atoms.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+extern "C" {
+#include <libavformat/avformat.h>
+}
+
+#include <filesystem>
+#include <fstream>
+#include <map>
+
+#include "Quorvel/media/RCFFmpegLogging.h"
+#include "tests/support/AudioFixtures.h"
+#include "tests/support/TempDirectory.h"
+
+namespace quorvel {
+
+void PrintTo(const RCMetadataItem& item, std::ostream* out) {
+  *out << '"' << item.stringValue << "\"@" << (item.language.empty() ? "-" : item.language);
+}
+
+namespace {
+
+namespace fs = std::filesystem;
+using testing::decodeToPCM;
+using testing::M4ALayout;
+using testing::writeTone;
+
+// What libavformat itself reports, as any other program using it would see.
+std::map<std::string, std::string> libavformatTags(const std::string& path) {
+  RCInstallFFmpegLogging();
+  std::map<std::string, std::string> tags;
+  AVFormatContext* input = nullptr;
+  if (avformat_open_input(&input, path.c_str(), nullptr, nullptr) < 0) return tags;
+  const AVDictionaryEntry* entry = nullptr;
+  while ((entry = av_dict_get(input->metadata, "", entry, AV_DICT_IGNORE_SUFFIX))) {
+    tags[entry->key] = entry->value;
+  }
+  avformat_close_input(&input);
+  return tags;
+}
+
+std::size_t atomPosition(const std::string& bytes, const char* type) {
+  auto atoms = RCMP4TopLevelAtoms(bytes.size(),
+                                  [&](std::uint64_t offset, std::size_t size, std::uint8_t* out) {
+                                    if (offset + size > bytes.size()) return false;
+                                    std::memcpy(out, bytes.data() + offset, size);
+                                    return true;
+                                  });
+  if (!atoms) return std::string::npos;
+  for (std::size_t i = 0; i < atoms->size(); ++i) {
+    if ((*atoms)[i].type == type) return i;
+  }
+  return std::string::npos;
+}
+
+using RCMP4AtomsTest = testing::TempDirectoryTest;
+using testing::readFile;
+
+TEST_F(RCMP4AtomsTest, LanguagesSideBySideInBothLayoutsKeepTheAudio) {
+  for (M4ALayout layout : {M4ALayout::MoovAtEnd, M4ALayout::MoovFirst}) {
+    const bool moovFirst = layout == M4ALayout::MoovFirst;
+    SCOPED_TRACE(moovFirst ? "moov first" : "moov at end");
+    const std::string file = path(moovFirst ? "first.m4a" : "end.m4a");
+    ASSERT_TRUE(writeTone(file, 2.0, "m4a", 44100, 2, 660.0, 0.4, layout));
+    auto before = decodeToPCM(file);
+    ASSERT_TRUE(before);
+
+    ASSERT_TRUE(RCMP4WriteTitle(file, "Spaziergang", "deu"));
+    ASSERT_TRUE(RCMP4WriteTitle(file, "A walk", "eng"));
+    ASSERT_TRUE(RCMP4WriteTitle(file, "Promenade", "fr"));  // BCP-47 becomes "fra"
+    ASSERT_TRUE(RCMP4WriteTitle(file, "Gang", "ger"));      // the same language as "deu"
+
+    auto items = RCMP4ReadTitleItems(file);
+    ASSERT_TRUE(items) << items.error();
+    EXPECT_EQ(*items, (std::vector<RCMetadataItem>{
+                          {"Gang", "deu"}, {"A walk", "eng"}, {"Promenade", "fra"}}));
+
+    auto tags = libavformatTags(file);
+    EXPECT_EQ(tags["title-deu"], "Gang");
+    EXPECT_EQ(tags["title-eng"], "A walk");
+    EXPECT_EQ(tags["title-fra"], "Promenade");
+
+    // Same packets at (moved) offsets: the decoding is sample for sample the same.
+    auto after = decodeToPCM(file);
+    ASSERT_TRUE(after);
+    EXPECT_EQ(after->frames(), before->frames());
+    EXPECT_EQ(testing::maxAbsDifference(*before, *after), 0.0);
+
+    const std::string bytes = readFile(file);
+    EXPECT_EQ(atomPosition(bytes, "moov") < atomPosition(bytes, "mdat"), moovFirst);
+    for (const auto& entry : fs::directory_iterator(dir_)) {
+      EXPECT_EQ(entry.path().filename().string().find(".title-"), std::string::npos)
+          << "temporary file left behind";
+    }
+  }
+}
+
+TEST_F(RCMP4AtomsTest, ASingleTaggedTitleIsOneItemThoughLibavformatShowsTwo) {
+  const std::string file = path("one.m4a");
+  ASSERT_TRUE(writeTone(file, 0.5, "m4a"));
+  ASSERT_TRUE(RCMP4WriteTitle(file, "Nur Deutsch", "deu"));
+  auto tags = libavformatTags(file);
+  EXPECT_EQ(tags["title"], "Nur Deutsch");  // the blur the atom reader exists for
+  auto items = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Nur Deutsch", "deu"}}));
+}
+
+TEST_F(RCMP4AtomsTest, UntaggedTitlesFromTheMuxerAndOursAreOneTitle) {
+  // The muxer writes an untagged title as an iTunes-style item.
+  const std::string file = path("muxed.m4a");
+  testing::ToneSpec tone;
+  tone.seconds = 0.5;
+  tone.metadata = {{"title", "From the muxer"}};
+  ASSERT_TRUE(writeTone(file, tone));
+  auto items = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"From the muxer", ""}}));
+
+  ASSERT_TRUE(RCMP4WriteTitle(file, "Tagged", "deu"));
+  items = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(items->size(), 2u);
+
+  // Writing the untagged title replaces the muxer's rather than adding one.
+  ASSERT_TRUE(RCMP4WriteTitle(file, "", ""));
+  ASSERT_TRUE(RCMP4WriteTitle(file, "Ours", ""));
+  items = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Tagged", "deu"}, {"Ours", ""}}));
+  EXPECT_EQ(libavformatTags(file)["title-deu"], "Tagged");
+}
+
+TEST_F(RCMP4AtomsTest, TitlesWrittenByTheFFmpegCommandLineAreRead) {
+  // The QuickTime muxer writes a udta text title tagged "und".
+  const std::string file = path("cli.mov");
+  const std::string command =
+      "ffmpeg -nostdin -hide_banner -loglevel error -y -f lavfi -i sine=d=0.3 -c:a aac "
+      "-metadata title=Plain '" +
+      file + "'";
+  ASSERT_EQ(std::system(command.c_str()), 0);
+  auto items = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Plain", ""}}));
+  ASSERT_TRUE(RCMP4WriteTitle(file, "Hallo", "deu"));
+  items = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Plain", ""}, {"Hallo", "deu"}}));
+}
+
+TEST_F(RCMP4AtomsTest, RefusedFilesAreLeftAsTheyWere) {
+  const std::string text = path("text.m4a");
+  std::ofstream(text) << "just some text, not a movie\n";
+  const std::string truncated = path("truncated.m4a");
+  ASSERT_TRUE(writeTone(truncated, 1.0, "m4a"));  // movie header at the end
+  fs::resize_file(truncated, fs::file_size(truncated) - 100);
+  const std::string flac = path("tone.flac");
+  ASSERT_TRUE(writeTone(flac, 0.2, "flac"));
+  const std::string empty = path("empty.m4a");
+  std::ofstream(empty).flush();
+
+  for (const std::string& file : {text, truncated, flac, empty}) {
+    SCOPED_TRACE(file);
+    const std::string before = readFile(file);
+    auto status = RCMP4WriteTitle(file, "x", "deu");
+    ASSERT_FALSE(status);
+    EXPECT_EQ(status.error().domain(), kRCMP4ErrorDomain);
+    EXPECT_EQ(readFile(file), before);
+    EXPECT_FALSE(RCMP4ReadTitleItems(file));
+  }
+  EXPECT_FALSE(RCMP4WriteTitle(path("missing.m4a"), "x", "deu"));
+  EXPECT_FALSE(RCMP4WriteTitle(dir_.string(), "x", "deu"));
+
+  const std::string good = path("good.m4a");
+  ASSERT_TRUE(writeTone(good, 0.2, "m4a"));
+  EXPECT_FALSE(RCMP4WriteTitle(good, "x", "not a language"));
+  EXPECT_FALSE(RCMP4WriteTitle(good, std::string(70000, 'x'), "deu"));
+}
+
+TEST_F(RCMP4AtomsTest, PermissionsSurviveTheReplacement) {
+  const std::string file = path("mode.m4a");
+  ASSERT_TRUE(writeTone(file, 0.2, "m4a"));
+  fs::permissions(file, fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read);
+  ASSERT_TRUE(RCMP4WriteTitle(file, "x", "eng"));
+  EXPECT_EQ(fs::status(file).permissions() & fs::perms::all,
+            fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read);
+}
+
+TEST(RCMP4AtomsImageTest, ChunkOffsetsMoveOnlyBehindTheMovie) {
+  // A hand-built file: ftyp, moov with one stco holding offsets before and
+  // after the movie, then mdat.
+  auto be32 = [](std::string& out, std::uint32_t v) {
+    for (int s = 24; s >= 0; s -= 8) out.push_back(char(v >> s));
+  };
+  auto atom = [&](const char* type, const std::string& payload) {
+    std::string out;
+    be32(out, std::uint32_t(payload.size() + 8));
+    out += type;
+    return out + payload;
+  };
+  std::string stco;
+  be32(stco, 0);
+  be32(stco, 3);
+  be32(stco, 4);      // inside ftyp: before the movie, stays
+  be32(stco, 500);    // in mdat
+  be32(stco, 70000);  // far beyond
+  const std::string moov =
+      atom("moov", atom("trak", atom("mdia", atom("minf", atom("stbl", atom("stco", stco))))));
+  const std::string file = atom("ftyp", "M4A ") + moov + atom("mdat", std::string(600, '\0'));
+  auto image = RCMP4FileImageWithTitle(
+      std::span(reinterpret_cast<const std::uint8_t*>(file.data()), file.size()), "T", "eng");
+  ASSERT_TRUE(image) << image.error();
+  const std::int64_t delta = std::int64_t(image->size()) - std::int64_t(file.size());
+  EXPECT_EQ(delta, 8 + 8 + 4 + 1);  // udta + ©nam headers, length and language, "T"
+  std::string out(image->begin(), image->end());
+  const std::size_t at = out.find("stco") + 4 + 8;
+  auto read32 = [&](std::size_t p) {
+    return std::uint32_t(std::uint8_t(out[p])) << 24 |
+           std::uint32_t(std::uint8_t(out[p + 1])) << 16 |
+           std::uint32_t(std::uint8_t(out[p + 2])) << 8 | std::uint8_t(out[p + 3]);
+  };
+  EXPECT_EQ(read32(at), 4u);
+  EXPECT_EQ(read32(at + 4), 500u + delta);
+  EXPECT_EQ(read32(at + 8), 70000u + delta);
+  auto items = RCMP4TitleItemsInFileImage(*image);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"T", "eng"}}));
+}
+
+}  // namespace
+}  // namespace quorvel

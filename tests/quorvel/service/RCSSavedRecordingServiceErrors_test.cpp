@@ -1,0 +1,149 @@
+// The wire contract: error values to D-Bus error replies and back, and access
+// tokens through their (siss) tuple.
+#include <gtest/gtest.h>
+
+#include "Quorvel/errors/RCError.h"
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
+
+namespace quorvel {
+namespace {
+
+TEST(ServiceErrorsTest, EveryServiceCodeTravelsUnderItsOwnNameAndComesBack) {
+  struct Case {
+    RCSSavedRecordingServiceErrorCode code;
+    const char* name;
+  };
+  for (Case c : {Case{RCSSavedRecordingServiceErrorMissingCompositionAVURL,
+                      "org.quorvel.SavedRecordingService.Error.MissingCompositionAVURL"},
+                 Case{RCSSavedRecordingServiceErrorConflictingSession,
+                      "org.quorvel.SavedRecordingService.Error.ConflictingSession"},
+                 Case{RCSSavedRecordingServiceErrorDeferredRequestSuperseded,
+                      "org.quorvel.SavedRecordingService.Error.DeferredRequestSuperseded"},
+                 Case{RCSSavedRecordingServiceErrorCompositionFailed,
+                      "org.quorvel.SavedRecordingService.Error.CompositionFailed"}}) {
+    platform::Error error = RCSSavedRecordingServiceError(c.code);
+    EXPECT_EQ(error.domain(), "org.quorvel.SavedRecordingService.ErrorDomain");
+    RCSDBusError reply = RCSDBusErrorFromError(error);
+    EXPECT_EQ(reply.name, c.name);
+    EXPECT_NE(reply.message.find("org.quorvel.SavedRecordingService.ErrorDomain"),
+              std::string::npos);
+    EXPECT_NE(reply.message.find(std::to_string(c.code)), std::string::npos);
+    platform::Error back = RCSErrorFromDBusError(reply.name, reply.message);
+    EXPECT_EQ(back.domain(), error.domain());
+    EXPECT_EQ(back.code(), c.code);
+    EXPECT_EQ(back.underlyingError(), nullptr);
+    // A client that only has the name still gets the code.
+    EXPECT_EQ(RCSErrorFromDBusError(reply.name, "").code(), c.code);
+  }
+}
+
+TEST(ServiceErrorsTest, OtherErrorsAreGenericButKeepDomainCodeTextAndUnderlyingChain) {
+  platform::Error failed =
+      RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorCompositionFailed);
+  platform::Error generic = RCGenericErrorWithUnderlyingError(failed);
+  ASSERT_NE(generic.underlyingError(), nullptr);
+  EXPECT_EQ(generic.underlyingError()->code(), 401);
+
+  RCSDBusError reply = RCSDBusErrorFromError(generic);
+  EXPECT_EQ(reply.name, "org.quorvel.Error.Generic");
+  platform::Error back = RCSErrorFromDBusError(reply.name, reply.message);
+  EXPECT_EQ(back.domain(), RCErrorDomain);
+  EXPECT_EQ(back.code(), RCErrorCodeGeneric);
+  EXPECT_EQ(back.localizedDescription(), generic.localizedDescription());
+  ASSERT_NE(back.underlyingError(), nullptr);
+  EXPECT_EQ(*back.underlyingError(), failed);
+
+  // An unknown code of the service domain, and text with quotes and markers.
+  platform::Error odd(RCSSavedRecordingServiceErrorDomain, 999, "say \"hi\" Code=3");
+  reply = RCSDBusErrorFromError(odd);
+  EXPECT_EQ(reply.name, "org.quorvel.Error.Generic");
+  back = RCSErrorFromDBusError(reply.name, reply.message);
+  EXPECT_EQ(back, odd);
+  EXPECT_EQ(back.localizedDescription(), "say \"hi\" Code=3");
+
+  platform::Error posix = platform::posixError(ENOENT, "open x");
+  back = RCSErrorFromDBusError("org.quorvel.Error.Generic", RCSDBusErrorFromError(posix).message);
+  EXPECT_EQ(back.domain(), platform::kPOSIXErrorDomain);
+  EXPECT_EQ(back.code(), ENOENT);
+}
+
+TEST(ServiceErrorsTest, RepliesFromOtherSendersBecomeErrorsNamedAfterThem) {
+  platform::Error noReply =
+      RCSErrorFromDBusError("org.freedesktop.DBus.Error.NoReply", "Did not receive a reply");
+  EXPECT_EQ(noReply.domain(), "org.freedesktop.DBus.Error.NoReply");
+  EXPECT_EQ(noReply.localizedDescription(), "Did not receive a reply");
+  platform::Error generic = RCSErrorFromDBusError("org.quorvel.Error.Generic", "garbled");
+  EXPECT_EQ(generic.domain(), RCErrorDomain);
+  EXPECT_EQ(generic.code(), RCErrorCodeGeneric);
+  // Half a description: domain without code is not taken for one.
+  EXPECT_EQ(RCSErrorFromDBusError("x.y", "Error Domain=abc").domain(), "x.y");
+  EXPECT_EQ(RCSErrorFromDBusError("x.y", "Error Domain=abc Code=").domain(), "x.y");
+}
+
+TEST(AccessTokenTest, TupleRoundTripComparesEqualAndSeparateTokensNever) {
+  platform::URL url = platform::URL::fileURLWithPath("/r/My Walk #1.m4a");
+  auto kept = RCSSavedRecordingAccessToken::tokenWithName("preview", 1, url);
+  auto tuple = kept.toTuple();
+  EXPECT_EQ(std::get<0>(tuple), "preview");
+  EXPECT_EQ(std::get<1>(tuple), 1);
+  EXPECT_EQ(std::get<2>(tuple), url.absoluteString());
+  auto back = RCSSavedRecordingAccessToken::fromTuple(tuple);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back, kept);
+  // Clients may hand the identifier back in lower case.
+  std::string lower = std::get<3>(tuple);
+  for (char& c : lower) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+  std::get<3>(tuple) = lower;
+  EXPECT_EQ(*RCSSavedRecordingAccessToken::fromTuple(tuple), kept);
+
+  // Two shared sessions of one name on one recording hold different tokens.
+  auto other = RCSSavedRecordingAccessToken::tokenWithName("preview", 1, url);
+  EXPECT_NE(other, kept);
+  // Every field takes part in equality.
+  auto changed = kept.toTuple();
+  std::get<0>(changed) = "export";
+  EXPECT_NE(*RCSSavedRecordingAccessToken::fromTuple(changed), kept);
+  changed = kept.toTuple();
+  std::get<1>(changed) = 2;
+  EXPECT_NE(*RCSSavedRecordingAccessToken::fromTuple(changed), kept);
+  changed = kept.toTuple();
+  std::get<2>(changed) = "file:///r/Other.m4a";
+  EXPECT_NE(*RCSSavedRecordingAccessToken::fromTuple(changed), kept);
+}
+
+TEST(AccessTokenTest, NoTokenAndMalformedTuplesAreNoToken) {
+  EXPECT_FALSE(
+      RCSSavedRecordingAccessToken::fromTuple(RCSSavedRecordingAccessToken::noTokenTuple()));
+  EXPECT_EQ(RCSSavedRecordingAccessToken::noTokenTuple(),
+            (RCSSavedRecordingAccessToken::Tuple{"", 0, "", ""}));
+  auto good = RCSSavedRecordingAccessToken::tokenWithName(
+                  "capture", 2, platform::URL::fileURLWithPath("/r/a.m4a"))
+                  .toTuple();
+  auto bad = good;
+  std::get<3>(bad) = "not-a-uuid";
+  EXPECT_FALSE(RCSSavedRecordingAccessToken::fromTuple(bad));
+  bad = good;
+  std::get<2>(bad) = "http://example.com/a.m4a";
+  EXPECT_FALSE(RCSSavedRecordingAccessToken::fromTuple(bad));
+  // A token without a URL is still a token, just for no recording.
+  bad = good;
+  std::get<2>(bad) = "";
+  auto noURL = RCSSavedRecordingAccessToken::fromTuple(bad);
+  ASSERT_TRUE(noURL);
+  EXPECT_FALSE(noURL->compositionAVURL());
+}
+
+TEST(AccessTokenTest, DebugDescriptionNamesEveryField) {
+  auto token = RCSSavedRecordingAccessToken::tokenWithName(
+      "trimming", 2, platform::URL::fileURLWithPath("/r/a b.m4a"));
+  std::string text = token.debugDescription();
+  for (const std::string& part :
+       {std::string("trimming"), std::string("exclusive"), std::string("file:///r/a%20b.m4a"),
+        token.identifier().string()}) {
+    EXPECT_NE(text.find(part), std::string::npos) << text;
+  }
+}
+
+}  // namespace
+}  // namespace quorvel

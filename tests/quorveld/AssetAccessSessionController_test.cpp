@@ -1,0 +1,114 @@
+// The session registry: the conflict rule, lookups by token, recording and
+// connection, closing, and the dump's text.
+#include <gtest/gtest.h>
+
+#include <regex>
+
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
+#include "platform/dbus/Connection.h"
+#include "quorveld/AssetAccessSessionController.h"
+#include "quorveld/RCSXPCTransactionController.h"
+
+namespace quorvel {
+namespace {
+
+class SessionRegistryTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<AssetAccessSession> open(const platform::URL& url, bool exclusive,
+                                           std::shared_ptr<platform::Connection> connection = {},
+                                           std::optional<platform::Error>* error = nullptr) {
+    return registry_.openAccessSessionWithName(exclusive ? "capture" : "preview",
+                                               std::move(connection), url, exclusive, error);
+  }
+  void TearDown() override {
+    for (const auto& session : registry_.activeSessions()) registry_.closeSession(session);
+    EXPECT_FALSE(RCSXPCTransactionController::sharedInstance().isInTransaction());
+  }
+
+  AssetAccessSessionController registry_;
+  platform::URL walk_ = platform::URL::fileURLWithPath("/recordings/Walk.m4a");
+  platform::URL talk_ = platform::URL::fileURLWithPath("/recordings/Talk.m4a");
+};
+
+TEST_F(SessionRegistryTest, ExclusiveNeedsTheRecordingAloneSharedOnlyExcludesExclusive) {
+  std::optional<platform::Error> error = platform::Error("stale", 1);
+  auto first = open(walk_, /*exclusive=*/false, {}, &error);
+  ASSERT_TRUE(first);
+  EXPECT_FALSE(error);  // a success writes "no error"
+  auto second = open(walk_, false);
+  ASSERT_TRUE(second);
+  EXPECT_EQ(registry_.activeSessionsWithWithCompositionAVURL(walk_).size(), 2u);
+  EXPECT_NE(first->accessToken(), second->accessToken());  // even same name and recording
+
+  EXPECT_FALSE(open(walk_, /*exclusive=*/true, {}, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(*error, RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorConflictingSession));
+  EXPECT_EQ(registry_.activeSessions().size(), 2u);  // the table is as it was
+
+  auto exclusive = open(talk_, true);
+  ASSERT_TRUE(exclusive);
+  EXPECT_EQ(exclusive->accessToken().accessType(), 2);
+  EXPECT_FALSE(open(talk_, false));
+  EXPECT_FALSE(open(talk_, true));
+
+  // Closing one shared session leaves the other; closing all frees the
+  // recording for an exclusive session even though its (empty) list stays.
+  registry_.closeSession(first);
+  EXPECT_EQ(registry_.activeSessionsWithWithCompositionAVURL(walk_),
+            AssetAccessSessionList{second});
+  EXPECT_FALSE(open(walk_, true));
+  registry_.closeSession(second);
+  EXPECT_TRUE(open(walk_, true));
+}
+
+TEST_F(SessionRegistryTest, SessionsAreFoundByEqualTokenRecordingAndConnection) {
+  auto connection = platform::Connection::createForListener(":1.9");
+  auto withClient = open(walk_, false, connection);
+  auto daemonOwn = open(walk_, false);  // like the daemon's own finalize session
+
+  auto tuple = withClient->accessToken().toTuple();
+  auto copy = RCSSavedRecordingAccessToken::fromTuple(tuple);  // as it comes back from a client
+  ASSERT_TRUE(copy);
+  EXPECT_EQ(registry_.activeSessionWithAccessToken(*copy), withClient);
+  EXPECT_EQ(registry_.activeSessionWithAccessToken(daemonOwn->accessToken()), daemonOwn);
+  EXPECT_FALSE(registry_.activeSessionWithAccessToken(
+      RCSSavedRecordingAccessToken::tokenWithName("preview", 1, walk_)));
+  EXPECT_EQ(registry_.activeSessionsWithXPCConnection(connection),
+            AssetAccessSessionList{withClient});
+  EXPECT_TRUE(registry_.activeSessionsWithXPCConnection(nullptr).empty());
+}
+
+TEST_F(SessionRegistryTest, EachSessionKeepsTheProcessAliveUntilClosed) {
+  auto& controller = RCSXPCTransactionController::sharedInstance();
+  auto session = open(walk_, true);
+  EXPECT_TRUE(session->xpcTransaction()->isActive());
+  EXPECT_EQ(
+      session->xpcTransaction()->name(),
+      "Opening access session for compositionAVURL: /recordings/Walk.m4a, connection: (null)");
+  EXPECT_TRUE(controller.isInTransaction());
+  registry_.closeSession(session);
+  EXPECT_FALSE(session->xpcTransaction()->isActive());
+  registry_.closeSession(session);  // a second close changes nothing
+  EXPECT_FALSE(controller.isInTransaction());
+}
+
+TEST_F(SessionRegistryTest, DumpPrintsOneLineWhenEmptyAndABlockPerRecording) {
+  EXPECT_EQ(registry_.stateDescription(),
+            "[" + registry_.description() + "] *** No Active Sessions ***\n");
+  auto walk = open(walk_, false);
+  auto walkToo = open(walk_, false);
+  auto talk = open(talk_, true);
+  std::string dump = registry_.stateDescription();
+  std::string expected =
+      "[" + registry_.description() + "] *** Active Sessions (by compositionAVURL/URL) ***\n\n" +
+      "compositionAVURL = file:///recordings/Walk.m4a\n" +
+      "\tActive Sessions (2) = " + walk->debugDescription() + "; " + walkToo->debugDescription() +
+      "\n" + "\tComposition Metadata = (null)\n\n\n" +
+      "compositionAVURL = file:///recordings/Talk.m4a\n" +
+      "\tActive Sessions (1) = " + talk->debugDescription() + "\n" +
+      "\tComposition Metadata = (null)\n\n\n" + std::string(41, '*') + "\n";
+  EXPECT_EQ(dump, expected);
+}
+
+}  // namespace
+}  // namespace quorvel

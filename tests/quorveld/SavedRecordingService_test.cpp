@@ -1,0 +1,346 @@
+// The service core without a bus: start-up and its keep-alive timeline,
+// client connections, the requests' entry checks, launch events and the
+// debug dump. Driven through the in-process listener and a manual clock.
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <latch>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
+#include "platform/Log.h"
+#include "platform/MainQueue.h"
+#include "platform/NotificationCenter.h"
+#include "platform/ProcessLifetime.h"
+#include "platform/dbus/LocalListener.h"
+#include "quorveld/RCSAdditions.h"
+#include "quorveld/RCSXPCTransactionController.h"
+#include "quorveld/SavedRecordingService.h"
+
+namespace quorvel {
+namespace {
+
+using namespace std::chrono_literals;
+using platform::BusValue;
+using platform::BusValues;
+
+struct LogLine {
+  int level;
+  std::string text;
+};
+
+class ServiceTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    // The process-wide lifetime and controller stay on the real main queue;
+    // only what the service schedules from now on goes to the test's queue.
+    (void)platform::ProcessLifetime::instance();
+    (void)RCSXPCTransactionController::sharedInstance();
+    ASSERT_FALSE(controller().isInTransaction());
+    platform::setMainQueueForTesting(&main_);
+    platform::setConsoleLogging(false);
+    platform::setLogThreshold(platform::kLogLevelDebug);
+    platform::setLogSinkForTesting([this](int level, std::string_view text) {
+      std::lock_guard lock(mutex_);
+      lines_.push_back({level, std::string(text)});
+    });
+    service_ = SavedRecordingService::makeForTesting();
+    service_->setListenerFactory(
+        [this](const std::string&, platform::InterfaceDescription interface) {
+          auto listener = std::make_shared<platform::LocalListener>(std::move(interface));
+          listener_ = listener;
+          return listener;
+        });
+  }
+
+  void TearDown() override {
+    // Let every queued block and every delayed end run, then drop the service.
+    // (twice: a timer may queue service work whose own end comes later).
+    advance(10s);
+    advance(10s);
+    listener_.reset();
+    service_.reset();
+    platform::setMainQueueForTesting(nullptr);
+    platform::setLogSinkForTesting(nullptr);
+    platform::setLogThreshold(platform::kLogLevelNotice);
+    EXPECT_FALSE(controller().isInTransaction());
+  }
+
+  static RCSXPCTransactionController& controller() {
+    return RCSXPCTransactionController::sharedInstance();
+  }
+  void drainServiceQueue() {
+    service_->serviceSerialQueue().sync([] {});
+  }
+  // Moves the clock and runs what is due on the main queue, including the
+  // service-queue work that the due timers start.
+  void advance(std::chrono::nanoseconds by) {
+    clock_.advance(by);
+    main_.runUntilIdle();
+    drainServiceQueue();
+    main_.runUntilIdle();
+  }
+  std::vector<LogLine> lines() {
+    std::lock_guard lock(mutex_);
+    return lines_;
+  }
+  std::vector<std::string> linesContaining(std::string_view needle) {
+    std::vector<std::string> found;
+    for (auto& line : lines()) {
+      if (line.text.find(needle) != std::string::npos) found.push_back(line.text);
+    }
+    return found;
+  }
+  std::shared_ptr<platform::LocalReply> call(const std::string& peer, const std::string& member,
+                                             BusValues arguments = {}, bool noReply = false) {
+    return listener_->deliver(peer, member, std::move(arguments), noReply);
+  }
+
+  platform::ManualClock clock_;
+  platform::MainQueue main_{clock_, "test main"};
+  std::shared_ptr<SavedRecordingService> service_;
+  std::shared_ptr<platform::LocalListener> listener_;
+  std::mutex mutex_;
+  std::vector<LogLine> lines_;
+};
+
+TEST_F(ServiceTest, InitRaisesAndSharedInstanceIsOneObject) {
+  try {
+    SavedRecordingService::init();
+    FAIL() << "init returned";
+  } catch (const GenericException& exception) {
+    EXPECT_STREQ(exception.what(), "-init is invalid. Use +sharedInstance instead.");
+  }
+  EXPECT_EQ(SavedRecordingService::sharedInstance(), SavedRecordingService::sharedInstance());
+}
+
+TEST_F(ServiceTest, QueuesAreLabelledFromTheBundleIdentifier) {
+  EXPECT_EQ(service_->instanceSerialQueue().label(),
+            "org.quorvel.quorveld.SavedRecordingService.InstanceSerialQueue");
+  EXPECT_EQ(service_->serviceSerialQueue().label(),
+            "org.quorvel.quorveld.SavedRecordingService.OperationSerialQueue");
+}
+
+TEST_F(ServiceTest, WithoutClientsTheRootIsHeldUntilTwoSeconds) {
+  EXPECT_FALSE(service_->listener());  // no listener, no connection before start
+  ASSERT_TRUE(service_->start());
+  EXPECT_TRUE(controller().isInTransaction());
+  ASSERT_TRUE(listener_);
+
+  advance(1s);  // the first orphan-handling pass runs
+  EXPECT_EQ(linesContaining("[Orphan-Recovery]").size(), 1u);
+  EXPECT_TRUE(controller().isInTransaction());
+  advance(999ms);
+  EXPECT_TRUE(controller().isInTransaction());
+  advance(1ms);  // the start-up keep-alive and the pass's dispatch both end at 2 s
+  EXPECT_FALSE(controller().isInTransaction());
+}
+
+TEST_F(ServiceTest, ASlowFirstPassHoldsTheRootUntilOneSecondAfterItEnds) {
+  std::latch passMayRun(1);
+  service_->serviceSerialQueue().async([&passMayRun] { passMayRun.wait(); });
+  ASSERT_TRUE(service_->start());
+  clock_.advance(1s);
+  main_.runUntilIdle();  // the pass is queued behind the blocker
+  clock_.advance(1s);
+  main_.runUntilIdle();                         // the start-up keep-alive ends at 2 s...
+  EXPECT_TRUE(controller().isInTransaction());  // ...but the pass has not run
+  passMayRun.count_down();
+  drainServiceQueue();  // the pass ends at 2 s: its dispatch ends at 3 s
+  advance(999ms);
+  EXPECT_TRUE(controller().isInTransaction());
+  advance(1ms);
+  EXPECT_FALSE(controller().isInTransaction());
+}
+
+TEST_F(ServiceTest, ASecondStartKeepsOneListener) {
+  ASSERT_TRUE(service_->start());
+  auto first = service_->listener();
+  ASSERT_TRUE(service_->start());
+  EXPECT_EQ(service_->listener(), first);
+  EXPECT_EQ(linesContaining("Starting service 'org.quorvel.SavedRecordingService'").size(), 1u);
+  advance(1s);
+  EXPECT_EQ(linesContaining("[Orphan-Recovery]").size(), 2u);  // one pass per start
+}
+
+TEST_F(ServiceTest, ConnectionsAreAcceptedOnceAndEndedByVanishingOrLosingTheBus) {
+  ASSERT_TRUE(service_->start());
+  EXPECT_FALSE(call(":1.1", "FetchExportingCompositionAVURLs")->isError());
+  EXPECT_FALSE(call(":1.1", "FetchExportingCompositionAVURLs")->isError());
+  auto connection = listener_->connection(":1.1");
+  ASSERT_TRUE(connection);
+  EXPECT_TRUE(rcs_isValid(*connection));
+  EXPECT_EQ(linesContaining("Listener accepted new connection <connection :1.1>").size(), 1u);
+
+  listener_->vanish(":1.1");
+  drainServiceQueue();
+  EXPECT_FALSE(rcs_isValid(*connection));
+  auto invalidated = linesContaining("Connection invalidated: <connection :1.1>");
+  ASSERT_EQ(invalidated.size(), 1u);
+
+  call(":1.2", "DisableOrphanHandling");
+  auto second = listener_->connection(":1.2");
+  listener_->loseBus();
+  drainServiceQueue();
+  EXPECT_FALSE(rcs_isValid(*second));
+  EXPECT_EQ(linesContaining("Connection interrupted: <connection :1.2>").size(), 1u);
+  for (const auto& line : lines()) {
+    if (line.text.find("Connection in") != std::string::npos) {
+      EXPECT_EQ(line.level, 4);
+    }
+  }
+}
+
+TEST(RCSAdditionsTest, FlagUserInfoAndCurrentConnection) {
+  auto connection = platform::Connection::createForListener(":1.77");
+  EXPECT_FALSE(rcs_isValid(*connection));  // never went through the listener
+  EXPECT_FALSE(rc_userInfoForKey(*connection, "disabledOrphanedFragmentCleanupAVURLs").has_value());
+  rc_setUserInfo(*connection, std::any(), "key");  // nothing to remove: creates nothing
+  EXPECT_FALSE(connection->hasUserInfoDictionary());
+  rc_setUserInfo(*connection, std::any(3), "key");
+  EXPECT_EQ(std::any_cast<int>(rc_userInfoForKey(*connection, "key")), 3);
+  rc_setUserInfo(*connection, std::any(), "key");
+  EXPECT_FALSE(rc_userInfoForKey(*connection, "key").has_value());
+  EXPECT_TRUE(connection->hasUserInfoDictionary());  // emptied, not removed
+  EXPECT_EQ(rcs_currentConnection(), nullptr);       // outside a delivery
+}
+
+TEST_F(ServiceTest, PrepareRequestsCheckTheReplyBeforeTheURL) {
+  ASSERT_TRUE(service_->start());
+  const std::string missing =
+      "[SavedRecordingService] ERROR: received invalid message on connection <connection "
+      ":1.1>.  {} parameter is required for invocations of "
+      "-prepareToCaptureToCompositionAVURL:accessRequestHandler:";
+
+  for (const char* notAURL : {"", "relative/x.m4a", "http://example.com/x.m4a"}) {
+    auto reply = call(":1.1", "PrepareToCapture", {notAURL});
+    ASSERT_TRUE(reply->isAnswered());
+    EXPECT_EQ(reply->errorName(), RCSDBusErrorMissingCompositionAVURL);
+    platform::Error error = RCSErrorFromDBusError(reply->errorName(), reply->errorMessage());
+    EXPECT_EQ(error.domain(), "org.quorvel.SavedRecordingService.ErrorDomain");
+    EXPECT_EQ(error.code(), 101);
+  }
+  EXPECT_EQ(linesContaining(fmt::format(fmt::runtime(missing), "compositionAVURL")).size(), 3u);
+
+  // Neither URL nor reply: only the reply is reported, and nothing answers.
+  auto dropped = call(":1.1", "PrepareToCapture", {""}, /*noReply=*/true);
+  EXPECT_FALSE(dropped->isAnswered());
+  EXPECT_EQ(linesContaining(fmt::format(fmt::runtime(missing), "accessRequestHandler")).size(), 1u);
+  EXPECT_EQ(linesContaining(fmt::format(fmt::runtime(missing), "compositionAVURL")).size(), 3u);
+}
+
+TEST_F(ServiceTest, EveryPrepareKindLogsItsArrivalAndNamesItselfWhenNotSupported) {
+  ASSERT_TRUE(service_->start());
+  struct Kind {
+    const char* member;
+    BusValues arguments;
+    const char* word;
+    const char* selector;
+  };
+  const std::string url = "file:///recordings/New%20Recording.m4a";
+  for (const Kind& kind : std::vector<Kind>{
+           {"PrepareToCapture", {url}, "capture", "prepareToCaptureToCompositionAVURL:"},
+           {"PrepareToPreview", {url}, "preview", "prepareToPreviewCompositionAVURL:"},
+           {"PrepareToExport", {url, true}, "export", "prepareToExportCompositionAVURL:"},
+           {"PrepareToTrim",
+            {"/recordings/New Recording.m4a"},
+            "trimming",
+            "prepareToTrimCompositionAVURL:"},
+       }) {
+    auto reply = call(":1.3", kind.member, kind.arguments);
+    EXPECT_EQ(reply->errorName(), "org.freedesktop.DBus.Error.NotSupported");
+    EXPECT_NE(reply->errorMessage().find(kind.selector), std::string::npos);
+    EXPECT_EQ(
+        linesContaining(fmt::format("[SavedRecordingService] Received request to prepare 'New "
+                                    "Recording.m4a' for {}...",
+                                    kind.word))
+            .size(),
+        1u);
+  }
+}
+
+TEST_F(ServiceTest, OtherRequestsFollowTheirParameterRules) {
+  ASSERT_TRUE(service_->start());
+  auto noToken = BusValue::structure({"", 0, "", ""});
+  call(":1.4", "EndAccessSession", {noToken}, /*noReply=*/true);
+  EXPECT_EQ(linesContaining("[SavedRecordingService] Ending access session: (null).").size(), 1u);
+  EXPECT_EQ(linesContaining("accessToken parameter is required for invocations of "
+                            "-endAccessSessionWithToken:")
+                .size(),
+            1u);
+
+  // Fetch without a reply is ignored altogether: nothing but the acceptance.
+  auto before = lines().size();
+  call(":1.4", "FetchExportingCompositionAVURLs", {}, /*noReply=*/true);
+  drainServiceQueue();
+  EXPECT_EQ(lines().size(), before);
+
+  // Fetch with a reply answers the (empty) exporting set from the service queue.
+  auto fetched = call(":1.4", "FetchExportingCompositionAVURLs");
+  ASSERT_TRUE(fetched->waitFor(10s));
+  EXPECT_EQ(fetched->values(), (BusValues{BusValue(std::vector<std::string>{})}));
+
+  // A wrong signature never reaches the service, which keeps serving.
+  EXPECT_EQ(call(":1.4", "PrepareToExport", {"file:///x.m4a"})->errorName(),
+            platform::kBusErrorInvalidArgs);
+  EXPECT_EQ(call(":1.4", "NoSuchMethod")->errorName(), platform::kBusErrorUnknownMethod);
+  EXPECT_EQ(call(":1.4", "DisableOrphanHandling")->errorName(),
+            "org.freedesktop.DBus.Error.NotSupported");
+}
+
+TEST_F(ServiceTest, BlocksRunInQueueOrderAndKeepTheRootOneSecondPastTheLast) {
+  std::vector<int> order;
+  std::latch first(1);
+  std::thread a([&] {
+    service_->_performOnServiceQueue([&order] { order.push_back(1); });
+    first.count_down();
+  });
+  first.wait();
+  std::thread b([&] { service_->_performOnServiceQueue([&order] { order.push_back(2); }); });
+  a.join();
+  b.join();
+  drainServiceQueue();
+  EXPECT_EQ(order, (std::vector<int>{1, 2}));
+  EXPECT_TRUE(controller().isInTransaction());
+  advance(999ms);
+  EXPECT_TRUE(controller().isInTransaction());
+  advance(1ms);
+  EXPECT_FALSE(controller().isInTransaction());
+}
+
+TEST_F(ServiceTest, LaunchEventsArePostedInProcessOnTheMainQueue) {
+  ASSERT_TRUE(service_->start());
+  std::vector<std::string> posted;
+  auto& center = platform::NotificationCenter::defaultCenter();
+  auto token = center.addObserver("com.example.RecordingsChanged",
+                                  [&posted](const platform::Notification& notification) {
+                                    posted.push_back(notification.name);
+                                  });
+  listener_->deliverSignal("org.quorvel.Events1", "Event", {"com.example.RecordingsChanged"});
+  EXPECT_TRUE(posted.empty());  // not on the delivery thread
+  main_.runUntilIdle();
+  EXPECT_EQ(posted, (std::vector<std::string>{"com.example.RecordingsChanged"}));
+
+  listener_->deliverSignal("org.quorvel.Events1", "Event", {});
+  main_.runUntilIdle();
+  EXPECT_EQ(posted.size(), 1u);
+  auto ignored = linesContaining("Ignoring a launch event without a name");
+  ASSERT_EQ(ignored.size(), 1u);
+  center.removeObserver(token);
+}
+
+TEST_F(ServiceTest, TheDebugSignalDumpsTheRegistryOnTheMainQueue) {
+  testing::internal::CaptureStderr();
+  service_->_handleDebugSignal();
+  main_.runUntilIdle();
+  std::string dump = testing::internal::GetCapturedStderr();
+  EXPECT_EQ(dump, fmt::format("[{}] *** No Active Sessions ***\n",
+                              service_->assetSessionController().description()));
+}
+
+}  // namespace
+}  // namespace quorvel
