@@ -28,6 +28,7 @@ std::string AssetAccessSessionController::description() const {
 std::shared_ptr<AssetAccessSession> AssetAccessSessionController::openAccessSessionWithName(
     const std::string& name, std::shared_ptr<platform::Connection> xpcConnection,
     const platform::URL& compositionAVURL, bool exclusive, std::optional<platform::Error>* error) {
+  QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   std::shared_ptr<AssetAccessSession> session;
   _serialQueue.sync([&] {
     auto list = _clientSessionsByCompositionAVURL.find(compositionAVURL);
@@ -65,6 +66,7 @@ std::shared_ptr<AssetAccessSession> AssetAccessSessionController::openAccessSess
 
 void AssetAccessSessionController::closeSession(
     const std::shared_ptr<AssetAccessSession>& session) {
+  QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   if (!session) return;
   _serialQueue.sync([&] {
     auto list = _clientSessionsByCompositionAVURL.find(session->compositionAVURL());
@@ -97,6 +99,7 @@ AssetAccessSessionList AssetAccessSessionController::_sessionsMatchingPredicate(
 
 std::shared_ptr<AssetAccessSession> AssetAccessSessionController::activeSessionWithAccessToken(
     const RCSSavedRecordingAccessToken& token) const {
+  QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   auto matches = _sessionsMatchingPredicate(
       [&](const AssetAccessSession& session) { return session.accessToken() == token; });
   return matches.empty() ? nullptr : matches.front();
@@ -104,6 +107,7 @@ std::shared_ptr<AssetAccessSession> AssetAccessSessionController::activeSessionW
 
 AssetAccessSessionList AssetAccessSessionController::activeSessionsWithWithCompositionAVURL(
     const platform::URL& compositionAVURL) const {
+  QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   return _sessionsMatchingPredicate([&](const AssetAccessSession& session) {
     return session.accessToken().compositionAVURL() == compositionAVURL;
   });
@@ -111,12 +115,14 @@ AssetAccessSessionList AssetAccessSessionController::activeSessionsWithWithCompo
 
 AssetAccessSessionList AssetAccessSessionController::activeSessionsWithXPCConnection(
     const std::shared_ptr<platform::Connection>& xpcConnection) const {
+  QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   return _sessionsMatchingPredicate([&](const AssetAccessSession& session) {
     return xpcConnection && session.xpcConnection() == xpcConnection;
   });
 }
 
 AssetAccessSessionList AssetAccessSessionController::activeSessions() const {
+  QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   return _sessionsMatchingPredicate([](const AssetAccessSession&) { return true; });
 }
 

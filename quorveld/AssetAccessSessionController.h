@@ -8,8 +8,11 @@
 // on the service serial queue; they change the table inside synchronous
 // blocks on the registry's own queue. The lookups read the table without
 // that queue and must also be called on the service serial queue, the only
-// thread that changes it. dumpState() may be called from any thread (the
-// main queue): it reads the table inside the registry's queue.
+// thread that changes it. The registry does not know that queue: debug
+// builds bind a sequence checker to the queue of the first open, close or
+// lookup and abort when a later one comes from elsewhere. dumpState() and
+// stateDescription() may be called from any thread (the main queue): they
+// read the table inside the registry's queue.
 #pragma once
 
 #include <functional>
@@ -21,6 +24,7 @@
 
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "platform/Error.h"
+#include "platform/SequenceChecker.h"
 #include "platform/SerialQueue.h"
 #include "platform/URL.h"
 #include "platform/dbus/Connection.h"
@@ -64,13 +68,20 @@ class AssetAccessSessionController {
   std::string description() const;
 
  private:
+  // Walk the table: on the service serial queue (the lookups) or inside the
+  // registry's queue (the dump).
   void _enumerateActiveSessionsWithBlock(
       const std::function<void(const std::shared_ptr<AssetAccessSession>&, bool& stop)>& visitor)
       const;
   AssetAccessSessionList _sessionsMatchingPredicate(
       const std::function<bool(const AssetAccessSession&)>& predicate) const;
 
+  // Any thread: the registry's queue and the checker of the service queue.
   platform::SerialQueue _serialQueue;
+  platform::SequenceChecker _serviceSequenceChecker;
+
+  // Service serial queue only, changed inside the registry's queue (which is
+  // also where the dump reads them):
   // Recording -> its sessions in order of opening. A recording's list stays
   // once made, even when empty. Keys in insertion order for a stable walk.
   std::vector<platform::URL> _recordingsInOrder;

@@ -52,6 +52,7 @@ void RCSXPCTransactionController::removeActiveTransactionWithIdentifier(
 
 void RCSXPCTransactionController::_onQueueRemove(const platform::UUID& identifier,
                                                  const std::string& description) {
+  QV_DCHECK_ON_QUEUE(_serialQueue);
   auto entry = _openTransactions.find(identifier);
   if (entry == _openTransactions.end()) return;
   QV_LOG(platform::kLogLevelDebug, "Deactivating XPC transaction: {}", description);

@@ -41,12 +41,19 @@ class RCSXPCTransactionController {
   // referred to, but its entry must still go.
   void removeActiveTransactionWithIdentifier(const platform::UUID& identifier,
                                              const std::string& description);
+  // Controller queue only (checked in debug builds): the bodies of removal
+  // and of every change to the table, which begin or end the root.
   void _onQueueRemove(const platform::UUID& identifier, const std::string& description);
   void _onQueueUpdateInternalTransactionState();
 
+  // Any thread.
   platform::SerialQueue _serialQueue;
+
+  // Controller queue only:
   // Identifier -> transaction, never owning it.
   std::unordered_map<platform::UUID, std::weak_ptr<RCSXPCTransaction>> _openTransactions;
+
+  // Written on the controller queue, read from any thread.
   std::atomic<bool> _inTransaction{false};
 };
 

@@ -190,15 +190,25 @@ platform::Result<std::shared_ptr<RCSavedRecordingsModel>> RCSavedRecordingsModel
 RCSavedRecordingsModel::RCSavedRecordingsModel(std::string directory,
                                                std::unique_ptr<RCSQLiteDatabase> database,
                                                platform::DispatchQueue* queue)
-    : directory_(std::move(directory)), database_(std::move(database)), queue_(queue) {}
+    : directory_(std::move(directory)), queue_(queue), database_(std::move(database)) {}
 
 RCSavedRecordingsModel::~RCSavedRecordingsModel() = default;
 
-void RCSavedRecordingsModel::checkQueue() const {
-  if (queue_ != nullptr) QV_DCHECK_ON_QUEUE(*queue_);
+void RCSavedRecordingsModel::checkQueue([[maybe_unused]] std::source_location caller) const {
+#if defined(QUORVEL_DCHECK_IS_ON)
+  if (queue_ != nullptr) {
+    platform::detail::checkOnQueue(*queue_, caller.file_name(), static_cast<int>(caller.line()));
+  }
+#endif
+}
+
+bool RCSavedRecordingsModel::hasChanges() const {
+  checkQueue();
+  return !pending_.empty();
 }
 
 std::string RCSavedRecordingsModel::storedPathForFile(std::string_view path) const {
+  checkQueue();
   platform::URL url = platform::URL::fileURLWithPath(path);
   if (auto relative = RCPathRelativeToDirectory(url, directory_)) return *relative;
   return url.URLByStandardizingPath().path();
@@ -206,6 +216,7 @@ std::string RCSavedRecordingsModel::storedPathForFile(std::string_view path) con
 
 platform::Result<std::vector<std::shared_ptr<RCSavedRecording>>> RCSavedRecordingsModel::fetch(
     std::string_view where, std::string_view value) {
+  checkQueue();
   std::string sql = std::string(kColumns) + std::string(where) + " ORDER BY date, rowid";
   auto statement = database_->prepare(sql);
   if (!statement) return platform::fail(statement.error());

@@ -3,7 +3,8 @@
 // the daemon share the file; schema versioned with PRAGMA user_version).
 //
 // A model is bound to the queue it was made for (sharedModelForQueue) and
-// must be used on that queue only; a model from modelWithDirectory is bound
+// must be used on that queue only (debug builds check every member but
+// directory() and abort elsewhere); a model from modelWithDirectory is bound
 // to no queue and must be used from one thread at a time. Its recordings
 // follow the same rule.
 //
@@ -17,6 +18,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <source_location>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -83,7 +85,7 @@ class RCSavedRecordingsModel : public std::enable_shared_from_this<RCSavedRecord
   // Writes pending changes in one transaction. Nothing to do: success. On
   // failure the changes stay pending and the error is returned.
   platform::Status saveIfNecessary();
-  bool hasChanges() const { return !pending_.empty(); }
+  bool hasChanges() const;
 
   // Inserts a recording of the audio file at `path` (absolute), with its
   // duration in seconds and date; its title is the file name without its
@@ -107,15 +109,20 @@ class RCSavedRecordingsModel : public std::enable_shared_from_this<RCSavedRecord
   static platform::Result<std::shared_ptr<RCSavedRecordingsModel>> open(
       const std::string& directory, platform::DispatchQueue* queue);
 
-  void checkQueue() const;
+  // Aborts in debug builds when a queue-bound model is used off its queue,
+  // naming the calling member's line.
+  void checkQueue(std::source_location caller = std::source_location::current()) const;
   void recordingDidChange(const std::shared_ptr<RCSavedRecording>& recording);
   platform::Result<std::vector<std::shared_ptr<RCSavedRecording>>> fetch(std::string_view where,
                                                                          std::string_view value);
   std::string storedPathForFile(std::string_view path) const;
 
+  // Fixed at creation; any thread.
   std::string directory_;
-  std::unique_ptr<RCSQLiteDatabase> database_;
   platform::DispatchQueue* queue_;
+
+  // Bound queue only (one thread at a time for an unbound model):
+  std::unique_ptr<RCSQLiteDatabase> database_;
   int savingDisabledDepth_ = 0;
   // Changed or inserted recordings not saved yet, in the order of their first change.
   std::vector<std::shared_ptr<RCSavedRecording>> pending_;
