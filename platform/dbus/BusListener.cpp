@@ -7,7 +7,7 @@
 // using enterEventLoopAsync(), for three reasons:
 //  - a lost bus makes sd_bus_process() fail, which sdbus-c++ reports by
 //    throwing; on its own loop thread that would end the process, here the
-//    exception is caught and turned into the interruption of every
+//    exception is caught and turned into the invalidation of every
 //    connection;
 //  - an orderly stop must deliver what has already been read before the loop
 //    ends, which enterEventLoop() does not do;

@@ -7,7 +7,7 @@
 // The bus thread reads and dispatches messages one at a time: method calls
 // go through Listener::dispatch() to the method handlers; a peer whose
 // unique name leaves the bus has its connection invalidated; a lost bus
-// interrupts every connection. Calls with a wrong argument signature are
+// invalidates every connection. Calls with a wrong argument signature are
 // answered with org.freedesktop.DBus.Error.InvalidArgs and unknown methods
 // with org.freedesktop.DBus.Error.UnknownMethod, without reaching a handler.
 // Replies and signals may be sent from any thread.

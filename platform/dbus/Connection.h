@@ -4,8 +4,11 @@
 // the same object with every later call from that peer. When the peer
 // vanishes the listener removes it from the table and the connection is
 // invalidated; when the listener loses the bus every connection is
-// interrupted. Either end happens at most once per connection and runs the
-// matching handler once.
+// invalidated too, since a unique name never comes back once its bus is gone.
+// The listeners never interrupt a connection (interruption would promise a
+// connection that can resume); the interruption handler stays for owners that
+// set both. An end happens at most once per connection and runs the matching
+// handler once.
 //
 // Ownership: shared (std::shared_ptr). The listener's table, access sessions
 // and queued requests hold it; its handlers should hold it (and anything

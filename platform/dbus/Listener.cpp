@@ -110,7 +110,9 @@ void Listener::busLost() {
     connections.swap(connections_);
     delegate = delegate_;
   }
-  for (auto& [name, connection] : connections) connection->end(Connection::End::Interrupted);
+  // The connections cannot come back: their peers' unique names died with
+  // the bus, and a new bus makes new connections.
+  for (auto& [name, connection] : connections) connection->end(Connection::End::Invalidated);
   connections.clear();
   if (delegate) delegate->listenerDidLoseBus(*this);
 }

@@ -85,7 +85,7 @@ class ListenerDelegate {
   // delegate is not asked again about that peer.
   virtual bool shouldAcceptNewConnection(Listener& listener,
                                          std::shared_ptr<Connection> newConnection) = 0;
-  // The listener has lost the bus; every connection has been interrupted.
+  // The listener has lost the bus; every connection has been invalidated.
   virtual void listenerDidLoseBus(Listener& /*listener*/) {}
 };
 
@@ -132,7 +132,7 @@ class Listener {
   // Delivery thread: `uniqueName` has left the bus; invalidates its
   // connection, if any, exactly once.
   void peerVanished(const std::string& uniqueName);
-  // Delivery thread: the bus is gone; interrupts every connection and tells
+  // Delivery thread: the bus is gone; invalidates every connection and tells
   // the delegate.
   void busLost();
   // Drops every connection without running handlers (for stop()).

@@ -1,7 +1,7 @@
 // LocalListener: an in-process Listener for tests of the service core. No
 // bus: a test names peers (":1.1", ":1.2"...), delivers their calls with
 // deliver(), and ends them with vanish() (invalidation) or loseBus()
-// (interruption of every connection). Deliveries behave as on the bus: the
+// (invalidation of every connection). Deliveries behave as on the bus: the
 // member and argument signature are checked (UnknownMethod, InvalidArgs),
 // the delegate is asked about a peer's first call, the call runs on the
 // calling thread with Connection::current() set, and its answer lands in a
@@ -73,7 +73,7 @@ class LocalListener final : public Listener {
                      const BusValues& arguments);
   // The peer `sender` has left: its connection is invalidated.
   void vanish(const std::string& sender);
-  // The bus is gone: every connection is interrupted.
+  // The bus is gone: every connection is invalidated.
   void loseBus();
 
   std::vector<std::pair<std::string, BusValues>> emittedSignals() const;

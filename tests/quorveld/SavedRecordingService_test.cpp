@@ -187,7 +187,8 @@ TEST_F(ServiceTest, ConnectionsAreAcceptedOnceAndEndedByVanishingOrLosingTheBus)
   listener_->loseBus();
   drainServiceQueue();
   EXPECT_FALSE(rcs_isValid(*second));
-  EXPECT_EQ(linesContaining("Connection interrupted: <connection :1.2>").size(), 1u);
+  EXPECT_EQ(linesContaining("Connection invalidated: <connection :1.2>").size(), 1u);
+  EXPECT_TRUE(linesContaining("Connection interrupted").empty());
   for (const auto& line : lines()) {
     if (line.text.find("Connection in") != std::string::npos) {
       EXPECT_EQ(line.level, 4);
