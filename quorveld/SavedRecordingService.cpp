@@ -43,15 +43,15 @@ SavedRecordingService::SavedRecordingService(PassKey)
                 std::move(interface));
           }) {}
 
-std::shared_ptr<SavedRecordingService> SavedRecordingService::_makeService() {
+std::shared_ptr<SavedRecordingService> SavedRecordingService::_makeService(bool watchDebugSignal) {
   auto service = std::make_shared<SavedRecordingService>(PassKey{});
-  service->_init();
+  service->_init(watchDebugSignal);
   return service;
 }
 
 std::shared_ptr<SavedRecordingService> SavedRecordingService::sharedInstance() {
   static std::shared_ptr<SavedRecordingService>* shared =
-      new std::shared_ptr<SavedRecordingService>(_makeService());
+      new std::shared_ptr<SavedRecordingService>(_makeService(true));
   return *shared;
 }
 
@@ -60,14 +60,19 @@ std::shared_ptr<SavedRecordingService> SavedRecordingService::init() {
 }
 
 std::shared_ptr<SavedRecordingService> SavedRecordingService::makeForTesting() {
-  return _makeService();
+  return _makeService(true);
 }
 
-void SavedRecordingService::_init() {
+std::shared_ptr<SavedRecordingService> SavedRecordingService::makeForTesting(
+    TestingOptions options) {
+  return _makeService(options.watchDebugSignal);
+}
+
+void SavedRecordingService::_init(bool watchDebugSignal) {
   // The queues were made by the constructor, the instance queue first.
   _assetSesionController = std::make_unique<AssetAccessSessionController>();
   _isOrphanHandlingEnabled = true;
-  _setupSignalHandler();
+  if (watchDebugSignal) _setupSignalHandler();
 }
 
 SavedRecordingService::~SavedRecordingService() {
@@ -111,7 +116,14 @@ platform::Status SavedRecordingService::start() {
   _xpcListener->setDelegate(this);
   QV_LOG(platform::kLogLevelNotice, "Starting service '{}'",
          RCSSavedRecordingServiceMachServiceName);
-  return _xpcListener->resume();
+  auto resumed = _xpcListener->resume();
+  if (!resumed) {
+    // A listener that failed to start never starts later: drop it so the
+    // next start() tries with a new one.
+    _xpcListener->setDelegate(nullptr);
+    _xpcListener.reset();
+  }
+  return resumed;
 }
 
 void SavedRecordingService::_handleLaunchEvent(const std::optional<std::string>& name) {

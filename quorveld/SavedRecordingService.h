@@ -63,8 +63,14 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // There is no other way to make the service: raises GenericException
   // "-init is invalid. Use +sharedInstance instead." and yields nothing.
   [[noreturn]] static std::shared_ptr<SavedRecordingService> init();
-  // Tests: a service of its own, not the singleton.
+  // Tests: a service of its own, not the singleton. The platform allows one
+  // SIGUSR1 source at a time, so tests that do not test the debug signal
+  // make their services without one.
+  struct TestingOptions {
+    bool watchDebugSignal = true;
+  };
   static std::shared_ptr<SavedRecordingService> makeForTesting();
+  static std::shared_ptr<SavedRecordingService> makeForTesting(TestingOptions options);
   ~SavedRecordingService() override;
 
   // Where start() gets its listener (by default a BusListener on the
@@ -73,8 +79,8 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // Start-up: the two keep-alive periods, the launch-event handler, the
   // first orphan-handling pass one second later, and the listener on the
   // service name. Returns the listener's failure to start (bus unreachable,
-  // name taken); the keep-alive periods run either way. Call on the main
-  // thread.
+  // name taken) and drops that listener, so a later start() makes a new one;
+  // the keep-alive periods run either way. Call on the main thread.
   platform::Status start();
 
   // The launch event stream: posts `name` on the default notification
@@ -135,8 +141,8 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   explicit SavedRecordingService(PassKey);
 
  private:
-  static std::shared_ptr<SavedRecordingService> _makeService();
-  void _init();
+  static std::shared_ptr<SavedRecordingService> _makeService(bool watchDebugSignal);
+  void _init(bool watchDebugSignal);
   void _setupSignalHandler();
   void _tearDownSignalHandler();
   void _logMissingParameter(const char* parameter, const char* selector);

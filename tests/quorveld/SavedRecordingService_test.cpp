@@ -48,7 +48,7 @@ class ServiceTest : public ::testing::Test {
       std::lock_guard lock(mutex_);
       lines_.push_back({level, std::string(text)});
     });
-    service_ = SavedRecordingService::makeForTesting();
+    service_ = SavedRecordingService::makeForTesting({.watchDebugSignal = false});
     service_->setListenerFactory(
         [this](const std::string&, platform::InterfaceDescription interface) {
           auto listener = std::make_shared<platform::LocalListener>(std::move(interface));
@@ -116,6 +116,36 @@ TEST_F(ServiceTest, InitRaisesAndSharedInstanceIsOneObject) {
     EXPECT_STREQ(exception.what(), "-init is invalid. Use +sharedInstance instead.");
   }
   EXPECT_EQ(SavedRecordingService::sharedInstance(), SavedRecordingService::sharedInstance());
+}
+
+// A listener whose bus cannot be reached.
+class UnreachableListener final : public platform::Listener {
+ public:
+  explicit UnreachableListener(platform::InterfaceDescription interface)
+      : Listener(std::move(interface)) {}
+  platform::Status resume() override {
+    return platform::fail(platform::Error("test", 1, "bus unreachable"));
+  }
+  void emitSignal(const std::string&, const BusValues&) override {}
+  platform::Status releaseName() override { return {}; }
+  void stop() override {}
+};
+
+TEST_F(ServiceTest, AStartThatFailedTriesANewListenerNextTime) {
+  int made = 0;
+  service_->setListenerFactory(
+      [&](const std::string&,
+          platform::InterfaceDescription interface) -> std::shared_ptr<platform::Listener> {
+        if (made++ == 0) return std::make_shared<UnreachableListener>(std::move(interface));
+        listener_ = std::make_shared<platform::LocalListener>(std::move(interface));
+        return listener_;
+      });
+  EXPECT_FALSE(service_->start());
+  EXPECT_FALSE(service_->listener());
+  ASSERT_TRUE(service_->start());
+  EXPECT_EQ(made, 2);
+  EXPECT_EQ(service_->listener(), listener_);
+  EXPECT_FALSE(call(":1.1", "FetchExportingCompositionAVURLs")->isError());
 }
 
 TEST_F(ServiceTest, QueuesAreLabelledFromTheBundleIdentifier) {
