@@ -14,6 +14,7 @@
 #include <cstdlib>
 #include <mutex>
 #include <utility>
+#include <vector>
 
 #include "platform/Log.h"
 
@@ -29,6 +30,7 @@ struct ProcessLifetime::State {
   bool enabled = false;
   bool inTransaction = false;
   std::uint64_t generation = 0;
+  std::vector<std::function<void()>> noTransactionWaiters;
 };
 
 namespace {
@@ -105,21 +107,37 @@ void ProcessLifetime::beginTransaction() {
 }
 
 void ProcessLifetime::endTransaction() {
-  std::lock_guard lock(state_->mutex);
-  if (!state_->inTransaction) {
+  std::vector<std::function<void()>> waiters;
+  {
+    std::lock_guard lock(state_->mutex);
+    if (!state_->inTransaction) {
 #if defined(QUORVEL_DCHECK_IS_ON)
-    misuse("endTransaction called without a root transaction");
+      misuse("endTransaction called without a root transaction");
 #else
-    return;
+      return;
 #endif
+    }
+    state_->inTransaction = false;
+    armIdleTimer(state_);
+    waiters.swap(state_->noTransactionWaiters);
   }
-  state_->inTransaction = false;
-  armIdleTimer(state_);
+  for (auto& waiter : waiters) waiter();
 }
 
 bool ProcessLifetime::isInTransaction() const {
   std::lock_guard lock(state_->mutex);
   return state_->inTransaction;
+}
+
+void ProcessLifetime::whenNoTransaction(std::function<void()> callback) {
+  {
+    std::lock_guard lock(state_->mutex);
+    if (state_->inTransaction) {
+      state_->noTransactionWaiters.push_back(std::move(callback));
+      return;
+    }
+  }
+  callback();
 }
 
 }  // namespace platform

@@ -37,6 +37,13 @@ class ProcessLifetime {
   void endTransaction();
   bool isInTransaction() const;
 
+  // Runs `callback` once no root transaction is held: at once on the calling
+  // thread when none is held now, else on the thread that ends the root
+  // transaction, right after it did (without any lock held). For shutdown
+  // sequences that must outlast every keep-alive; the callback should only
+  // queue work.
+  void whenNoTransaction(std::function<void()> callback);
+
  private:
   struct State;
   std::shared_ptr<State> state_;

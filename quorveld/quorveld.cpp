@@ -2,7 +2,6 @@
 // builds the service, starts it and runs the main run loop until the process
 // has been idle long enough (or forever with --idle-exit-after 0).
 #include <fmt/format.h>
-#include <systemd/sd-daemon.h>
 #include <CLI/CLI.hpp>
 
 #include <chrono>
@@ -18,6 +17,7 @@
 #include "platform/ProcessLifetime.h"
 #include "platform/SignalSource.h"
 #include "platform/dbus/BusListener.h"
+#include "quorveld/IdleExit.h"
 #include "quorveld/ProcessInfo.h"
 #include "quorveld/SavedRecordingService.h"
 
@@ -31,21 +31,6 @@ struct Options {
   bool info = false;
   bool version = false;
 };
-
-// Idle for long enough: leave the bus so new callers start a fresh daemon,
-// answer what is already queued, and end the run loop.
-void exitWhenIdle(const std::shared_ptr<quorvel::SavedRecordingService>& service) {
-  QV_LOG(platform::kLogLevelNotice, "Idle; exiting");
-  sd_notify(0, "STOPPING=1");
-  if (auto listener = service->listener()) {
-    if (auto released = listener->releaseName(); !released) {
-      QV_LOG(platform::kLogLevelError, "Could not release the service name: {}", released.error());
-    }
-    service->serviceSerialQueue().sync([] {});
-    listener->stop();
-  }
-  platform::mainQueue().stop();
-}
 
 }  // namespace
 
@@ -114,7 +99,7 @@ int main(int argc, char** argv) {
   platform::ProcessLifetime& lifetime = platform::ProcessLifetime::instance();
   lifetime.setIdleExitAfter(std::chrono::duration_cast<platform::Duration>(
       std::chrono::duration<double>(options.idleExitAfter)));
-  lifetime.setIdleHandler([service] { exitWhenIdle(service); });
+  quorvel::IdleExit::install(service, lifetime);
 
   service->setListenerFactory(
       [address = options.busAddress](const std::string& serviceName,

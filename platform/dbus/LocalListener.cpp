@@ -68,6 +68,14 @@ void LocalReply::record(bool isError, BusValues values, std::string errorName,
   answered_.notify_all();
 }
 
+struct LocalListener::Received {
+  std::string sender;
+  std::string member;
+  BusValues arguments;
+  bool noReplyExpected;
+  std::unique_ptr<IncomingCall::Responder> responder;
+};
+
 LocalListener::LocalListener(InterfaceDescription interface) : Listener(std::move(interface)) {}
 
 LocalListener::~LocalListener() { stop(); }
@@ -95,9 +103,41 @@ void LocalListener::stop() {
   {
     std::lock_guard lock(stateMutex_);
     if (stopped_) return;
+  }
+  deliverReceived();  // the orderly stop: what was received is delivered
+  {
+    std::lock_guard lock(stateMutex_);
     stopped_ = true;
   }
   forgetConnections();
+}
+
+std::shared_ptr<LocalReply> LocalListener::receive(const std::string& sender,
+                                                   const std::string& member, BusValues arguments,
+                                                   bool noReplyExpected) {
+  auto reply = std::make_shared<LocalReply>();
+  auto responder = std::make_unique<LocalResponder>(reply);
+  std::lock_guard lock(stateMutex_);
+  if (!resumed_ || stopped_ || nameReleased_) {
+    if (!noReplyExpected) responder->sendError(kBusErrorServiceUnknown, "no listener");
+    return reply;
+  }
+  received_.push_back(
+      Received{sender, member, std::move(arguments), noReplyExpected, std::move(responder)});
+  return reply;
+}
+
+void LocalListener::deliverReceived() {
+  std::lock_guard delivery(deliveryMutex_);
+  std::vector<Received> received;
+  {
+    std::lock_guard lock(stateMutex_);
+    received.swap(received_);
+  }
+  for (Received& call : received) {
+    deliverChecked(call.sender, call.member, std::move(call.arguments), call.noReplyExpected,
+                   std::move(call.responder));
+  }
 }
 
 std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
@@ -113,6 +153,13 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
       return reply;
     }
   }
+  deliverChecked(sender, member, std::move(arguments), noReplyExpected, std::move(responder));
+  return reply;
+}
+
+void LocalListener::deliverChecked(const std::string& sender, const std::string& member,
+                                   BusValues arguments, bool noReplyExpected,
+                                   std::unique_ptr<IncomingCall::Responder> responder) {
   const MethodSpec* declared = method(member);
   if (!declared) {
     if (!noReplyExpected) {
@@ -120,7 +167,7 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
           kBusErrorUnknownMethod,
           fmt::format("Unknown method {} or interface {}.", member, interfaceDescription().name));
     }
-    return reply;
+    return;
   }
   std::string signature = signatureOf(arguments);
   if (signature != declared->inputSignature) {
@@ -130,10 +177,9 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
           fmt::format("Invalid arguments '{}' to call {}.{}(), expecting '{}'.", signature,
                       interfaceDescription().name, member, declared->inputSignature));
     }
-    return reply;
+    return;
   }
   dispatch(sender, *declared, std::move(arguments), noReplyExpected, std::move(responder));
-  return reply;
 }
 
 void LocalListener::vanish(const std::string& sender) {

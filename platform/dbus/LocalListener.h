@@ -1,11 +1,11 @@
 // LocalListener: an in-process Listener for tests of the service core. No
 // bus: a test names peers (":1.1", ":1.2"...), delivers their calls with
-// deliver(), and ends them with vanish() (invalidation) or loseBus()
-// (invalidation of every connection). Deliveries behave as on the bus: the
-// member and argument signature are checked (UnknownMethod, InvalidArgs),
-// the delegate is asked about a peer's first call, the call runs on the
-// calling thread with Connection::current() set, and its answer lands in a
-// LocalReply that the test can wait on.
+// deliver() (or leaves them received but undelivered with receive(), as calls
+// the bus thread has read and not dispatched yet), and ends them with vanish() (invalidation) or
+// loseBus() (invalidation of every connection). Deliveries behave as on the bus: the member and
+// argument signature are checked (UnknownMethod, InvalidArgs), the delegate is asked about a peer's
+// first call, the call runs on the calling thread with Connection::current() set, and its answer
+// lands in a LocalReply that the test can wait on.
 //
 // Threads: any; deliveries, vanish() and loseBus() are serialized (one at a
 // time, like the bus thread). Owned by the test.
@@ -67,6 +67,14 @@ class LocalListener final : public Listener {
   // is stopped, answers ServiceUnknown.
   std::shared_ptr<LocalReply> deliver(const std::string& sender, const std::string& member,
                                       BusValues arguments = {}, bool noReplyExpected = false);
+  // A call that has reached the listener and waits for delivery: delivered,
+  // in the order received, by deliverReceived() or by stop(), whose orderly
+  // stop delivers what was received, also after releaseName(). A listener
+  // that is not resumed, is stopped, or has released its name answers
+  // ServiceUnknown at once.
+  std::shared_ptr<LocalReply> receive(const std::string& sender, const std::string& member,
+                                      BusValues arguments = {}, bool noReplyExpected = false);
+  void deliverReceived();
   // A broadcast signal arrives: runs the handler of each matching
   // subscription (see SignalMatch) on the calling thread.
   void deliverSignal(const std::string& interface, const std::string& member,
@@ -81,12 +89,18 @@ class LocalListener final : public Listener {
   bool isStopped() const;
 
  private:
+  struct Received;
+  // With deliveryMutex_ held: checks and dispatches one call.
+  void deliverChecked(const std::string& sender, const std::string& member, BusValues arguments,
+                      bool noReplyExpected, std::unique_ptr<IncomingCall::Responder> responder);
+
   mutable std::recursive_mutex deliveryMutex_;  // one delivery at a time
   mutable std::mutex stateMutex_;               // guards the fields below
   bool resumed_ = false;
   bool nameReleased_ = false;
   bool stopped_ = false;
   std::vector<std::pair<std::string, BusValues>> signals_;
+  std::vector<Received> received_;
 };
 
 }  // namespace platform

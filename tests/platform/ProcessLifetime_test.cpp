@@ -114,5 +114,22 @@ TEST_F(ProcessLifetimeTest, AHandlerMayBeginAgain) {
   EXPECT_TRUE(lifetime_.isInTransaction());
 }
 
+TEST_F(ProcessLifetimeTest, WaitersForNoTransactionRunOnceWhenTheRootEnds) {
+  int ran = 0;
+  lifetime_.whenNoTransaction([&] { ++ran; });  // none held: at once
+  EXPECT_EQ(ran, 1);
+  lifetime_.beginTransaction();
+  lifetime_.whenNoTransaction([&] {
+    EXPECT_FALSE(lifetime_.isInTransaction());
+    ++ran;
+  });
+  EXPECT_EQ(ran, 1);
+  lifetime_.endTransaction();
+  EXPECT_EQ(ran, 2);
+  lifetime_.beginTransaction();
+  lifetime_.endTransaction();
+  EXPECT_EQ(ran, 2);
+}
+
 }  // namespace
 }  // namespace platform
