@@ -2,8 +2,13 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <barrier>
 #include <future>
+#include <latch>
+#include <memory>
 #include <thread>
+#include <vector>
 
 #include "platform/SerialQueue.h"
 
@@ -49,6 +54,33 @@ TEST(SequenceCheckerTest, WithoutAQueueItBindsToTheThread) {
   queue.async([&] { onWorker.set_value(checker.calledOnValidSequence()); });
   EXPECT_FALSE(onWorker.get_future().get());
   queue.sync([&] { EXPECT_TRUE(checker.calledOnValidSequence()); });
+}
+
+// Queues racing to the first checked use agree on one winner, every round.
+TEST(SequenceCheckerTest, QueuesRacingToBindAgreeOnOneWinner) {
+  constexpr int kQueues = 4;
+  constexpr int kRounds = 200;
+  std::vector<std::unique_ptr<SerialQueue>> queues;
+  for (int i = 0; i < kQueues; ++i) {
+    queues.push_back(std::make_unique<SerialQueue>("test.racer"));
+  }
+  for (int round = 0; round < kRounds; ++round) {
+    SequenceChecker checker;
+    std::barrier start(kQueues);
+    std::latch done(kQueues);
+    std::atomic<int> winners = 0;
+    for (auto& queue : queues) {
+      queue->async([&] {
+        start.arrive_and_wait();
+        if (checker.calledOnValidSequence()) ++winners;
+        done.count_down();
+      });
+    }
+    done.wait();
+    for (auto& queue : queues)
+      queue->sync([] {});  // the tasks are over before the round's locals go
+    ASSERT_EQ(winners.load(), 1) << "round " << round;
+  }
 }
 
 #if defined(QUORVEL_DCHECK_IS_ON)
