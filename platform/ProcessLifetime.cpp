@@ -16,6 +16,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/Misuse.h"
 
 namespace platform {
 
@@ -31,15 +32,7 @@ struct ProcessLifetime::State {
   std::uint64_t generation = 0;
 };
 
-namespace {
-
-[[noreturn, maybe_unused]] void misuse(const char* message) {
-  fmt::print(stderr, "ProcessLifetime: {}\n", message);
-  std::fflush(stderr);
-  std::abort();
-}
-
-}  // namespace
+namespace {}  // namespace
 
 ProcessLifetime& ProcessLifetime::instance() {
   static ProcessLifetime* lifetime = new ProcessLifetime(mainQueue());
@@ -95,7 +88,7 @@ void ProcessLifetime::beginTransaction() {
   std::lock_guard lock(state_->mutex);
   if (state_->inTransaction) {
 #if defined(QUORVEL_DCHECK_IS_ON)
-    misuse("beginTransaction called while the root transaction is already held");
+    QV_MISUSE(true, "beginTransaction called while the root transaction is already held");
 #else
     return;
 #endif
@@ -108,7 +101,7 @@ void ProcessLifetime::endTransaction() {
   std::lock_guard lock(state_->mutex);
   if (!state_->inTransaction) {
 #if defined(QUORVEL_DCHECK_IS_ON)
-    misuse("endTransaction called without a root transaction");
+    QV_MISUSE(true, "endTransaction called without a root transaction");
 #else
     return;
 #endif
