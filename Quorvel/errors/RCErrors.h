@@ -1,10 +1,10 @@
 // Every error domain and code of the recordings framework and the service, in
 // one place: the framework's own errors, the audio work's (composing,
-// decoding, waveform files), MP4 atom editing, audio assets, and the codes of
-// the service domain (whose D-Bus mapping lives beside the service). Codes are
-// unscoped, prefixed `long` enumerators so they compare directly with
-// platform::Error::code(). The constructors are plain functions returning
-// immutable values; safe to call from any thread.
+// decoding, waveform files), MP4 atom editing, audio assets, file digests,
+// and the codes of the service domain (whose D-Bus mapping lives beside the
+// service). Codes are unscoped, prefixed `long` enumerators so they compare
+// directly with platform::Error::code(). The constructors are plain functions
+// returning immutable values; safe to call from any thread.
 #pragma once
 
 #include <string>
@@ -96,6 +96,15 @@ enum RCMP4ErrorCode : long {
 // ---- Audio assets ----
 
 inline constexpr const char* kRCAudioAssetErrorDomain = "org.quorvel.AudioAsset";
+
+// ---- File digests ----
+
+inline constexpr const char* kRCMD5ErrorDomain = "org.quorvel.MD5";
+
+enum RCMD5ErrorCode : long {
+  // The crypto library offers no MD5 implementation.
+  RCMD5ErrorCodeUnavailable = 1,
+};
 
 // ---- The service domain (RCSSavedRecordingServiceErrorDomain) ----
 

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <memory>
 
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFile.h"
 
 namespace quorvel {
@@ -70,7 +71,8 @@ platform::Result<std::optional<RCMD5Digest>> RCMD5DigestOfFile(const std::string
 
   std::unique_ptr<EVP_MD_CTX, DigestContextDeleter> context(EVP_MD_CTX_new());
   if (!context || EVP_DigestInit_ex(context.get(), md5Algorithm(), nullptr) != 1) {
-    return platform::fail(platform::Error("org.quorvel.MD5", 1, "MD5 unavailable"));
+    return platform::fail(
+        platform::Error(kRCMD5ErrorDomain, RCMD5ErrorCodeUnavailable, "MD5 unavailable"));
   }
   std::unique_ptr<std::uint8_t, AlignedFree> buffer(
       static_cast<std::uint8_t*>(std::aligned_alloc(4096, kChunkSize)));
