@@ -10,6 +10,8 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include "platform/Misuse.h"
+
 namespace platform {
 namespace {
 thread_local detail::ScopedCurrentQueue* tCurrentScope = nullptr;
@@ -39,10 +41,9 @@ bool isRunningOnQueue(const DispatchQueue& queue) {
 void checkOnQueue(const DispatchQueue& queue, const char* file, int line) {
   if (queue.isCurrent()) return;
   const DispatchQueue* current = DispatchQueue::current();
-  fmt::print(stderr, "{}:{}: must be called on the {} queue (running on {})\n", file, line,
-             queue.label(), current != nullptr ? current->label() : std::string("no queue"));
-  std::fflush(stderr);
-  std::abort();
+  misuse(file, line,
+         fmt::format("must be called on the {} queue (running on {})", queue.label(),
+                     current != nullptr ? current->label() : std::string("no queue")));
 }
 
 }  // namespace detail

@@ -23,6 +23,8 @@ using std::unexpected;
 #include <utility>
 #include <variant>
 
+#include "platform/Misuse.h"
+
 namespace platform {
 
 template <class E>
@@ -75,9 +77,7 @@ class expected {
   E&& error() && { return std::move(std::get<1>(storage_)); }
 
  private:
-  void checked() const {
-    if (!has_value()) std::abort();
-  }
+  void checked() const { QV_MISUSE(!has_value(), "value() of a result that holds an error"); }
   std::variant<T, E> storage_;
 };
 
@@ -93,9 +93,7 @@ class expected<void, E> {
 
   bool has_value() const { return !error_.has_value(); }
   explicit operator bool() const { return has_value(); }
-  void value() const {
-    if (error_) std::abort();
-  }
+  void value() const { QV_MISUSE(error_.has_value(), "value() of a status that holds an error"); }
   const E& error() const& { return *error_; }
   E& error() & { return *error_; }
   E&& error() && { return std::move(*error_); }

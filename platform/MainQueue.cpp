@@ -9,6 +9,7 @@
 // The observer takes the queue's mutex before notifying, so a jump can never
 // fall between the loop reading the clock and starting to wait.
 #include "platform/MainQueue.h"
+#include "platform/Misuse.h"
 
 #include <fmt/format.h>
 
@@ -24,12 +25,6 @@
 
 namespace platform {
 namespace {
-
-[[noreturn]] void fatal(const std::string& message) {
-  fmt::print(stderr, "{}\n", message);
-  std::fflush(stderr);
-  std::abort();
-}
 
 TimePoint deadlineAfter(TimePoint now, Duration delay) {
   if (delay <= Duration::zero()) return now;
@@ -67,9 +62,8 @@ MainQueue::MainQueue(Clock& clock, std::string label)
 }
 
 MainQueue::~MainQueue() {
-  if (detail::isRunningOnQueue(*this)) {
-    fatal(fmt::format("MainQueue '{}' destroyed from its own task", state_->label));
-  }
+  QV_MISUSE(detail::isRunningOnQueue(*this), "MainQueue '{}' destroyed from its own task",
+            state_->label);
 }
 
 void MainQueue::async(Task task) {
@@ -81,10 +75,9 @@ void MainQueue::async(Task task) {
 }
 
 void MainQueue::sync(Task task) {
-  if (detail::isRunningOnQueue(*this)) {
-    fatal(fmt::format("MainQueue::sync called from the '{}' queue onto itself: it would deadlock",
-                      state_->label));
-  }
+  QV_MISUSE(detail::isRunningOnQueue(*this),
+            "MainQueue::sync called from the '{}' queue onto itself: it would deadlock",
+            state_->label);
   std::binary_semaphore done(0);
   async([&] {
     task();
@@ -137,7 +130,7 @@ struct ServicingScope {
   StateT& state;
   ServicingScope(StateT& s, std::unique_lock<std::mutex>&) : state(s) {
     if (++state.servicers > 1) {
-      fatal(fmt::format("MainQueue '{}' serviced by two threads at once", state.label));
+      QV_MISUSE(true, "MainQueue '{}' serviced by two threads at once", state.label);
     }
   }
   ~ServicingScope() { --state.servicers; }

@@ -13,30 +13,23 @@
 #include <cstdlib>
 #include <typeinfo>
 
+#include "platform/Misuse.h"
 #include "platform/OperationQueue.h"
 
 namespace platform {
-namespace {
-
-[[noreturn]] void fatal(const char* message) {
-  fmt::print(stderr, "Operation: {}\n", message);
-  std::fflush(stderr);
-  std::abort();
-}
-
-}  // namespace
+namespace {}  // namespace
 
 Operation::Operation() = default;
 Operation::~Operation() = default;
 
 void Operation::addDependency(std::shared_ptr<Operation> dependency) {
   if (!dependency) return;
-  if (dependency.get() == this) fatal("an operation cannot depend on itself");
+  QV_MISUSE(dependency.get() == this, "an operation cannot depend on itself");
   std::weak_ptr<Operation> self = weak_from_this();
-  if (self.expired()) fatal("an operation must be owned by a std::shared_ptr");
+  QV_MISUSE(self.expired(), "an operation must be owned by a std::shared_ptr");
   {
     std::lock_guard lock(mutex_);
-    if (phase_ != Phase::Pending) fatal("dependency added after the operation started");
+    QV_MISUSE(phase_ != Phase::Pending, "dependency added after the operation started");
     dependencies_.push_back(dependency);
     ++unfinishedDependencies_;
   }

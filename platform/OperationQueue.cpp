@@ -12,6 +12,7 @@
 // worker runs main(), the finish observers and the completion block, then
 // gives its slot back and looks for the next operation before going idle.
 #include "platform/OperationQueue.h"
+#include "platform/Misuse.h"
 
 #include <fmt/format.h>
 
@@ -28,12 +29,6 @@ namespace platform {
 namespace {
 
 thread_local const detail::OperationQueueState* tCurrentQueue = nullptr;
-
-[[noreturn]] void fatal(const char* message) {
-  fmt::print(stderr, "OperationQueue: {}\n", message);
-  std::fflush(stderr);
-  std::abort();
-}
 
 }  // namespace
 
@@ -132,7 +127,7 @@ OperationQueue::OperationQueue() : state_(std::make_shared<detail::OperationQueu
 
 OperationQueue::~OperationQueue() {
   detail::OperationQueueState& state = *state_;
-  if (tCurrentQueue == &state) fatal("an operation queue destroyed from one of its operations");
+  QV_MISUSE(tCurrentQueue == &state, "an operation queue destroyed from one of its operations");
   std::deque<std::shared_ptr<Operation>> dropped;
   std::vector<std::thread> threads;
   {
@@ -151,7 +146,7 @@ void OperationQueue::addOperation(std::shared_ptr<Operation> operation) {
   if (!operation) return;
   {
     std::lock_guard lock(operation->mutex_);
-    if (operation->queued_) fatal("an operation can be added to a queue only once");
+    QV_MISUSE(operation->queued_, "an operation can be added to a queue only once");
     operation->queued_ = true;
     operation->queue_ = state_;
   }
@@ -189,8 +184,8 @@ std::size_t OperationQueue::operationCount() const {
 }
 
 void OperationQueue::waitUntilAllOperationsAreFinished() {
-  if (tCurrentQueue == state_.get())
-    fatal("waitUntilAllOperationsAreFinished from an own operation");
+  QV_MISUSE(tCurrentQueue == state_.get(),
+            "waitUntilAllOperationsAreFinished from an own operation");
   std::unique_lock lock(state_->mutex);
   state_->allDone.wait(lock, [this] { return state_->unfinished == 0; });
 }

@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "platform/Log.h"
+#include "platform/Misuse.h"
 
 namespace platform {
 
@@ -32,16 +33,6 @@ struct ProcessLifetime::State {
   std::uint64_t generation = 0;
   std::vector<std::function<void()>> noTransactionWaiters;
 };
-
-namespace {
-
-[[noreturn, maybe_unused]] void misuse(const char* message) {
-  fmt::print(stderr, "ProcessLifetime: {}\n", message);
-  std::fflush(stderr);
-  std::abort();
-}
-
-}  // namespace
 
 ProcessLifetime& ProcessLifetime::instance() {
   static ProcessLifetime* lifetime = new ProcessLifetime(mainQueue());
@@ -97,7 +88,7 @@ void ProcessLifetime::beginTransaction() {
   std::lock_guard lock(state_->mutex);
   if (state_->inTransaction) {
 #if defined(QUORVEL_DCHECK_IS_ON)
-    misuse("beginTransaction called while the root transaction is already held");
+    QV_MISUSE(true, "beginTransaction called while the root transaction is already held");
 #else
     return;
 #endif
@@ -112,7 +103,7 @@ void ProcessLifetime::endTransaction() {
     std::lock_guard lock(state_->mutex);
     if (!state_->inTransaction) {
 #if defined(QUORVEL_DCHECK_IS_ON)
-      misuse("endTransaction called without a root transaction");
+      QV_MISUSE(true, "endTransaction called without a root transaction");
 #else
       return;
 #endif

@@ -13,6 +13,7 @@
 // sync, the caller's thread-local state (the current connection, the queue
 // chain) stays visible inside the task, and an idle sync costs no thread hop.
 #include "platform/SerialQueue.h"
+#include "platform/Misuse.h"
 
 #include <fmt/format.h>
 
@@ -36,12 +37,6 @@ struct Item {
   Task task;
   SyncGate* gate = nullptr;  // set for a sync caller waiting for its turn
 };
-
-[[noreturn]] void fatal(const std::string& message) {
-  fmt::print(stderr, "{}\n", message);
-  std::fflush(stderr);
-  std::abort();
-}
 
 }  // namespace
 
@@ -90,9 +85,8 @@ SerialQueue::SerialQueue(std::string label) : state_(std::make_unique<State>()) 
 }
 
 SerialQueue::~SerialQueue() {
-  if (std::this_thread::get_id() == state_->workerId || detail::isRunningOnQueue(*this)) {
-    fatal(fmt::format("SerialQueue '{}' destroyed from its own queue", state_->label));
-  }
+  QV_MISUSE(std::this_thread::get_id() == state_->workerId || detail::isRunningOnQueue(*this),
+            "SerialQueue '{}' destroyed from its own queue", state_->label);
   {
     std::lock_guard lock(state_->mutex);
     state_->stopping = true;
@@ -110,10 +104,9 @@ void SerialQueue::async(Task task) {
 }
 
 void SerialQueue::sync(Task task) {
-  if (detail::isRunningOnQueue(*this)) {
-    fatal(fmt::format("SerialQueue::sync called from the '{}' queue onto itself: it would deadlock",
-                      state_->label));
-  }
+  QV_MISUSE(detail::isRunningOnQueue(*this),
+            "SerialQueue::sync called from the '{}' queue onto itself: it would deadlock",
+            state_->label);
   State& state = *state_;
   {
     std::unique_lock lock(state.mutex);

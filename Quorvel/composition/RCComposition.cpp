@@ -10,8 +10,9 @@
 #include <set>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCDurableFile.h"
+#include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "platform/Log.h"
@@ -157,13 +158,11 @@ void RCComposition::setSavedRecordingURIFromRecoveredRecordingURI(std::string ur
 }
 
 void RCComposition::enumerateOrphanedFragmentsWithBlock(const FragmentVisitor& block) const {
-  int fd = ::open(bundleURL_.path().c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-  if (fd < 0) return;
-  DIR* dir = ::fdopendir(fd);
-  if (dir == nullptr) {
-    ::close(fd);
-    return;
-  }
+  RCScopedFd fd(::open(bundleURL_.path().c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd) return;
+  DIR* dir = ::fdopendir(fd.get());
+  if (dir == nullptr) return;
+  const int dirFd = fd.release();  // the DIR stream owns it now
   std::set<std::string> used;
   for (const auto& entry : manifest_.fragments) used.insert(entry.file);
   std::vector<std::string> orphans;
@@ -173,7 +172,7 @@ void RCComposition::enumerateOrphanedFragmentsWithBlock(const FragmentVisitor& b
       continue;
     }
     struct stat info {};
-    if (::fstatat(fd, name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0 || S_ISDIR(info.st_mode)) {
+    if (::fstatat(dirFd, name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0 || S_ISDIR(info.st_mode)) {
       continue;
     }
     orphans.push_back(std::move(name));

@@ -24,7 +24,7 @@
 #include <cmath>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioAsset.h"

@@ -8,7 +8,8 @@
 #include <cmath>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioAsset.h"
@@ -57,46 +58,25 @@ double fileDuration(const platform::URL& url) {
 
 platform::Status copyFile(const std::string& source, const std::string& directory,
                           const std::string& name) {
-  int in = ::open(source.c_str(), O_RDONLY | O_CLOEXEC);
-  if (in < 0) return platform::fail(platform::posixError(errno, "open " + source));
-  int dir = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-  if (dir < 0) {
-    int err = errno;
-    ::close(in);
-    return platform::fail(platform::posixError(err, "open " + directory));
-  }
-  int out = ::openat(dir, name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644);
-  ::close(dir);
-  if (out < 0) {
-    int err = errno;
-    ::close(in);
-    return platform::fail(platform::posixError(err, "create " + name));
-  }
-  platform::Status status;
+  RCScopedFd in(::open(source.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!in) return platform::fail(platform::posixError(errno, "open " + source));
+  RCScopedFd dir(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!dir) return platform::fail(platform::posixError(errno, "open " + directory));
+  RCScopedFd out(::openat(dir.get(), name.c_str(),
+                          O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
+  if (!out) return platform::fail(platform::posixError(errno, "create " + name));
   char buffer[65536];
   for (;;) {
-    ssize_t n = ::read(in, buffer, sizeof buffer);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) {
-      status = platform::fail(platform::posixError(errno, "read " + source));
-      break;
+    auto got = RCReadFully(in.get(), buffer, sizeof buffer, source);
+    if (!got) return platform::fail(got.error());
+    if (*got == 0) break;
+    if (auto written = RCWriteFully(out.get(), std::string_view(buffer, *got), name); !written) {
+      return written;
     }
-    if (n == 0) break;
-    for (ssize_t written = 0; written < n;) {
-      ssize_t w = ::write(out, buffer + written, static_cast<std::size_t>(n - written));
-      if (w < 0 && errno == EINTR) continue;
-      if (w < 0) {
-        status = platform::fail(platform::posixError(errno, "write " + name));
-        break;
-      }
-      written += w;
-    }
-    if (!status) break;
+    if (*got < sizeof buffer) break;
   }
-  if (status && ::fsync(out) != 0) status = platform::fail(platform::posixError(errno, "fsync"));
-  ::close(out);
-  ::close(in);
-  return status;
+  if (::fsync(out.get()) != 0) return platform::fail(platform::posixError(errno, "fsync"));
+  return out.close();
 }
 
 void markAllDecomposed(RCCompositionManifest& manifest) {

@@ -5,7 +5,7 @@
 #include <cmath>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileConfinement.h"
 
 namespace quorvel {

@@ -5,7 +5,7 @@
 #include <chrono>
 #include <thread>
 
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "platform/Log.h"
 
 namespace quorvel {

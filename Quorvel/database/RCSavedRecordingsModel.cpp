@@ -22,7 +22,7 @@
 #include <mutex>
 
 #include "Quorvel/database/RCSQLiteDatabase.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "platform/DispatchQueue.h"

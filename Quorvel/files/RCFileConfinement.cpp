@@ -13,31 +13,14 @@
 #include <cerrno>
 #include <vector>
 
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 
 namespace quorvel {
 namespace {
 
 constexpr int kMaximumTreeDepth = 64;
-
-class ScopedFD {
- public:
-  explicit ScopedFD(int fd = -1) : fd_(fd) {}
-  ~ScopedFD() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  ScopedFD(const ScopedFD&) = delete;
-  ScopedFD& operator=(const ScopedFD&) = delete;
-  int get() const { return fd_; }
-  void reset(int fd) {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = fd;
-  }
-
- private:
-  int fd_;
-};
 
 std::string standardizedDirectoryPath(std::string_view directory) {
   return platform::URL::fileURLWithPath(directory).URLByStandardizingPath().path();
@@ -61,14 +44,12 @@ platform::Status removeTree(int parent, const std::string& name, int depth) {
   if (depth > kMaximumTreeDepth) {
     return platform::fail(RCError(RCErrorCodeNotConfined, "directory tree too deep to remove"));
   }
-  int fd = ::openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-  if (fd < 0) return platform::fail(platform::posixError(errno, "open " + name));
-  DIR* dir = ::fdopendir(fd);
-  if (dir == nullptr) {
-    int err = errno;
-    ::close(fd);
-    return platform::fail(platform::posixError(err, "read " + name));
-  }
+  RCScopedFd opened(
+      ::openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!opened) return platform::fail(platform::posixError(errno, "open " + name));
+  DIR* dir = ::fdopendir(opened.get());
+  if (dir == nullptr) return platform::fail(platform::posixError(errno, "read " + name));
+  const int fd = opened.release();  // the DIR stream owns it now
   platform::Status first;
   std::vector<std::pair<std::string, bool>> entries;
   while (dirent* entry = ::readdir(dir)) {
@@ -131,7 +112,7 @@ platform::Status RCRemoveItemConfinedToDirectory(const platform::URL& url,
     return platform::fail(RCError(RCErrorCodeNotConfined, "refusing to remove " + url.path()));
   }
   std::string root = standardizedDirectoryPath(directory);
-  ScopedFD current(::open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  RCScopedFd current(::open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (current.get() < 0) return platform::fail(platform::posixError(errno, "open " + root));
   for (std::size_t i = 0; i + 1 < parts.size(); ++i) {
     int next =

@@ -9,6 +9,9 @@
 #include <cstdlib>
 #include <memory>
 
+#include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFile.h"
+
 namespace quorvel {
 namespace {
 
@@ -55,12 +58,9 @@ platform::Result<std::optional<RCMD5Digest>> RCMD5DigestOfFile(const std::string
   if (S_ISREG(info.st_mode) && info.st_size == 0) return std::optional<RCMD5Digest>();
 
   // O_NONBLOCK keeps a FIFO from blocking the open; reading one fails below.
-  const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-  if (fd < 0) return platform::fail(platform::posixError(errno, "open " + path));
-  struct Closer {
-    int fd;
-    ~Closer() { ::close(fd); }
-  } closer{fd};
+  RCScopedFd file(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (!file) return platform::fail(platform::posixError(errno, "open " + path));
+  const int fd = file.get();
   if (::fstat(fd, &info) != 0) return platform::fail(platform::posixError(errno, "fstat " + path));
   if (!S_ISREG(info.st_mode)) {
     return platform::fail(platform::posixError(S_ISDIR(info.st_mode) ? EISDIR : EINVAL,
@@ -71,18 +71,18 @@ platform::Result<std::optional<RCMD5Digest>> RCMD5DigestOfFile(const std::string
 
   std::unique_ptr<EVP_MD_CTX, DigestContextDeleter> context(EVP_MD_CTX_new());
   if (!context || EVP_DigestInit_ex(context.get(), md5Algorithm(), nullptr) != 1) {
-    return platform::fail(platform::Error("org.quorvel.MD5", 1, "MD5 unavailable"));
+    return platform::fail(
+        platform::Error(kRCMD5ErrorDomain, RCMD5ErrorCodeUnavailable, "MD5 unavailable"));
   }
   std::unique_ptr<std::uint8_t, AlignedFree> buffer(
       static_cast<std::uint8_t*>(std::aligned_alloc(4096, kChunkSize)));
   std::uint64_t total = 0;
   for (;;) {
-    const ssize_t got = ::read(fd, buffer.get(), kChunkSize);
-    if (got < 0 && errno == EINTR) continue;
-    if (got < 0) return platform::fail(platform::posixError(errno, "read " + path));
-    if (got == 0) break;
-    EVP_DigestUpdate(context.get(), buffer.get(), std::size_t(got));
-    total += std::uint64_t(got);
+    auto got = RCReadFully(fd, buffer.get(), kChunkSize, path);
+    if (!got) return platform::fail(got.error());
+    if (*got == 0) break;
+    EVP_DigestUpdate(context.get(), buffer.get(), *got);
+    total += std::uint64_t(*got);
   }
   // A file emptied between the size check and the read has nothing to digest.
   if (total == 0) return std::optional<RCMD5Digest>();

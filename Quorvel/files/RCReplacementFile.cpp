@@ -4,21 +4,12 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <random>
 #include <utility>
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 
 namespace quorvel {
 namespace {
-
-std::string randomSuffix() {
-  static constexpr char kAlphabet[] = "abcdefghijklmnopqrstuvwxyz0123456789";
-  thread_local std::mt19937_64 generator{std::random_device{}()};
-  std::string suffix(8, 'x');
-  for (char& c : suffix) c = kAlphabet[generator() % (sizeof kAlphabet - 1)];
-  return suffix;
-}
 
 std::string directoryOf(const std::string& path) {
   const auto slash = path.rfind('/');
@@ -27,31 +18,47 @@ std::string directoryOf(const std::string& path) {
   return path.substr(0, slash);
 }
 
-platform::Status fsyncPath(const std::string& path, int flags, std::string_view what) {
-  const int fd = ::open(path.c_str(), flags | O_CLOEXEC);
-  if (fd < 0) return platform::fail(platform::posixError(errno, what));
-  const int result = ::fsync(fd);
-  const int err = errno;
-  ::close(fd);
-  if (result != 0 && err != EINVAL) return platform::fail(platform::posixError(err, what));
+std::string joined(const std::string& directory, std::string_view name) {
+  return fmt::format("{}/{}", directory == "/" ? "" : directory, name);
+}
+
+// fsync that treats "this file system cannot sync this kind of file" as done.
+platform::Status syncFd(int fd, std::string_view what) {
+  if (::fsync(fd) != 0 && errno != EINVAL) {
+    return platform::fail(platform::posixError(errno, fmt::format("cannot flush {}", what)));
+  }
   return {};
 }
 
 }  // namespace
 
-RCReplacementFile::RCReplacementFile(std::string tempPath, std::string destinationPath)
-    : tempPath_(std::move(tempPath)),
-      destinationPath_(std::move(destinationPath)),
+RCReplacementFile::RCReplacementFile(RCScopedFd directory, RCScopedFd file,
+                                     std::string directoryPath, std::string tempName,
+                                     std::string destinationName)
+    : directory_(std::move(directory)),
+      file_(std::move(file)),
+      tempName_(std::move(tempName)),
+      destinationName_(std::move(destinationName)),
+      tempPath_(joined(directoryPath, tempName_)),
+      destinationPath_(joined(directoryPath, destinationName_)),
       pending_(true) {}
 
 RCReplacementFile::RCReplacementFile(RCReplacementFile&& other) noexcept
-    : tempPath_(std::move(other.tempPath_)),
+    : directory_(std::move(other.directory_)),
+      file_(std::move(other.file_)),
+      tempName_(std::move(other.tempName_)),
+      destinationName_(std::move(other.destinationName_)),
+      tempPath_(std::move(other.tempPath_)),
       destinationPath_(std::move(other.destinationPath_)),
       pending_(std::exchange(other.pending_, false)) {}
 
 RCReplacementFile& RCReplacementFile::operator=(RCReplacementFile&& other) noexcept {
   if (this != &other) {
     discard();
+    directory_ = std::move(other.directory_);
+    file_ = std::move(other.file_);
+    tempName_ = std::move(other.tempName_);
+    destinationName_ = std::move(other.destinationName_);
     tempPath_ = std::move(other.tempPath_);
     destinationPath_ = std::move(other.destinationPath_);
     pending_ = std::exchange(other.pending_, false);
@@ -61,25 +68,51 @@ RCReplacementFile& RCReplacementFile::operator=(RCReplacementFile&& other) noexc
 
 RCReplacementFile::~RCReplacementFile() { discard(); }
 
-platform::Result<RCReplacementFile> RCReplacementFile::create(const platform::URL& destination) {
-  const std::string destinationPath = destination.path();
-  const std::string directory = directoryOf(destinationPath);
-  const std::string name = destination.lastPathComponent();
+platform::Result<RCReplacementFile> RCReplacementFile::createIn(RCScopedFd directory,
+                                                                std::string directoryPath,
+                                                                std::string_view name,
+                                                                mode_t mode) {
+  if (name.empty() || name == "." || name == ".." || name.find('/') != std::string_view::npos) {
+    return platform::fail(
+        RCMediaError(RCMediaErrorCodeInvalidArgument, fmt::format("not a file name: {}", name)));
+  }
   for (int attempt = 0; attempt < 16; ++attempt) {
-    std::string tempPath =
-        fmt::format("{}/.{}.{}.tmp", directory == "/" ? "" : directory, name, randomSuffix());
-    // 0666 so the umask decides, as for any new file.
-    const int fd = ::open(tempPath.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
-    if (fd >= 0) {
-      ::close(fd);
-      return RCReplacementFile(std::move(tempPath), destinationPath);
+    std::string tempName = RCAtomicReplaceTempName(name);
+    RCScopedFd file(::openat(directory.get(), tempName.c_str(),
+                             O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+    if (file) {
+      return RCReplacementFile(std::move(directory), std::move(file), std::move(directoryPath),
+                               std::move(tempName), std::string(name));
     }
-    if (errno != EEXIST)
+    if (errno != EEXIST) {
       return platform::fail(platform::posixError(
-          errno, fmt::format("cannot create a temporary file in {}", directory)));
+          errno, fmt::format("cannot create a temporary file in {}", directoryPath)));
+    }
   }
   return platform::fail(
-      RCMediaError(RCMediaErrorCode::FileSystem, "no free temporary file name in " + directory));
+      RCMediaError(RCMediaErrorCodeFileSystem, "no free temporary file name in " + directoryPath));
+}
+
+platform::Result<RCReplacementFile> RCReplacementFile::create(const platform::URL& destination,
+                                                              mode_t mode) {
+  std::string directoryPath = directoryOf(destination.path());
+  RCScopedFd directory(::open(directoryPath.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!directory) {
+    return platform::fail(platform::posixError(
+        errno, fmt::format("cannot create a temporary file in {}", directoryPath)));
+  }
+  return createIn(std::move(directory), std::move(directoryPath), destination.lastPathComponent(),
+                  mode);
+}
+
+platform::Result<RCReplacementFile> RCReplacementFile::createInDirectory(std::string_view directory,
+                                                                         std::string_view name,
+                                                                         mode_t mode) {
+  std::string directoryPath(directory);
+  RCScopedFd directoryFd(
+      ::open(directoryPath.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!directoryFd) return platform::fail(platform::posixError(errno, "open " + directoryPath));
+  return createIn(std::move(directoryFd), std::move(directoryPath), name, mode);
 }
 
 platform::Status RCReplacementFile::replace(const platform::URL& destination,
@@ -91,47 +124,51 @@ platform::Status RCReplacementFile::replace(const platform::URL& destination,
 }
 
 platform::Status RCReplacementFile::write(std::string_view bytes) {
-  const int fd = ::open(tempPath_.c_str(), O_WRONLY | O_TRUNC | O_CLOEXEC);
-  if (fd < 0) return platform::fail(platform::posixError(errno, "cannot open " + tempPath_));
-  while (!bytes.empty()) {
-    const ssize_t written = ::write(fd, bytes.data(), bytes.size());
-    if (written < 0) {
-      if (errno == EINTR) continue;
-      const int err = errno;
-      ::close(fd);
-      return platform::fail(platform::posixError(err, "cannot write " + tempPath_));
-    }
-    bytes.remove_prefix(static_cast<std::size_t>(written));
+  if (!pending_) {
+    return platform::fail(
+        RCMediaError(RCMediaErrorCodeFileSystem, "the temporary file is gone or committed"));
   }
-  if (::close(fd) != 0)
+  if (::ftruncate(file_.get(), 0) != 0 || ::lseek(file_.get(), 0, SEEK_SET) != 0) {
     return platform::fail(platform::posixError(errno, "cannot write " + tempPath_));
-  return {};
+  }
+  return RCWriteFully(file_.get(), bytes, tempPath_);
 }
 
 platform::Status RCReplacementFile::commit() {
-  if (!pending_)
+  if (!pending_) {
     return platform::fail(
-        RCMediaError(RCMediaErrorCode::FileSystem, "the temporary file is gone or committed"));
-  if (auto synced = fsyncPath(tempPath_, O_RDONLY, "cannot flush " + tempPath_); !synced) {
-    discard();
-    return synced;
+        RCMediaError(RCMediaErrorCodeFileSystem, "the temporary file is gone or committed"));
   }
-  if (::rename(tempPath_.c_str(), destinationPath_.c_str()) != 0) {
-    const int err = errno;
+  // A library that wrote by path may have replaced the file it was given, so
+  // the flush goes to whatever now has the temporary name.
+  RCScopedFd written(
+      ::openat(directory_.get(), tempName_.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  platform::Status status =
+      written ? syncFd(written.get(), tempPath_)
+              : platform::fail(platform::posixError(errno, "cannot open " + tempPath_));
+  if (status && ::renameat(directory_.get(), tempName_.c_str(), directory_.get(),
+                           destinationName_.c_str()) != 0) {
+    status = platform::fail(platform::posixError(errno, "cannot rename over " + destinationPath_));
+  }
+  if (!status) {
     discard();
-    return platform::fail(platform::posixError(err, "cannot rename over " + destinationPath_));
+    return status;
   }
   pending_ = false;
+  file_.reset();
   // The rename is done; a directory that cannot be flushed does not undo it.
-  (void)fsyncPath(directoryOf(destinationPath_), O_RDONLY | O_DIRECTORY, "flush directory");
+  (void)syncFd(directory_.get(), "directory");
+  directory_.reset();
   return {};
 }
 
 void RCReplacementFile::discard() {
   if (pending_) {
-    ::unlink(tempPath_.c_str());
+    ::unlinkat(directory_.get(), tempName_.c_str(), 0);
     pending_ = false;
   }
+  file_.reset();
+  directory_.reset();
 }
 
 }  // namespace quorvel

@@ -13,14 +13,13 @@
 #include <string>
 #include <vector>
 
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCMetadataItem.h"
 #include "platform/Date.h"
 #include "platform/Error.h"
 #include "platform/URL.h"
 
 namespace quorvel {
-
-inline constexpr const char* kRCAudioAssetErrorDomain = "org.quorvel.AudioAsset";
 
 // What the file's common metadata holds.
 struct RCCommonMetadata {

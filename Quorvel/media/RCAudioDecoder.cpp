@@ -7,7 +7,7 @@ extern "C" {
 #include <libavformat/avformat.h>
 }
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
 
 namespace quorvel {
@@ -28,7 +28,7 @@ platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const pla
   int result = avformat_open_input(&format, url.path().c_str(), nullptr, nullptr);
   if (result < 0)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::CannotOpen, result, "cannot open " + name));
+        RCMediaErrorFromAV(RCMediaErrorCodeCannotOpen, result, "cannot open " + name));
   auto closeOnFailure = [&format] { avformat_close_input(&format); };
 
   auto findAudio = [&format]() -> AVStream* {
@@ -46,7 +46,7 @@ platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const pla
     result = avformat_find_stream_info(format, nullptr);
     if (result < 0) {
       closeOnFailure();
-      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::CannotOpen, result,
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeCannotOpen, result,
                                                "cannot read the streams of " + name));
     }
     stream = findAudio();
@@ -55,7 +55,7 @@ platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const pla
       stream->codecpar->sample_rate <= 0 || stream->codecpar->ch_layout.nb_channels <= 0) {
     closeOnFailure();
     return platform::fail(
-        RCMediaError(RCMediaErrorCode::NoAudioStream, name + " holds no usable audio stream"));
+        RCMediaError(RCMediaErrorCodeNoAudioStream, name + " holds no usable audio stream"));
   }
   for (unsigned i = 0; i < format->nb_streams; ++i)
     if (format->streams[i] != stream) format->streams[i]->discard = AVDISCARD_ALL;
@@ -77,12 +77,12 @@ platform::Result<bool> RCAudioDecoder::readPacket(AVPacket* packet) {
     const int result = av_read_frame(format_, packet);
     if (result == AVERROR_EOF) return false;
     if (result < 0)
-      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                                "cannot read " + url_.lastPathComponent()));
     if (packet->stream_index == stream_->index) {
       if (packet->flags & AV_PKT_FLAG_CORRUPT) {
         av_packet_unref(packet);
-        return platform::fail(RCMediaError(RCMediaErrorCode::Truncated,
+        return platform::fail(RCMediaError(RCMediaErrorCodeTruncated,
                                            url_.lastPathComponent() + " is damaged or truncated"));
       }
       return true;
@@ -96,7 +96,7 @@ platform::Status RCAudioDecoder::openCodec() {
   const AVCodec* codec = avcodec_find_decoder(stream_->codecpar->codec_id);
   const std::string name = url_.lastPathComponent();
   if (!codec)
-    return platform::fail(RCMediaError(RCMediaErrorCode::DecodeFailed,
+    return platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed,
                                        fmt::format("no decoder for the audio of {}", name)));
   codec_ = avcodec_alloc_context3(codec);
   frame_ = av_frame_alloc();
@@ -109,7 +109,7 @@ platform::Status RCAudioDecoder::openCodec() {
   }
   if (result < 0) {
     avcodec_free_context(&codec_);
-    return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+    return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                              "cannot open the decoder for " + name));
   }
   return {};
@@ -124,7 +124,7 @@ platform::Status RCAudioDecoder::decode(const AVPacket* packet, const FrameHandl
     // A damaged packet: the codec drops it; a file of nothing but damage
     // fails later for holding no audio.
     if (result == AVERROR_INVALIDDATA) return {};
-    return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+    return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                              "cannot decode " + url_.lastPathComponent()));
   }
   for (;;) {
@@ -132,7 +132,7 @@ platform::Status RCAudioDecoder::decode(const AVPacket* packet, const FrameHandl
     if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
     if (result == AVERROR_INVALIDDATA) continue;
     if (result < 0)
-      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                                "cannot decode " + url_.lastPathComponent()));
     auto handled = handler(frame_);
     av_frame_unref(frame_);

@@ -9,7 +9,7 @@ extern "C" {
 #include <libavutil/audio_fifo.h>
 }
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCAudioOutput.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
 
@@ -83,7 +83,7 @@ platform::Result<std::unique_ptr<RCAudioEncoder>> RCAudioEncoder::open(
   const AVCodecID codecID = codecFor(ext, model);
   const AVCodec* codec = codecID == AV_CODEC_ID_NONE ? nullptr : avcodec_find_encoder(codecID);
   if (!codec)
-    return platform::fail(RCMediaError(RCMediaErrorCode::UnsupportedFormat,
+    return platform::fail(RCMediaError(RCMediaErrorCodeUnsupportedFormat,
                                        fmt::format("no audio encoder for \".{}\"", extension)));
   std::unique_ptr<RCAudioEncoder> encoder(new RCAudioEncoder());
   encoder->codec_ = avcodec_alloc_context3(codec);
@@ -112,7 +112,7 @@ platform::Result<std::unique_ptr<RCAudioEncoder>> RCAudioEncoder::open(
   int result = avcodec_open2(c, codec, nullptr);
   if (result < 0)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::EncodeFailed, result, "cannot open the encoder"));
+        RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot open the encoder"));
   encoder->frameSize_ =
       (codec->capabilities & AV_CODEC_CAP_VARIABLE_FRAME_SIZE) || c->frame_size <= 0
           ? 4096
@@ -165,13 +165,13 @@ platform::Status RCAudioEncoder::encodeFrame(AVFrame* frame) {
   int result = avcodec_send_frame(codec_, frame);
   if (result < 0 && result != AVERROR_EOF)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::EncodeFailed, result, "cannot encode audio"));
+        RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot encode audio"));
   for (;;) {
     result = avcodec_receive_packet(codec_, packet_);
     if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
     if (result < 0)
       return platform::fail(
-          RCMediaErrorFromAV(RCMediaErrorCode::EncodeFailed, result, "cannot encode audio"));
+          RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot encode audio"));
     if (auto written = output_->writePacket(packet_); !written) return written;
   }
 }

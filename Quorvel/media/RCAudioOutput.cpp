@@ -9,7 +9,7 @@ extern "C" {
 #include <libavformat/avformat.h>
 }
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
 
 namespace quorvel {
@@ -51,13 +51,13 @@ platform::Result<std::unique_ptr<RCAudioOutput>> RCAudioOutput::open(
   RCInstallFFmpegLogging();
   const char* muxer = muxerNameFor(extension);
   if (!muxer)
-    return platform::fail(RCMediaError(RCMediaErrorCode::UnsupportedFormat,
+    return platform::fail(RCMediaError(RCMediaErrorCodeUnsupportedFormat,
                                        fmt::format("no audio container for \".{}\"", extension)));
   AVFormatContext* format = nullptr;
   int result = avformat_alloc_output_context2(&format, nullptr, muxer, nullptr);
   if (result < 0 || !format)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::UnsupportedFormat, result, "cannot set up the muxer"));
+        RCMediaErrorFromAV(RCMediaErrorCodeUnsupportedFormat, result, "cannot set up the muxer"));
   AVStream* stream = avformat_new_stream(format, nullptr);
   if (!stream) {
     avformat_free_context(format);
@@ -69,13 +69,13 @@ platform::Result<std::unique_ptr<RCAudioOutput>> RCAudioOutput::open(
   stream->codecpar->codec_tag = 0;
   stream->time_base = AVRational{1, parameters->sample_rate};
   if (avformat_query_codec(format->oformat, parameters->codec_id, FF_COMPLIANCE_NORMAL) != 1)
-    return platform::fail(RCMediaError(RCMediaErrorCode::UnsupportedFormat,
+    return platform::fail(RCMediaError(RCMediaErrorCodeUnsupportedFormat,
                                        fmt::format("\".{}\" files cannot hold {} audio", extension,
                                                    avcodec_get_name(parameters->codec_id))));
   result = avio_open(&format->pb, path.c_str(), AVIO_FLAG_WRITE);
   if (result < 0)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::FileSystem, result, "cannot open " + path));
+        RCMediaErrorFromAV(RCMediaErrorCodeFileSystem, result, "cannot open " + path));
   return output;
 }
 
@@ -90,7 +90,7 @@ platform::Status RCAudioOutput::writeHeaderOnce() {
   av_dict_free(&options);
   if (result < 0)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::EncodeFailed, result, "cannot write the header"));
+        RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot write the header"));
   headerWritten_ = true;
   return {};
 }
@@ -107,7 +107,7 @@ platform::Status RCAudioOutput::writePacket(AVPacket* packet) {
   av_packet_unref(packet);
   if (result < 0)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::EncodeFailed, result, "cannot write audio"));
+        RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot write audio"));
   return {};
 }
 
@@ -120,7 +120,7 @@ platform::Status RCAudioOutput::finish() {
   if (result >= 0) result = closed;
   if (result < 0)
     return platform::fail(
-        RCMediaErrorFromAV(RCMediaErrorCode::EncodeFailed, result, "cannot finish " + path_));
+        RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot finish " + path_));
   return {};
 }
 

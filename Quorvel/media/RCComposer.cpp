@@ -44,7 +44,7 @@ extern "C" {
 #include <libswresample/swresample.h>
 }
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCReplacementFile.h"
 #include "Quorvel/media/RCAudioDecoder.h"
 #include "Quorvel/media/RCAudioEncoder.h"
@@ -102,7 +102,7 @@ std::int64_t shortfallTolerance(int rate, std::int64_t frameSize) {
 }
 
 platform::Error truncatedError(const Input& input, double endSeconds) {
-  return RCMediaError(RCMediaErrorCode::Truncated,
+  return RCMediaError(RCMediaErrorCodeTruncated,
                       fmt::format("{} ends at {:.3f}s, before the end of its range at {:.3f}s",
                                   input.segment.fragmentURL.lastPathComponent(), endSeconds,
                                   input.segment.contentStart + input.segment.contentDuration));
@@ -131,14 +131,14 @@ class StreamCopier {
     waveformDecoder_ = codec ? avcodec_alloc_context3(codec) : nullptr;
     frame_ = av_frame_alloc();
     if (!codec || !waveformDecoder_ || !frame_)
-      return platform::fail(RCMediaError(RCMediaErrorCode::DecodeFailed, "no AAC decoder"));
+      return platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed, "no AAC decoder"));
     avcodec_parameters_to_context(waveformDecoder_, parameters);
     waveformDecoder_->pkt_timebase = AVRational{1, rate_};
     waveformDecoder_->thread_count = 1;
     const int result = avcodec_open2(waveformDecoder_, codec, nullptr);
     if (result < 0)
       return platform::fail(
-          RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result, "cannot open the decoder"));
+          RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result, "cannot open the decoder"));
     return {};
   }
 
@@ -163,7 +163,7 @@ class StreamCopier {
       if (pts == AV_NOPTS_VALUE) {
         av_packet_unref(packet.get());
         return platform::fail(RCMediaError(
-            RCMediaErrorCode::DecodeFailed,
+            RCMediaErrorCodeDecodeFailed,
             input.segment.fragmentURL.lastPathComponent() + " has audio without timestamps"));
       }
       const std::int64_t duration = packet->duration > 0 ? packet->duration : frameSize_;
@@ -201,7 +201,7 @@ class StreamCopier {
   // Writes the held-back packet as the output's last one.
   platform::Status finish() {
     if (!haveHeld_)
-      return platform::fail(RCMediaError(RCMediaErrorCode::InvalidArgument, "nothing to compose"));
+      return platform::fail(RCMediaError(RCMediaErrorCodeInvalidArgument, "nothing to compose"));
     held_->duration = std::clamp<std::int64_t>(std::min(heldDuration_, heldRoom_), 1, frameSize_);
     endPts_ = held_->pts + held_->duration;
     if (auto written = write(held_.get(), true); !written) return written;
@@ -249,14 +249,14 @@ class StreamCopier {
     if (last && result >= 0) result = avcodec_send_packet(waveformDecoder_, nullptr);
     if (result < 0 && result != AVERROR_INVALIDDATA)
       return platform::fail(
-          RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result, "cannot decode audio"));
+          RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result, "cannot decode audio"));
     for (;;) {
       result = avcodec_receive_frame(waveformDecoder_, frame_);
       if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
       if (result == AVERROR_INVALIDDATA) continue;
       if (result < 0)
         return platform::fail(
-            RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result, "cannot decode audio"));
+            RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result, "cannot decode audio"));
       const std::int64_t first = frame_->pts != AV_NOPTS_VALUE ? frame_->pts : decodedUntil_;
       const std::int64_t from =
           std::max<std::int64_t>(first, std::max<std::int64_t>(0, decodedUntil_));
@@ -332,7 +332,7 @@ class Converter {
     }
     av_channel_layout_uninit(&inLayout);
     if (result < 0)
-      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, result,
+      return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                                "cannot convert the fragment's audio"));
     return {};
   }
@@ -368,7 +368,7 @@ class Converter {
       const int produced =
           swr_convert(swr_, buffer_, capacity, const_cast<const std::uint8_t**>(planes), count);
       if (produced < 0)
-        return platform::fail(RCMediaErrorFromAV(RCMediaErrorCode::DecodeFailed, produced,
+        return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, produced,
                                                  "cannot convert the fragment's audio"));
       if (produced > 0) {
         if (auto emitted = emit(buffer_, produced); !emitted) return emitted;
@@ -423,7 +423,7 @@ platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder,
       configured = true;
     } else if (!converter.matches(frame)) {
       return platform::fail(RCMediaError(
-          RCMediaErrorCode::DecodeFailed,
+          RCMediaErrorCodeDecodeFailed,
           input.segment.fragmentURL.lastPathComponent() + " changes its audio format midway"));
     }
     const std::int64_t from = std::max(position, start);
@@ -466,10 +466,9 @@ platform::Status composeByReencoding(std::vector<Input>& inputs, const std::stri
 platform::Status validate(const std::vector<RCComposerSegment>& segments,
                           const platform::URL& destination, const std::string& extension) {
   if (segments.empty())
-    return platform::fail(
-        RCMediaError(RCMediaErrorCode::InvalidArgument, "no fragments to compose"));
+    return platform::fail(RCMediaError(RCMediaErrorCodeInvalidArgument, "no fragments to compose"));
   if (!RCAudioOutput::supportsExtension(extension))
-    return platform::fail(RCMediaError(RCMediaErrorCode::UnsupportedFormat,
+    return platform::fail(RCMediaError(RCMediaErrorCodeUnsupportedFormat,
                                        fmt::format("cannot compose into {}: unknown audio format",
                                                    destination.lastPathComponent())));
   for (const RCComposerSegment& segment : segments) {
@@ -477,7 +476,7 @@ platform::Status validate(const std::vector<RCComposerSegment>& segments,
         segment.contentStart < 0 || segment.contentDuration <= 0 ||
         segment.contentStart + segment.contentDuration > 1e7)
       return platform::fail(RCMediaError(
-          RCMediaErrorCode::InvalidArgument,
+          RCMediaErrorCodeInvalidArgument,
           fmt::format("invalid range [{}, +{}] of {}", segment.contentStart,
                       segment.contentDuration, segment.fragmentURL.lastPathComponent())));
   }

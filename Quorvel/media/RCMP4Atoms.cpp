@@ -11,6 +11,9 @@
 #include <limits>
 #include <optional>
 
+#include "Quorvel/files/RCFile.h"
+#include "Quorvel/files/RCReplacementFile.h"
+
 namespace quorvel {
 namespace {
 
@@ -413,26 +416,14 @@ platform::Result<TitleEdit> normalizeEdit(std::string_view title, std::string_vi
 
 // ---- files ----
 
-struct FileDescriptor {
-  int fd = -1;
-  ~FileDescriptor() {
-    if (fd >= 0) ::close(fd);
-  }
-};
+// kRCMP4ErrorIO for a failure the file layer reported.
+platform::Error ioErrorFrom(const platform::Error& cause) {
+  return platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorIO, cause.localizedDescription(), cause);
+}
 
 platform::Error ioError(int err, const std::string& what) {
   return platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorIO, what + ": " + std::strerror(err),
                          platform::posixError(err, what));
-}
-
-bool preadFully(int fd, std::uint64_t offset, std::size_t size, std::uint8_t* out) {
-  while (size > 0) {
-    const ssize_t got = ::pread(fd, out, size, off_t(offset));
-    if (got < 0 && errno == EINTR) continue;
-    if (got <= 0) return false;
-    out += got, offset += std::uint64_t(got), size -= std::size_t(got);
-  }
-  return true;
 }
 
 struct LoadedMovie {
@@ -448,7 +439,7 @@ platform::Result<LoadedMovie> loadMovie(int fd) {
   const std::uint64_t fileSize = std::uint64_t(info.st_size);
   auto atoms =
       RCMP4TopLevelAtoms(fileSize, [fd](std::uint64_t offset, std::size_t size, std::uint8_t* out) {
-        return preadFully(fd, offset, size, out);
+        return RCPreadFully(fd, offset, size, out);
       });
   if (!atoms) return platform::fail(atoms.error());
   for (const RCMP4Atom& atom : *atoms) {
@@ -457,7 +448,7 @@ platform::Result<LoadedMovie> loadMovie(int fd) {
       return platform::fail(mp4Error(kRCMP4ErrorTooLarge, "movie atom too large"));
     }
     Bytes bytes(std::size_t(atom.size));
-    if (!preadFully(fd, atom.offset, bytes.size(), bytes.data())) {
+    if (!RCPreadFully(fd, atom.offset, bytes.size(), bytes.data())) {
       return platform::fail(ioError(errno ? errno : EIO, "read movie atom"));
     }
     // The movie atom on disk may say "to the end of the file" (size 0) or
@@ -471,6 +462,13 @@ platform::Result<LoadedMovie> loadMovie(int fd) {
     return LoadedMovie{fileSize, atom.offset, std::move(bytes)};
   }
   return platform::fail(mp4Error(kRCMP4ErrorNoMovie, "no movie atom"));
+}
+
+platform::Status writeAll(int fd, View bytes) {
+  auto written = RCWriteFully(
+      fd, std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()), "the copy");
+  if (!written) return platform::fail(ioErrorFrom(written.error()));
+  return {};
 }
 
 platform::Status copyRange(int from, std::uint64_t offset, std::uint64_t length, int to) {
@@ -490,29 +488,12 @@ platform::Status copyRange(int from, std::uint64_t offset, std::uint64_t length,
     Bytes buffer(1 << 20);
     while (length > 0) {
       const std::size_t chunk = std::size_t(std::min<std::uint64_t>(length, buffer.size()));
-      if (!preadFully(from, std::uint64_t(in), chunk, buffer.data())) {
+      if (!RCPreadFully(from, std::uint64_t(in), chunk, buffer.data())) {
         return platform::fail(ioError(errno ? errno : EIO, "read"));
       }
-      std::size_t written = 0;
-      while (written < chunk) {
-        const ssize_t n = ::write(to, buffer.data() + written, chunk - written);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return platform::fail(ioError(errno, "write"));
-        written += std::size_t(n);
-      }
+      if (auto s = writeAll(to, View(buffer.data(), chunk)); !s) return s;
       in += loff_t(chunk), length -= chunk;
     }
-  }
-  return {};
-}
-
-platform::Status writeAll(int fd, View bytes) {
-  std::size_t written = 0;
-  while (written < bytes.size()) {
-    const ssize_t n = ::write(fd, bytes.data() + written, bytes.size() - written);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return platform::fail(ioError(errno, "write"));
-    written += std::size_t(n);
   }
   return {};
 }
@@ -664,47 +645,37 @@ platform::Result<std::vector<RCMetadataItem>> RCMP4TitleItemsInFileImage(View fi
 }
 
 platform::Result<std::vector<RCMetadataItem>> RCMP4ReadTitleItems(const std::string& path) {
-  FileDescriptor file{::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK)};
-  if (file.fd < 0) return platform::fail(ioError(errno, "open " + path));
-  auto movie = loadMovie(file.fd);
+  RCScopedFd file(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (!file) return platform::fail(ioError(errno, "open " + path));
+  auto movie = loadMovie(file.get());
   if (!movie) return platform::fail(movie.error());
   return RCMP4TitleItemsInMovie(movie->bytes);
 }
 
 platform::Status RCMP4WriteTitle(const std::string& path, std::string_view title,
                                  std::string_view language) {
-  FileDescriptor source{::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK)};
-  if (source.fd < 0) return platform::fail(ioError(errno, "open " + path));
+  RCScopedFd source(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  if (!source) return platform::fail(ioError(errno, "open " + path));
   struct stat info {};
-  if (::fstat(source.fd, &info) != 0) return platform::fail(ioError(errno, "fstat"));
-  auto movie = loadMovie(source.fd);
+  if (::fstat(source.get(), &info) != 0) return platform::fail(ioError(errno, "fstat"));
+  auto movie = loadMovie(source.get());
   if (!movie) return platform::fail(movie.error());
   auto rewritten = RCMP4MovieWithTitle(movie->bytes, movie->offset, title, language);
   if (!rewritten) return platform::fail(rewritten.error());
 
-  const std::size_t slash = path.rfind('/');
-  const std::string directory = slash == std::string::npos ? "." : path.substr(0, slash);
-  const std::string name = slash == std::string::npos ? path : path.substr(slash + 1);
-  std::string temporary = directory + "/." + name + ".title-XXXXXX";
-  FileDescriptor target{::mkstemp(temporary.data())};
-  if (target.fd < 0) return platform::fail(ioError(errno, "mkstemp in " + directory));
-  auto write = [&]() -> platform::Status {
-    if (::fchmod(target.fd, info.st_mode & 07777) != 0) {
-      return platform::fail(ioError(errno, "fchmod"));
-    }
-    if (auto s = copyRange(source.fd, 0, movie->offset, target.fd); !s) return s;
-    if (auto s = writeAll(target.fd, *rewritten); !s) return s;
-    const std::uint64_t after = movie->offset + movie->bytes.size();
-    if (auto s = copyRange(source.fd, after, movie->fileSize - after, target.fd); !s) return s;
-    if (::fsync(target.fd) != 0) return platform::fail(ioError(errno, "fsync"));
-    if (::rename(temporary.c_str(), path.c_str()) != 0) {
-      return platform::fail(ioError(errno, "rename"));
-    }
-    return {};
-  };
-  platform::Status status = write();
-  if (!status) ::unlink(temporary.c_str());
-  return status;
+  auto target = RCReplacementFile::create(platform::URL::fileURLWithPath(path), 0600);
+  if (!target) return platform::fail(ioErrorFrom(target.error()));
+  if (::fchmod(target->fd(), info.st_mode & 07777) != 0) {
+    return platform::fail(ioError(errno, "fchmod"));
+  }
+  if (auto s = copyRange(source.get(), 0, movie->offset, target->fd()); !s) return s;
+  if (auto s = writeAll(target->fd(), *rewritten); !s) return s;
+  const std::uint64_t after = movie->offset + movie->bytes.size();
+  if (auto s = copyRange(source.get(), after, movie->fileSize - after, target->fd()); !s) return s;
+  if (auto committed = target->commit(); !committed) {
+    return platform::fail(ioErrorFrom(committed.error()));
+  }
+  return {};
 }
 
 }  // namespace quorvel

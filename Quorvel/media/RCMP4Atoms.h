@@ -23,19 +23,11 @@
 #include <string_view>
 #include <vector>
 
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCMetadataItem.h"
 #include "platform/Error.h"
 
 namespace quorvel {
-
-inline constexpr const char* kRCMP4ErrorDomain = "org.quorvel.MP4Atoms";
-enum RCMP4ErrorCode : long {
-  kRCMP4ErrorMalformed = 1,    // sizes that do not add up
-  kRCMP4ErrorNoMovie = 2,      // no complete `moov` atom
-  kRCMP4ErrorBadArgument = 3,  // language or title that cannot be stored
-  kRCMP4ErrorIO = 4,           // reading or writing the file failed
-  kRCMP4ErrorTooLarge = 5,     // an offset or atom that does not fit its field
-};
 
 struct RCMP4Atom {
   std::string type;  // four characters, bytes as stored (©nam starts with 0xA9)

@@ -3,7 +3,7 @@
 #include <charconv>
 #include <optional>
 
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 
 namespace quorvel {
 namespace {

@@ -1,4 +1,4 @@
-// The saved-recording service's errors: the codes of its error domain, the
+// The saved-recording service's errors (codes in Quorvel/errors/RCErrors.h): the
 // D-Bus error names they travel under, and the mapping both ways between
 // error values and D-Bus error replies (name, message).
 //
@@ -12,21 +12,11 @@
 #include <string>
 #include <string_view>
 
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "platform/Error.h"
 
 namespace quorvel {
-
-enum RCSSavedRecordingServiceErrorCode : long {
-  // A prepare request came without a composition AVURL.
-  RCSSavedRecordingServiceErrorMissingCompositionAVURL = 101,
-  // The session registry refused a session that conflicts with an open one.
-  RCSSavedRecordingServiceErrorConflictingSession = 301,
-  // A deferred access request was replaced by a newer one for the same recording.
-  RCSSavedRecordingServiceErrorDeferredRequestSuperseded = 302,
-  // Composing a recording's fragments into its final audio file failed.
-  RCSSavedRecordingServiceErrorCompositionFailed = 401,
-};
 
 // An error in RCSSavedRecordingServiceErrorDomain with `code` and no further
 // information.

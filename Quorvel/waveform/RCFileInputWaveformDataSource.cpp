@@ -10,7 +10,7 @@ extern "C" {
 #include <libavformat/avformat.h>
 }
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCAudioDecoder.h"
 #include "Quorvel/waveform/RCWaveformBuilder.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
@@ -98,7 +98,7 @@ platform::Status RCFileInputWaveformDataSource::generate() {
       }
     } else if (frame->sample_rate != builder->waveform().sampleRate()) {
       return platform::fail(
-          RCMediaError(RCMediaErrorCode::DecodeFailed, name + " changes its sample rate midway"));
+          RCMediaError(RCMediaErrorCodeDecodeFailed, name + " changes its sample rate midway"));
     }
     builder->append(frame);
     if (builder->framesAppended() >= nextFlush) {
@@ -114,7 +114,7 @@ platform::Status RCFileInputWaveformDataSource::generate() {
   platform::Status status;
   for (;;) {
     if (cancelled_) {
-      status = platform::fail(RCMediaError(RCMediaErrorCode::DecodeFailed, "cancelled"));
+      status = platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed, "cancelled"));
       break;
     }
     auto more = decoder.readPacket(packet);
@@ -131,7 +131,7 @@ platform::Status RCFileInputWaveformDataSource::generate() {
 
   if (!builder || builder->framesAppended() == 0)
     return platform::fail(
-        RCMediaError(RCMediaErrorCode::DecodeFailed, "no audio could be decoded from " + name));
+        RCMediaError(RCMediaErrorCodeDecodeFailed, "no audio could be decoded from " + name));
   const int rate = builder->waveform().sampleRate();
   const double decoded = double(builder->framesAppended()) / rate;
   const double declared = decoder.declaredDurationSeconds();
@@ -139,7 +139,7 @@ platform::Status RCFileInputWaveformDataSource::generate() {
   // declared duration by more than a few frames is missing audio.
   if (declared > 0 && decoded < declared - std::max(0.05, 4096.0 / rate))
     return platform::fail(RCMediaError(
-        RCMediaErrorCode::Truncated,
+        RCMediaErrorCodeTruncated,
         fmt::format("{} holds {:.3f}s of audio but declares {:.3f}s", name, decoded, declared)));
   builder->finish();
   waveform_ = builder->waveform();

@@ -1,6 +1,6 @@
 #include "Quorvel/waveform/RCWaveform.h"
 
-#include <stdexcept>
+#include "platform/Misuse.h"
 
 namespace quorvel {
 
@@ -11,8 +11,9 @@ platform::URL RCWaveform::waveformURLForAVURL(const platform::URL& avURL) {
 
 RCWaveform::RCWaveform(int sampleRate, int samplesPerPixel, int channels, int bits)
     : sampleRate_(sampleRate), samplesPerPixel_(samplesPerPixel), channels_(channels), bits_(bits) {
-  if (sampleRate < 1 || samplesPerPixel < 1 || channels < 1 || (bits != 8 && bits != 16))
-    throw std::invalid_argument("RCWaveform: invalid shape");
+  QV_MISUSE(sampleRate < 1 || samplesPerPixel < 1 || channels < 1 || (bits != 8 && bits != 16),
+            "RCWaveform: invalid shape (rate {}, {} samples per pixel, {} channels, {} bits)",
+            sampleRate, samplesPerPixel, channels, bits);
 }
 
 double RCWaveform::durationSeconds() const {
@@ -20,8 +21,8 @@ double RCWaveform::durationSeconds() const {
 }
 
 void RCWaveform::appendPixel(std::span<const std::int16_t> minMax) {
-  if (minMax.size() != std::size_t(2 * channels_))
-    throw std::invalid_argument("RCWaveform::appendPixel: wrong number of values");
+  QV_MISUSE(minMax.size() != std::size_t(2 * channels_),
+            "RCWaveform::appendPixel: {} values for {} channels", minMax.size(), channels_);
   data_.insert(data_.end(), minMax.begin(), minMax.end());
 }
 

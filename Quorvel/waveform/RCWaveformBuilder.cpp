@@ -2,11 +2,12 @@
 
 #include <algorithm>
 #include <cmath>
-#include <stdexcept>
 
 extern "C" {
 #include <libavutil/frame.h>
 }
+
+#include "platform/Misuse.h"
 
 namespace quorvel {
 namespace {
@@ -111,7 +112,7 @@ void RCWaveformBuilder::append(const std::uint8_t* const* data, AVSampleFormat f
     QV_WAVEFORM_FORMAT(AV_SAMPLE_FMT_DBLP, double, true)
 #undef QV_WAVEFORM_FORMAT
     default:
-      throw std::invalid_argument("RCWaveformBuilder: unsupported sample format");
+      QV_MISUSE(true, "RCWaveformBuilder: unsupported sample format {}", int(format));
   }
 }
 

@@ -8,7 +8,8 @@
 #include <cstring>
 #include <vector>
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCReplacementFile.h"
 
 namespace quorvel {
@@ -31,7 +32,7 @@ std::uint32_t getU32(const std::uint8_t* p) {
 }
 
 platform::Error corrupt(std::string what) {
-  return RCMediaError(RCMediaErrorCode::CorruptWaveform, "invalid waveform file: " + what);
+  return RCMediaError(RCMediaErrorCodeCorruptWaveform, "invalid waveform file: " + what);
 }
 
 }  // namespace
@@ -103,32 +104,19 @@ platform::Result<RCWaveform> RCDecodeWaveformFile(std::span<const std::uint8_t> 
 }
 
 platform::Result<RCWaveform> RCReadWaveformFile(const platform::URL& url) {
-  const int fd = ::open(url.path().c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return platform::fail(platform::posixError(errno, "cannot open " + url.path()));
+  RCScopedFd fd(::open(url.path().c_str(), O_RDONLY | O_CLOEXEC));
+  if (!fd) return platform::fail(platform::posixError(errno, "cannot open " + url.path()));
   struct stat info {};
-  if (::fstat(fd, &info) != 0 || !S_ISREG(info.st_mode)) {
-    ::close(fd);
+  if (::fstat(fd.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
     return platform::fail(corrupt(url.lastPathComponent() + " is not a regular file"));
   }
   if (std::uint64_t(info.st_size) > kMaxFileSize) {
-    ::close(fd);
     return platform::fail(corrupt(fmt::format("{} bytes is too large", info.st_size)));
   }
   std::vector<std::uint8_t> bytes(std::size_t(info.st_size));
-  std::size_t done = 0;
-  while (done < bytes.size()) {
-    const ssize_t got = ::read(fd, bytes.data() + done, bytes.size() - done);
-    if (got < 0 && errno == EINTR) continue;
-    if (got < 0) {
-      const int err = errno;
-      ::close(fd);
-      return platform::fail(platform::posixError(err, "cannot read " + url.path()));
-    }
-    if (got == 0) break;  // shrank while reading: parsed as what is there
-    done += std::size_t(got);
-  }
-  ::close(fd);
-  bytes.resize(done);
+  auto done = RCReadFully(fd.get(), bytes.data(), bytes.size(), url.path());
+  if (!done) return platform::fail(done.error());
+  bytes.resize(*done);  // shrank while reading: parsed as what is there
   return RCDecodeWaveformFile(bytes);
 }
 

@@ -2,7 +2,7 @@
 
 #include <fmt/format.h>
 
-#include <stdexcept>
+#include "platform/Misuse.h"
 
 namespace platform {
 namespace {
@@ -10,7 +10,8 @@ namespace {
 constexpr int kMaxStructDepth = 32;
 
 [[noreturn]] void wrongKind(const char* wanted, const BusValue& value) {
-  throw std::logic_error(
+  ::platform::detail::misuse(
+      __FILE__, __LINE__,
       fmt::format("BusValue: asked for {} of a value of signature {}", wanted, value.signature()));
 }
 
@@ -52,7 +53,7 @@ bool parseCompleteType(std::string_view signature, std::size_t& pos, int depth) 
 }  // namespace
 
 BusValue BusValue::structure(std::vector<BusValue> fields) {
-  if (fields.empty()) throw std::logic_error("BusValue: a struct needs at least one field");
+  QV_MISUSE(fields.empty(), "BusValue: a struct needs at least one field");
   return BusValue(StructFields{std::move(fields)});
 }
 

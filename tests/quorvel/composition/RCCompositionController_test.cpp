@@ -10,7 +10,7 @@
 
 #include "Quorvel/composition/RCCompositionController.h"
 #include "Quorvel/composition/RCCompositionEditor.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCAudioAsset.h"
 #include "Quorvel/media/RCMP4Atoms.h"
 #include "Quorvel/waveform/RCWaveform.h"

@@ -5,7 +5,7 @@
 
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionManifest.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
 
 namespace quorvel {

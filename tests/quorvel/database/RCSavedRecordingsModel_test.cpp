@@ -12,7 +12,7 @@
 #include <thread>
 
 #include "Quorvel/database/RCSavedRecordingsModel.h"
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "platform/SerialQueue.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
 

@@ -4,7 +4,7 @@
 
 #include <fstream>
 
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCDurableFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "tests/support/RecordingsDirectoryFixture.h"

@@ -18,7 +18,7 @@ extern "C" {
 #include <libavformat/avformat.h>
 }
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "Quorvel/waveform/RCWaveformFile.h"

@@ -14,6 +14,7 @@ extern "C" {
 #include <fstream>
 #include <map>
 
+#include "Quorvel/files/RCFile.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/TempDirectory.h"
@@ -95,7 +96,7 @@ TEST_F(RCMP4AtomsTest, LanguagesSideBySideInBothLayoutsKeepTheAudio) {
     const std::string bytes = readFile(file);
     EXPECT_EQ(atomPosition(bytes, "moov") < atomPosition(bytes, "mdat"), moovFirst);
     for (const auto& entry : fs::directory_iterator(dir_)) {
-      EXPECT_EQ(entry.path().filename().string().find(".title-"), std::string::npos)
+      EXPECT_FALSE(RCIsAtomicReplaceTempName(entry.path().filename().string()))
           << "temporary file left behind";
     }
   }

@@ -2,7 +2,7 @@
 // tokens through their (siss) tuple.
 #include <gtest/gtest.h>
 
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 

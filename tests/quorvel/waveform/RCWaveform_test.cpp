@@ -14,7 +14,7 @@
 #include <thread>
 #include <vector>
 
-#include "Quorvel/errors/RCMediaError.h"
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
@@ -129,7 +129,7 @@ TEST(RCWaveformFileTest, RejectsDamagedHeadersAndSizesWithoutAllocating) {
     auto parsed = RCDecodeWaveformFile(c.bytes);
     ASSERT_FALSE(parsed);
     EXPECT_EQ(parsed.error().domain(), kRCMediaErrorDomain);
-    EXPECT_EQ(parsed.error().code(), long(RCMediaErrorCode::CorruptWaveform));
+    EXPECT_EQ(parsed.error().code(), long(RCMediaErrorCodeCorruptWaveform));
   }
 }
 

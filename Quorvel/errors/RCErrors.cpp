@@ -1,4 +1,8 @@
-#include "Quorvel/errors/RCError.h"
+#include "Quorvel/errors/RCErrors.h"
+
+extern "C" {
+#include <libavutil/error.h>
+}
 
 namespace quorvel {
 
@@ -16,6 +20,16 @@ platform::Error RCGenericError() {
 
 platform::Error RCGenericErrorWithUnderlyingError(const platform::Error& underlying) {
   return platform::Error(RCErrorDomain, RCErrorCodeGeneric, kGenericDescription, underlying);
+}
+
+platform::Error RCMediaError(RCMediaErrorCode code, std::string description) {
+  return platform::Error(kRCMediaErrorDomain, code, std::move(description));
+}
+
+platform::Error RCMediaErrorFromAV(RCMediaErrorCode code, int averror, std::string_view what) {
+  char text[AV_ERROR_MAX_STRING_SIZE] = {};
+  av_strerror(averror, text, sizeof text);
+  return RCMediaError(code, fmt::format("{}: {}", what, text));
 }
 
 }  // namespace quorvel
