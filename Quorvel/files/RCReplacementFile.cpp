@@ -62,7 +62,7 @@ RCReplacementFile& RCReplacementFile::operator=(RCReplacementFile&& other) noexc
 RCReplacementFile::~RCReplacementFile() { discard(); }
 
 platform::Result<RCReplacementFile> RCReplacementFile::create(const platform::URL& destination) {
-  const std::string destinationPath = destination.path();
+  const std::string& destinationPath = destination.path();
   const std::string directory = directoryOf(destinationPath);
   const std::string name = destination.lastPathComponent();
   for (int attempt = 0; attempt < 16; ++attempt) {

@@ -20,7 +20,7 @@ double RCWaveform::durationSeconds() const {
 }
 
 void RCWaveform::appendPixel(std::span<const std::int16_t> minMax) {
-  if (minMax.size() != std::size_t(2 * channels_))
+  if (minMax.size() != 2 * std::size_t(channels_))
     throw std::invalid_argument("RCWaveform::appendPixel: wrong number of values");
   data_.insert(data_.end(), minMax.begin(), minMax.end());
 }
