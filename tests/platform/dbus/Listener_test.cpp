@@ -223,8 +223,9 @@ TYPED_TEST(ListenerTest, RejectsAnInvalidInterface) {
 
 TEST(ConnectionTest, UserInfoKeepsItsDictionaryOnceCreated) {
   auto connection = Connection::createForListener(":1.7");
-  EXPECT_FALSE(connection->isValid());         // never through a listener
-  connection->setUserInfo("key", std::any());  // removal without a dictionary
+  EXPECT_FALSE(connection->isValid());                        // never through a listener
+  EXPECT_EQ(connection->description(), "<connection :1.7>");  // as the logs show it
+  connection->setUserInfo("key", std::any());                 // removal without a dictionary
   EXPECT_FALSE(connection->hasUserInfoDictionary());
   connection->setUserInfo("key", std::any(42));
   EXPECT_EQ(std::any_cast<int>(connection->userInfo("key")), 42);
