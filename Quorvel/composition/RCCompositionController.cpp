@@ -71,10 +71,7 @@ RCCompositionManifest repairedManifest(const RCComposition& composition) {
     double duration = fileDuration(url);
     if (std::isfinite(duration)) {
       double available = std::max(0.0, duration - entry.contentStart);
-      if (!entry.contentDuration) {
-        entry.contentDuration = available;
-        entry.composed = false;
-      } else if (*entry.contentDuration > available + kDurationTolerance) {
+      if (!entry.contentDuration || *entry.contentDuration > available + kDurationTolerance) {
         entry.contentDuration = available;
         entry.composed = false;
       }

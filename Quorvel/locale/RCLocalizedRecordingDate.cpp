@@ -33,7 +33,7 @@ bool hasDateFormats(const icu::Locale& locale) {
   const icu::Locale actual = format->getLocale(ULOC_ACTUAL_LOCALE, status);
   if (U_FAILURE(status)) return false;
   return std::string_view(actual.getLanguage()) == locale.getLanguage() &&
-         std::string_view(locale.getLanguage()) != "";
+         !std::string_view(locale.getLanguage()).empty();
 }
 
 }  // namespace

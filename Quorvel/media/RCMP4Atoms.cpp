@@ -53,7 +53,7 @@ void storeBE64(std::uint8_t* p, std::uint64_t v) {
   storeBE32(p + 4, std::uint32_t(v));
 }
 
-const std::string kTitleType = "\xA9nam";
+constexpr std::string_view kTitleType = "\xA9nam";
 
 // One child atom inside a parent's payload; offsets are into the whole buffer.
 struct Child {

@@ -50,7 +50,7 @@ std::vector<RCMetadataItem> RCMetadataItemsWithLocale(const std::vector<RCMetada
 }
 
 std::string RCISO639TerminologyCode(std::string_view language) {
-  const std::string canonical = canonicalLanguage(language);
+  std::string canonical = canonicalLanguage(language);
   if (canonical.empty()) return {};
   if (canonical.size() == 3) return canonical;
   icu::Locale locale(canonical.c_str());

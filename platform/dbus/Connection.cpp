@@ -76,12 +76,28 @@ void Connection::setInterruptionHandler(Handler handler) {
 }
 
 void Connection::resume() {
-  std::lock_guard lock(deliveryMutex_);
-  if (resumed_.exchange(true)) return;
-  while (!pending_->calls.empty()) {
-    auto [call, handler] = std::move(pending_->calls.front());
-    pending_->calls.pop_front();
-    deliver(std::move(call), handler);
+  // The queued calls are delivered one at a time without holding
+  // deliveryMutex_: a handler that answers at once takes the bus library's
+  // lock, which the delivery thread holds while it waits for deliveryMutex_
+  // to hand over the next call. Calls that arrive meanwhile join the queue
+  // (draining_), so they still come in order and one at a time.
+  {
+    std::lock_guard lock(deliveryMutex_);
+    if (resumed_.exchange(true)) return;
+    draining_ = true;
+  }
+  for (;;) {
+    std::pair<IncomingCall, MethodHandler> next;
+    {
+      std::lock_guard lock(deliveryMutex_);
+      if (pending_->calls.empty()) {
+        draining_ = false;
+        return;
+      }
+      next = std::move(pending_->calls.front());
+      pending_->calls.pop_front();
+    }
+    deliver(std::move(next.first), next.second);
   }
 }
 
@@ -94,7 +110,7 @@ std::shared_ptr<Connection> Connection::current() {
 void Connection::deliverOrQueue(IncomingCall call, MethodHandler handler) {
   std::lock_guard lock(deliveryMutex_);
   if (hasEnded()) return;  // the call answers its caller as dropped
-  if (!resumed_) {
+  if (!resumed_ || draining_) {
     pending_->calls.emplace_back(std::move(call), std::move(handler));
     return;
   }

@@ -112,6 +112,7 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // Held while delivering; recursive so that a handler may call resume().
   std::recursive_mutex deliveryMutex_;
   std::atomic<bool> resumed_{false};  // changed under deliveryMutex_
+  bool draining_ = false;             // resume() is delivering the queue; guarded by deliveryMutex_
   std::unique_ptr<Pending> pending_;  // guarded by deliveryMutex_
 };
 

@@ -56,17 +56,6 @@ TEST(NotificationCenterTest, ObserversMayChangeTheListAndPostDuringAPost) {
   center.removeObserver(999999);
 }
 
-TEST(NotificationCenterTest, TheDefaultCenterIsOneObject) {
-  EXPECT_EQ(&NotificationCenter::defaultCenter(), &NotificationCenter::defaultCenter());
-  int got = 0;
-  auto token = NotificationCenter::defaultCenter().addObserver("org.quorvel.test.default",
-                                                               [&](const Notification&) { ++got; });
-  NotificationCenter::defaultCenter().postNotificationName("org.quorvel.test.default");
-  NotificationCenter::defaultCenter().removeObserver(token);
-  NotificationCenter::defaultCenter().postNotificationName("org.quorvel.test.default");
-  EXPECT_EQ(got, 1);
-}
-
 TEST(NotificationCenterStressTest, ConcurrentPostsAddsAndRemoves) {
   NotificationCenter center;
   std::atomic<int> steady{0};

@@ -3,7 +3,6 @@
 // stress over dependency graphs.
 #include "platform/OperationQueue.h"
 
-#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -79,19 +78,6 @@ TEST(OperationTest, RunsMainOnceThenTheCompletionBlockOnceAfterFinishing) {
   EXPECT_TRUE(operation->isFinished());
   EXPECT_FALSE(operation->isReady());
   EXPECT_EQ(queue.operationCount(), 0u);
-}
-
-namespace fixture {
-class FinishRecording : public Operation {};
-}  // namespace fixture
-
-TEST(OperationTest, DescriptionNamesTheDynamicClassAndAddress) {
-  auto operation = std::make_shared<fixture::FinishRecording>();
-  const std::string text = operation->description();
-  EXPECT_EQ(text.rfind("<FinishRecording: 0x", 0), 0u) << text;
-  EXPECT_NE(text.find(fmt::format("{}", static_cast<const void*>(operation.get()))),
-            std::string::npos);
-  EXPECT_EQ(text.back(), '>');
 }
 
 TEST(OperationTest, DependenciesInEveryPlacementFinishFirst) {

@@ -73,6 +73,7 @@ std::optional<platform::URL> parseURL(const std::string& text) {
 // Runs `command` and returns its exit status (128 + signal when killed).
 int runCommand(const std::vector<std::string>& command) {
   std::vector<char*> argv;
+  argv.reserve(command.size() + 1);
   for (const auto& arg : command) argv.push_back(const_cast<char*>(arg.c_str()));
   argv.push_back(nullptr);
   pid_t child = fork();

@@ -4,7 +4,6 @@
 
 #include <map>
 
-#include "Quorvel/composition/RCCaptureFormat.h"
 #include "Quorvel/locale/RCLocalizedRecordingDate.h"
 #include "Quorvel/locale/RCPreferredLanguages.h"
 #include "Quorvel/media/RCMetadataItem.h"
@@ -78,14 +77,6 @@ TEST(RCLocalizedRecordingDateTest, UsesTheFirstLanguageICUReallySupports) {
   const std::string berlin = RCLocalizedRecordingDateWithOptions(date, 3, {"de"}, "Europe/Berlin");
   EXPECT_NE(berlin.find("15:07"), std::string::npos) << berlin;
   EXPECT_EQ(RCLocalizedRecordingDateWithOptions(date, 0, {"de"}, "UTC"), german);
-}
-
-TEST(RCCaptureFormatTest, ExtensionsAreExactAndCaseSensitive) {
-  EXPECT_EQ(RCCaptureFormat::fileExtensionsSupported(), (Languages{"m4a", "flac", "wav"}));
-  EXPECT_TRUE(RCCaptureFormat::isFileExtensionSupported("flac"));
-  EXPECT_FALSE(RCCaptureFormat::isFileExtensionSupported("M4A"));
-  EXPECT_FALSE(RCCaptureFormat::isFileExtensionSupported("mp3"));
-  EXPECT_EQ(RCCaptureFormat::defaultFileExtension(), "m4a");
 }
 
 }  // namespace
