@@ -63,13 +63,4 @@ void SavedRecordingService::_performOnServiceQueue(WorkBlock block) {
   });
 }
 
-void SavedRecordingService::_handleXPCDisconnect(
-    const std::shared_ptr<platform::Connection>& connection) {
-  _performOnServiceQueue([connection] {
-    rcs_setValid(*connection, false);
-    // Sessions and fragment-cleanup holds of the connection are released
-    // here once the daemon keeps them.
-  });
-}
-
 }  // namespace quorvel

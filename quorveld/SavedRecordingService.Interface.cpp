@@ -1,11 +1,7 @@
 // The ten requests of the service interface, as they arrive on the
-// delivery thread: the arrival line, the required-parameter checks, and the
-// hand-over to the service serial queue.
-//
-// The work behind most requests (sessions, finalization, fragment cleanup,
-// the orphan-handling switches) is not part of this daemon yet: after their checks, requests answer
-// the bus's NotSupported error naming themselves, and requests that expect no reply are logged and
-// dropped.
+// delivery thread: the arrival line, the required-parameter checks, taking
+// note of the calling connection (known only during delivery), and the
+// hand-over to the service serial queue, where all of their work is done.
 #include <fmt/format.h>
 
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
@@ -15,22 +11,6 @@
 #include "quorveld/SavedRecordingService.h"
 
 namespace quorvel {
-
-namespace {
-
-constexpr const char* kBusErrorNotSupported = "org.freedesktop.DBus.Error.NotSupported";
-
-platform::Error notSupported(const char* selector) {
-  return platform::Error(kBusErrorNotSupported, 0,
-                         fmt::format("-{} is not supported by this daemon yet", selector));
-}
-
-void logNotSupported(const char* selector) {
-  QV_LOG(platform::kLogLevelNotice, "-{} is not supported by this daemon yet; request dropped",
-         selector);
-}
-
-}  // namespace
 
 void SavedRecordingService::_logMissingParameter(const char* parameter, const char* selector) {
   auto connection = rcs_currentConnection();
@@ -59,19 +39,35 @@ bool SavedRecordingService::_checkPrepareRequest(const char* selector, const cha
   return true;
 }
 
+void SavedRecordingService::_prepareAccessSession(const char* selector, const char* kind,
+                                                  const char* sessionName, bool exclusive,
+                                                  std::optional<platform::URL> compositionAVURL,
+                                                  AccessRequestHandler accessRequestHandler) {
+  if (!_checkPrepareRequest(selector, kind, compositionAVURL, accessRequestHandler)) return;
+  _performOnServiceQueue([this, self = shared_from_this(), sessionName, exclusive,
+                          url = std::move(*compositionAVURL), connection = rcs_currentConnection(),
+                          reply = std::move(accessRequestHandler)]() mutable {
+    _onServiceQueueOpenAccessSessionNamed(
+        sessionName, url, exclusive, std::move(connection),
+        [reply = std::move(reply)](std::shared_ptr<AssetAccessSession> session,
+                                   std::optional<platform::Error> error) mutable {
+          reply(session ? std::optional(session->accessToken()) : std::nullopt, std::move(error));
+        });
+  });
+}
+
 void SavedRecordingService::prepareToCaptureToCompositionAVURL(
     std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler) {
-  static constexpr const char* kSelector =
-      "prepareToCaptureToCompositionAVURL:accessRequestHandler:";
-  if (!_checkPrepareRequest(kSelector, "capture", compositionAVURL, accessRequestHandler)) return;
-  accessRequestHandler(std::nullopt, notSupported(kSelector));
+  _prepareAccessSession("prepareToCaptureToCompositionAVURL:accessRequestHandler:", "capture",
+                        "capture", true, std::move(compositionAVURL),
+                        std::move(accessRequestHandler));
 }
 
 void SavedRecordingService::prepareToPreviewCompositionAVURL(
     std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler) {
-  static constexpr const char* kSelector = "prepareToPreviewCompositionAVURL:accessRequestHandler:";
-  if (!_checkPrepareRequest(kSelector, "preview", compositionAVURL, accessRequestHandler)) return;
-  accessRequestHandler(std::nullopt, notSupported(kSelector));
+  _prepareAccessSession("prepareToPreviewCompositionAVURL:accessRequestHandler:", "preview",
+                        "preview", false, std::move(compositionAVURL),
+                        std::move(accessRequestHandler));
 }
 
 void SavedRecordingService::prepareToExportCompositionAVURL(
@@ -80,53 +76,45 @@ void SavedRecordingService::prepareToExportCompositionAVURL(
   static constexpr const char* kSelector =
       "prepareToExportCompositionAVURL:cacheWaveform:accessRequestHandler:";
   if (!_checkPrepareRequest(kSelector, "export", compositionAVURL, accessRequestHandler)) return;
-  accessRequestHandler(std::nullopt, notSupported(kSelector));
+  // An export is granted only once its recording is finalized, which this
+  // daemon cannot do yet.
+  accessRequestHandler(
+      std::nullopt,
+      platform::Error("org.freedesktop.DBus.Error.NotSupported", 0,
+                      fmt::format("-{} is not supported by this daemon yet", kSelector)));
 }
 
 void SavedRecordingService::prepareToTrimCompositionAVURL(
     std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler) {
-  static constexpr const char* kSelector = "prepareToTrimCompositionAVURL:accessRequestHandler:";
-  if (!_checkPrepareRequest(kSelector, "trimming", compositionAVURL, accessRequestHandler)) return;
-  accessRequestHandler(std::nullopt, notSupported(kSelector));
+  _prepareAccessSession("prepareToTrimCompositionAVURL:accessRequestHandler:", "trimming",
+                        "trimming", true, std::move(compositionAVURL),
+                        std::move(accessRequestHandler));
 }
 
 void SavedRecordingService::endAccessSessionWithToken(
     std::optional<RCSSavedRecordingAccessToken> accessToken) {
-  static constexpr const char* kSelector = "endAccessSessionWithToken:";
   QV_LOG(platform::kLogLevelDebug, "Ending access session: {}.",
          accessToken ? accessToken->debugDescription() : std::string("(null)"));
   if (!accessToken) {
-    _logMissingParameter("accessToken", kSelector);
+    _logMissingParameter("accessToken", "endAccessSessionWithToken:");
     return;
   }
-  logNotSupported(kSelector);
+  // Any holder of an equal token ends the session: tokens are capabilities.
+  _performOnServiceQueue([this, self = shared_from_this(), token = std::move(*accessToken)] {
+    _onQueueCloseAccessSession(_assetSesionController->activeSessionWithAccessToken(token), true);
+  });
 }
 
 void SavedRecordingService::disableOrphanedFragmentCleanupForCompositionAVURL(
-    std::optional<platform::URL> /*compositionAVURL*/, CompletionHandler completionBlock) {
-  static constexpr const char* kSelector =
-      "disableOrphanedFragmentCleanupForCompositionAVURL:completionBlock:";
-  if (!completionBlock) return logNotSupported(kSelector);
-  completionBlock(notSupported(kSelector));
+    std::optional<platform::URL> compositionAVURL, CompletionHandler completionBlock) {
+  _addDisabledOrphanCleanupForCompositionAVURL(std::move(compositionAVURL), rcs_currentConnection(),
+                                               std::move(completionBlock));
 }
 
 void SavedRecordingService::enableOrphanedFragmentCleanupForCompositionAVURL(
-    std::optional<platform::URL> /*compositionAVURL*/) {
-  logNotSupported("enableOrphanedFragmentCleanupForCompositionAVURL:");
-}
-
-void SavedRecordingService::disableOrphanHandlingWithCompletionBlock(
-    CompletionHandler completionBlock) {
-  static constexpr const char* kSelector = "disableOrphanHandlingWithCompletionBlock:";
-  if (!completionBlock) return logNotSupported(kSelector);
-  completionBlock(notSupported(kSelector));
-}
-
-void SavedRecordingService::enableOrphanHandlingWithCompletionBlock(
-    CompletionHandler completionBlock) {
-  static constexpr const char* kSelector = "enableOrphanHandlingWithCompletionBlock:";
-  if (!completionBlock) return logNotSupported(kSelector);
-  completionBlock(notSupported(kSelector));
+    std::optional<platform::URL> compositionAVURL) {
+  _removeDisabledOrphanCleanupForCompositionAVURL(std::move(compositionAVURL),
+                                                  rcs_currentConnection());
 }
 
 void SavedRecordingService::fetchExportingCompositionAVURLs(URLSetHandler reply) {

@@ -9,6 +9,10 @@
 //                                          delivery, _performOnServiceQueue
 //   SavedRecordingService.Interface.cpp    the ten requests' entry checks
 //   SavedRecordingService.Invocation.cpp   turning bus calls into requests
+//   SavedRecordingService.Sessions.cpp     access requests, deferral, the
+//                                          close procedure, disconnection
+//   SavedRecordingService.OrphanHandling.cpp  fragment cleanup and its holds,
+//                                          the orphan-handling switch
 //
 // Threads: the request methods and the listener-delegate methods run on the
 // listener's delivery thread (the bus thread); they only check arguments and
@@ -52,6 +56,16 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   using CompletionHandler = std::move_only_function<void(std::optional<platform::Error>)>;
   using URLSetHandler = std::move_only_function<void(std::set<platform::URL>)>;
   using WorkBlock = std::move_only_function<void()>;
+  using AccessSessionHandler = std::move_only_function<void(std::shared_ptr<AssetAccessSession>,
+                                                            std::optional<platform::Error>)>;
+  // A recording's one waiting access request: called with true when a newer
+  // request superseded it, with false to re-issue it. `connection` is the
+  // client it answers (none for the daemon's own requests), so a client that
+  // goes away takes its waiting request with it.
+  struct DeferredAccessRequest {
+    std::shared_ptr<platform::Connection> connection;
+    std::move_only_function<void(bool cancelled)> run;
+  };
   // Makes the listener on the service name for start(): a BusListener in
   // quorveld, a LocalListener in tests.
   using ListenerFactory = std::function<std::shared_ptr<platform::Listener>(
@@ -122,8 +136,67 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // The connection has ended: on the service serial queue, mark it invalid
   // and release what the daemon held for it. Returns at once. Any thread.
   void _handleXPCDisconnect(const std::shared_ptr<platform::Connection>& connection);
-  // One orphan-handling pass. Must be called on the service serial queue.
+  // One orphan-handling pass, or the line saying it is switched off. Must be
+  // called on the service serial queue.
   void _onQueuePerformOrphanHandlingIfEnabled();
+
+  // Access sessions. Every member below must be called on the service
+  // serial queue.
+  //
+  // The open step: asks the registry for a session; a granted one first has
+  // its recording's orphaned fragments cleaned, then reaches `handler`. A
+  // refusal answers error 301 at once, unless some session (of any
+  // recording) is closing: then the request waits as the recording's
+  // deferred access request, superseding (error 302) any earlier one. A
+  // connection already marked invalid is never granted anything; its
+  // handler is dropped unanswered.
+  void _onServiceQueueOpenAccessSessionNamed(const std::string& name,
+                                             const platform::URL& compositionAVURL, bool exclusive,
+                                             std::shared_ptr<platform::Connection> xpcConnection,
+                                             AccessSessionHandler accessSessionHandler);
+  // Whether the recording has an open exclusive session / any open session
+  // other than `ignoredAccessSession` (closing sessions count).
+  bool _onServiceQueueHasActiveExclusiveSessionForCompositionAVURL(
+      const platform::URL& compositionAVURL,
+      const std::shared_ptr<AssetAccessSession>& ignoredAccessSession);
+  bool _onServiceQueueHasActiveSessionsForCompositionAVURL(
+      const platform::URL& compositionAVURL,
+      const std::shared_ptr<AssetAccessSession>& ignoredAccessSession);
+  // The close procedure: marks the session closing, cleans its recording's
+  // orphaned fragments, then removes it from the registry and starts the
+  // recording's deferred work. A null session does nothing.
+  void _onQueueCloseAccessSession(const std::shared_ptr<AssetAccessSession>& session,
+                                  bool normalTermination);
+  void _onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(
+      const std::shared_ptr<AssetAccessSession>& session);
+  // The recordings the orphan recovery run must leave alone: held off by a
+  // client, waiting behind a deferred request or finalization, or with an
+  // open session. May name a recording more than once.
+  std::vector<platform::URL> _onQueue_composedAVURLsWithActiveSessionsOrScheduledWork();
+
+  // Fragment cleanup and its holds. Any thread: each hands its work to the
+  // service serial queue. The cleanup's completion, when given, runs there
+  // exactly once.
+  void _attemptOrphanedFragmentsCleanupForCompositionAVURL(
+      const platform::URL& compositionAVURL,
+      std::shared_ptr<AssetAccessSession> ignoredAccessSession, WorkBlock completionBlock);
+  void _addDisabledOrphanCleanupForCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL,
+      std::shared_ptr<platform::Connection> xpcConnection, CompletionHandler completionBlock);
+  void _removeDisabledOrphanCleanupForCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL,
+      std::shared_ptr<platform::Connection> xpcConnection);
+  void _removeDisabledOrphanCleanupAVURLsForConnection(
+      const std::shared_ptr<platform::Connection>& xpcConnection);
+
+  // Tests: the service's waiting state. Must be called on the service
+  // serial queue.
+  std::size_t closingSessionCountForTesting() const { return _closingSessions.size(); }
+  std::size_t deferredAccessRequestCountForTesting() const {
+    return _compositionAVURLsDeferredAccessRequestBlocksByAVURL.size();
+  }
+  // How many connections hold the recording's fragment cleanup off.
+  std::size_t orphanedFragmentCleanupHoldCount(const platform::URL& url) const;
 
   // The debug signal: dump the open sessions on the main queue.
   void _handleDebugSignal();
@@ -150,22 +223,44 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // when the request may go on; otherwise it was answered or dropped.
   bool _checkPrepareRequest(const char* selector, const char* kind,
                             const std::optional<platform::URL>& url, AccessRequestHandler& handler);
+  // The capture, preview and trimming requests: entry checks here, the open
+  // step on the service serial queue with the calling connection.
+  void _prepareAccessSession(const char* selector, const char* kind, const char* sessionName,
+                             bool exclusive, std::optional<platform::URL> compositionAVURL,
+                             AccessRequestHandler accessRequestHandler);
   // The service interface with each method routed to
   // connectionHandleInvocation().
   platform::InterfaceDescription _exportedInterface();
 
+  void _onServiceQueueRunDeferredAccessRequest(const std::string& name,
+                                               const platform::URL& compositionAVURL,
+                                               bool exclusive,
+                                               std::shared_ptr<platform::Connection> xpcConnection,
+                                               AccessSessionHandler accessSessionHandler,
+                                               bool cancelled);
+  void _onQueueFinishClosingAccessSession(const std::shared_ptr<AssetAccessSession>& session);
+  void _onQueueCleanUpOrphanedFragments(const platform::URL& compositionAVURL,
+                                        const std::shared_ptr<AssetAccessSession>& ignored);
+
   // In declaration order, as the service's state is documented.
+  // Made by the constructor, then only used:
   platform::SerialQueue _serialQueue;
   platform::SerialQueue _serviceSerialQueue;
+  // Service serial queue only:
   bool _isOrphanHandlingEnabled = true;
+  // Main thread (start, teardown):
   std::shared_ptr<platform::Listener> _xpcListener;
+  // Service serial queue only:
+  std::vector<std::shared_ptr<AssetAccessSession>> _closingSessions;
   std::vector<platform::URL> _compositionAVURLsToFinalize;
-  std::unordered_map<platform::URL, std::move_only_function<void(bool cancelled)>>
+  std::unordered_map<platform::URL, DeferredAccessRequest>
       _compositionAVURLsDeferredAccessRequestBlocksByAVURL;
-  // Counted set: recording -> number of holds.
+  // Counted set: recording -> number of connections holding its cleanup off.
   std::unordered_map<platform::URL, std::size_t> _disabledOrphanedFragmentCleanupByCompositionAVURL;
+  // Made by _init; its open and close on the service serial queue only:
   std::unique_ptr<AssetAccessSessionController> _assetSesionController;
   std::unique_ptr<platform::SignalSource> _signalDispatchSource;
+  // Inside _serialQueue only:
   std::unordered_set<platform::URL> _compositionAVURLsBeingExported;
 
   ListenerFactory _listenerFactory;

@@ -87,15 +87,69 @@ TEST_F(DaemonTest, ClientLibraryGetsAnswersAndErrorsAsValues) {
   ASSERT_TRUE(exporting) << exporting.error();
   EXPECT_TRUE(exporting->empty());
 
+  // Two previews share the recording; a capture beside them is refused.
   auto url = platform::URL::fileURLWithPath(recordings_.string() + "/Walk in the park.m4a");
-  auto token = (*client)->prepareToCapture(url);
-  ASSERT_FALSE(token);
-  EXPECT_EQ(token.error().domain(), "org.freedesktop.DBus.Error.NotSupported");
-  EXPECT_NE(token.error().localizedDescription().find("prepareToCaptureToCompositionAVURL:"),
-            std::string::npos);
+  auto first = (*client)->prepareToPreview(url);
+  auto second = (*client)->prepareToPreview(url);
+  ASSERT_TRUE(first && second) << daemon->output();
+  EXPECT_EQ(first->accessType(), 1);
+  EXPECT_FALSE(*first == *second);
+  auto capture = (*client)->prepareToCapture(url);
+  ASSERT_FALSE(capture);
+  EXPECT_EQ(capture.error().domain(), "org.quorvel.SavedRecordingService.ErrorDomain");
+  EXPECT_EQ(capture.error().code(), 301);
   EXPECT_TRUE(daemon->waitForLine(
       "[SavedRecordingService] Received request to prepare 'Walk in the park.m4a' for capture..."));
-  EXPECT_TRUE(daemon->waitForLine("Listener accepted new connection <connection :1."));
+
+  // Once both are handed back (one through another connection: tokens are
+  // capabilities), the capture is granted.
+  (*client)->endAccessSessionWithToken(*first);
+  auto other = SavedRecordingServiceClient::connect(bus_.address());
+  ASSERT_TRUE(other);
+  (*other)->endAccessSessionWithToken(*second);
+  EXPECT_TRUE(daemon->waitForLine("Finally closing access session"));
+  ASSERT_TRUE((*other)->fetchExportingCompositionAVURLs());  // both ends are through
+  EXPECT_EQ(daemon->linesContaining("Finally closing access session").size(), 2u)
+      << daemon->output();
+  auto granted = (*client)->prepareToCapture(url);
+  ASSERT_TRUE(granted) << granted.error();
+  EXPECT_EQ(granted->accessType(), 2);
+}
+
+TEST_F(DaemonTest, AKilledClientsSessionsCloseAndTheRecordingIsFreed) {
+  auto daemon = startDaemon();
+  std::string recording = recordings_.string() + "/Held.m4a";
+  // quorvelctl holds a capture session while its command runs; the command
+  // says its pid so the test can end it once quorvelctl is gone.
+  DaemonProcess holder(DaemonProcess::programPath("quorvelctl"),
+                       {"--bus-address", bus_.address(), "capture", recording, "--", "sh", "-c",
+                        "echo held $$ >&2; exec sleep 600"});
+  ASSERT_TRUE(holder.waitForLine("held ")) << holder.output() << daemon->output();
+  pid_t command = std::stoi(holder.linesContaining("held ").at(0).substr(5));
+
+  auto refused = quorvelctl({"trim", recording});
+  EXPECT_EQ(refused.status, 1);
+  EXPECT_NE(refused.output.find("quorvelctl: org.quorvel.SavedRecordingService.Error."
+                                "ConflictingSession (301): Error Domain="),
+            std::string::npos)
+      << refused.output;
+
+  holder.sendSignal(SIGKILL);
+  ::kill(command, SIGKILL);
+  EXPECT_EQ(holder.waitForExit(), -SIGKILL);
+  EXPECT_TRUE(daemon->waitForLine("Terminating access session")) << daemon->output();
+  EXPECT_TRUE(daemon->waitForLine("for terminated connection: <connection :1."));
+  EXPECT_TRUE(daemon->waitForLine("Closing access session"));
+
+  // The recording is free again; quorvelctl holds a trim while `true` runs
+  // and hands it back whatever the outcome.
+  auto trimmed = quorvelctl({"trim", recording, "--", "true"});
+  EXPECT_EQ(trimmed.status, 0) << trimmed.output << daemon->output();
+  auto failed = quorvelctl({"capture", recording, "--", "false"});
+  EXPECT_EQ(failed.status, 1) << failed.output;
+  EXPECT_EQ(quorvelctl({"capture", recording, "--", "true"}).status, 0) << daemon->output();
+  daemon->sendSignal(SIGUSR1);
+  EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
 }
 
 TEST_F(DaemonTest, ForeignClientsGetTheContractsErrors) {
@@ -147,11 +201,9 @@ TEST_F(DaemonTest, QuorvelctlReportsResultsAndErrorsByExitStatus) {
   EXPECT_EQ(quorvelctl({"fetch-exporting", "--json"}).output, fetched.output);
 
   auto captured = quorvelctl({"capture", recordings_.string() + "/x.m4a"});
-  EXPECT_EQ(captured.status, 1);
-  EXPECT_NE(
-      captured.output.find("quorvelctl: Error Domain=org.freedesktop.DBus.Error.NotSupported"),
-      std::string::npos)
-      << captured.output;
+  EXPECT_EQ(captured.status, 0) << captured.output;
+  EXPECT_EQ(captured.output.rfind("capture 2 file://", 0), 0u) << captured.output;
+  // quorvelctl's connection ends with it, and so does that session.
 
   auto usage = quorvelctl({"end", "capture", "two", "file:///x.m4a", "nope"});
   EXPECT_EQ(usage.status, 2) << usage.output;

@@ -43,8 +43,11 @@ std::string DaemonProcess::programPath(const std::string& name) {
   return std::string(QUORVEL_BINARY_DIR) + "/bin/" + name;
 }
 
-DaemonProcess::DaemonProcess(std::vector<std::string> arguments) {
-  arguments.insert(arguments.begin(), programPath("quorveld"));
+DaemonProcess::DaemonProcess(std::vector<std::string> arguments)
+    : DaemonProcess(programPath("quorveld"), std::move(arguments)) {}
+
+DaemonProcess::DaemonProcess(const std::string& program, std::vector<std::string> arguments) {
+  arguments.insert(arguments.begin(), program);
   int pipeFds[2];
   if (pipe2(pipeFds, O_CLOEXEC) != 0) throw std::runtime_error("pipe failed");
   posix_spawn_file_actions_t actions;
@@ -59,7 +62,7 @@ DaemonProcess::DaemonProcess(std::vector<std::string> arguments) {
   close(pipeFds[1]);
   if (error != 0) {
     close(pipeFds[0]);
-    throw std::runtime_error(std::string("cannot start quorveld: ") + std::strerror(error));
+    throw std::runtime_error("cannot start " + program + ": " + std::strerror(error));
   }
   reader_ = std::thread([this, fd = pipeFds[0]] { capture(fd); });
 }

@@ -24,6 +24,8 @@ class DaemonProcess {
  public:
   // Starts quorveld with `arguments` after the program name.
   explicit DaemonProcess(std::vector<std::string> arguments);
+  // Starts `program` (a path) the same way: a client held in the background.
+  DaemonProcess(const std::string& program, std::vector<std::string> arguments);
   ~DaemonProcess();
   DaemonProcess(const DaemonProcess&) = delete;
   DaemonProcess& operator=(const DaemonProcess&) = delete;

@@ -25,6 +25,7 @@
 #include <vector>
 
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
 
 namespace {
@@ -59,7 +60,14 @@ int reportError(const Globals& globals, const platform::Error& error) {
   if (globals.json) {
     std::printf("%s\n", nlohmann::json{{"error", errorJSON(error)}}.dump().c_str());
   }
-  std::fprintf(stderr, "quorvelctl: %s\n", error.description().c_str());
+  if (error.domain() == quorvel::RCSSavedRecordingServiceErrorDomain) {
+    // The service's own refusals (301, 302, ...) by the name scripts match on.
+    std::fprintf(stderr, "quorvelctl: %s (%ld): %s\n",
+                 quorvel::RCSDBusErrorFromError(error).name.c_str(), error.code(),
+                 error.description().c_str());
+  } else {
+    std::fprintf(stderr, "quorvelctl: %s\n", error.description().c_str());
+  }
   return kExitDaemonError;
 }
 
@@ -95,6 +103,13 @@ int runCommand(const std::vector<std::string>& command) {
   if (WIFEXITED(status)) return WEXITSTATUS(status);
   if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
   return 1;
+}
+
+// Hands the token back. The call expects no reply, so a round trip behind
+// it on the same connection makes sure it left before the process exits.
+void endSession(SavedRecordingServiceClient& client, const RCSSavedRecordingAccessToken& token) {
+  client.endAccessSessionWithToken(token);
+  (void)client.fetchExportingCompositionAVURLs();
 }
 
 }  // namespace
@@ -184,7 +199,7 @@ int main(int argc, char** argv) {
     if (!token) return reportError(globals, token.error());
     if (!prepare.command.empty()) {
       int status = runCommand(prepare.command);
-      client.endAccessSessionWithToken(*token);
+      endSession(client, *token);
       return status;
     }
     if (globals.json) {
@@ -212,7 +227,7 @@ int main(int argc, char** argv) {
                    tokenFields[1].c_str(), tokenFields[2].c_str(), tokenFields[3].c_str());
       return kExitUsage;
     }
-    client.endAccessSessionWithToken(*token);
+    endSession(client, *token);
     return 0;
   }
 
