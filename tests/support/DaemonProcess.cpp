@@ -109,6 +109,20 @@ bool DaemonProcess::waitForLine(const std::string& text, std::chrono::millisecon
   }) && checked < lines_.size();
 }
 
+bool DaemonProcess::waitForLines(const std::string& text, std::size_t count,
+                                 std::chrono::milliseconds timeout) {
+  std::unique_lock lock(mutex_);
+  std::size_t checked = 0;
+  std::size_t found = 0;
+  changed_.wait_for(lock, timeout, [&] {
+    for (; checked < lines_.size(); ++checked) {
+      if (lines_[checked].find(text) != std::string::npos) ++found;
+    }
+    return found >= count || closed_;
+  });
+  return found >= count;
+}
+
 std::vector<std::string> DaemonProcess::linesContaining(const std::string& text) const {
   std::lock_guard lock(mutex_);
   std::vector<std::string> found;

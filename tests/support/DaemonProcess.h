@@ -35,6 +35,10 @@ class DaemonProcess {
   // process's stderr closed first.
   bool waitForLine(const std::string& text,
                    std::chrono::milliseconds timeout = std::chrono::seconds(30));
+  // Waits until `count` stderr lines contain `text`; false on timeout or when
+  // stderr closed first.
+  bool waitForLines(const std::string& text, std::size_t count,
+                    std::chrono::milliseconds timeout = std::chrono::seconds(30));
   // Every line so far that contains `text`.
   std::vector<std::string> linesContaining(const std::string& text) const;
   std::string output() const;
