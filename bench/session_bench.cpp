@@ -1,0 +1,228 @@
+// Access sessions against bare D-Bus round trips to the same daemon.
+//
+// Runs the real build/bin/quorveld on a private bus with one finalized
+// recording (a bundle whose fragments were composed away). Measures, in one
+// run:
+//   1. PrepareToPreview latency (p50, p99; each followed by EndAccessSession)
+//      against Peer.Ping to the daemon, interleaved. Target: <= 1.5 x ping.
+//   2. 8 connections in parallel: aggregate grants per second against the
+//      aggregate ping rate of 8 connections. Target: >= 0.6 x.
+//   3. Resident memory with 1,000 open sessions, above idle (target <= 5 MB),
+//      and after they closed (target: within 1 MB of idle).
+//
+// Usage: session_bench [N]   (prepares per path in part 1; default 5000)
+#include <fcntl.h>
+#include <sdbus-c++/sdbus-c++.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <thread>
+#include <tuple>
+#include <vector>
+
+#include "Quorvel/composition/RCCompositionEditor.h"
+#include "Quorvel/database/RCSavedRecordingsModel.h"
+#include "Quorvel/files/RCRecordingsDirectory.h"
+#include "tests/support/TestBus.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using Token = sdbus::Struct<std::string, int32_t, std::string, std::string>;
+constexpr const char* kService = "org.quorvel.SavedRecordingService";
+constexpr const char* kPath = "/org/quorvel/SavedRecordingService";
+constexpr const char* kInterface = "org.quorvel.SavedRecordingService1";
+
+long residentKilobytes(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.starts_with("VmRSS:")) return std::stol(line.substr(6));
+  }
+  return -1;
+}
+
+Token prepare(sdbus::IProxy& proxy, const std::string& url) {
+  auto call = proxy.createMethodCall(kInterface, "PrepareToPreview");
+  call << url;
+  auto reply = proxy.callMethod(call);
+  Token token;
+  reply >> token;
+  return token;
+}
+
+void end(sdbus::IProxy& proxy, const Token& token) {
+  auto call = proxy.createMethodCall(kInterface, "EndAccessSession");
+  call << token;
+  call.dontExpectReply();
+  proxy.callMethod(call);
+}
+
+void ping(sdbus::IProxy& proxy) {
+  auto call = proxy.createMethodCall("org.freedesktop.DBus.Peer", "Ping");
+  proxy.callMethod(call);
+}
+
+double micros(Clock::duration duration) {
+  return std::chrono::duration<double, std::micro>(duration).count();
+}
+
+double percentile(std::vector<double> values, double p) {
+  std::sort(values.begin(), values.end());
+  return values[std::min(values.size() - 1, static_cast<std::size_t>(p * values.size()))];
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  int n = argc > 1 ? std::atoi(argv[1]) : 5000;
+  if (n <= 0) n = 5000;
+  platform::testing::TestBus bus;
+  auto recordings = std::filesystem::temp_directory_path() /
+                    ("quorvel-session-bench-" + std::to_string(getpid()));
+  std::filesystem::remove_all(recordings);
+  quorvel::RCSetSavedRecordingsDirectory(recordings.string());
+  std::string url;
+  {
+    auto model =
+        quorvel::RCSavedRecordingsModel::modelWithDirectory(quorvel::RCSavedRecordingsDirectory());
+    if (!model) {
+      std::fprintf(stderr, "cannot open the database: %s\n", model.error().description().c_str());
+      return 1;
+    }
+    auto editor = quorvel::RCCompositionEditor::createCompositionForNewRecording(**model, "Bench");
+    if (!editor) {
+      std::fprintf(stderr, "cannot make the recording: %s\n", editor.error().description().c_str());
+      return 1;
+    }
+    url = editor->composedAVURL().absoluteString();
+  }
+
+  std::string program = std::string(QUORVEL_BINARY_DIR) + "/bin/quorveld";
+  std::vector<std::string> arguments{program,
+                                     "--bus-address",
+                                     bus.address(),
+                                     "--recordings-dir",
+                                     recordings.string(),
+                                     "--idle-exit-after",
+                                     "0"};
+  std::vector<char*> args;
+  for (auto& argument : arguments) args.push_back(argument.data());
+  args.push_back(nullptr);
+  std::vector<std::string> environment{"QUORVEL_LOG_CONSOLE=0", "QUORVEL_LOG_STDERR=1",
+                                       "QUORVEL_LOG_LEVEL=4"};
+  std::vector<char*> envp;
+  for (auto& entry : environment) envp.push_back(entry.data());
+  envp.push_back(nullptr);
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
+  pid_t pid = -1;
+  if (posix_spawn(&pid, program.c_str(), &actions, nullptr, args.data(), envp.data()) != 0) {
+    std::fprintf(stderr, "cannot start %s\n", program.c_str());
+    return 1;
+  }
+  posix_spawn_file_actions_destroy(&actions);
+
+  auto connection = sdbus::createSessionBusConnectionWithAddress(bus.address());
+  auto proxy = sdbus::createProxy(*connection, kService, kPath);
+  for (int attempt = 0;; ++attempt) {  // until the daemon owns its name
+    try {
+      ping(*proxy);
+      break;
+    } catch (const sdbus::Error&) {
+      if (attempt > 200) {
+        std::fprintf(stderr, "quorveld never answered\n");
+        kill(pid, SIGKILL);
+        return 1;
+      }
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+  }
+  // Past the start-up keep-alive periods and the first orphan pass.
+  std::this_thread::sleep_for(std::chrono::milliseconds(2500));
+  long idle = residentKilobytes(pid);
+
+  // 1. Latency, interleaved so that drift in machine load hits both alike.
+  for (int i = 0; i < 500; ++i) {
+    end(*proxy, prepare(*proxy, url));
+    ping(*proxy);
+  }
+  std::vector<double> prepares, pings;
+  for (int i = 0; i < n; ++i) {
+    auto start = Clock::now();
+    Token token = prepare(*proxy, url);
+    prepares.push_back(micros(Clock::now() - start));
+    end(*proxy, token);
+    start = Clock::now();
+    ping(*proxy);
+    pings.push_back(micros(Clock::now() - start));
+  }
+  double prepareP50 = percentile(prepares, 0.5), prepareP99 = percentile(prepares, 0.99);
+  double pingP50 = percentile(pings, 0.5), pingP99 = percentile(pings, 0.99);
+  std::printf("prepare p50 %.1f us, p99 %.1f us; ping p50 %.1f us, p99 %.1f us\n", prepareP50,
+              prepareP99, pingP50, pingP99);
+  std::printf("ratio prepare/ping: p50 %.2f, p99 %.2f (target <= 1.5)\n", prepareP50 / pingP50,
+              prepareP99 / pingP99);
+
+  // 2. Throughput of 8 connections.
+  constexpr int kClients = 8;
+  constexpr auto kWindow = std::chrono::seconds(2);
+  auto rate = [&](bool sessions) {
+    std::atomic<long> done{0};
+    std::vector<std::thread> threads;
+    for (int c = 0; c < kClients; ++c) {
+      threads.emplace_back([&] {
+        auto own = sdbus::createSessionBusConnectionWithAddress(bus.address());
+        auto ownProxy = sdbus::createProxy(*own, kService, kPath);
+        auto until = Clock::now() + kWindow;
+        long count = 0;
+        while (Clock::now() < until) {
+          if (sessions) {
+            end(*ownProxy, prepare(*ownProxy, url));
+          } else {
+            ping(*ownProxy);
+          }
+          ++count;
+        }
+        done += count;
+      });
+    }
+    for (auto& thread : threads) thread.join();
+    return done.load() / std::chrono::duration<double>(kWindow).count();
+  };
+  double pingRate = rate(false);
+  double grantRate = rate(true);
+  std::printf("8 connections: %.0f grants/s, %.0f pings/s; ratio %.2f (target >= 0.6)\n", grantRate,
+              pingRate, grantRate / pingRate);
+
+  // 3. Memory with 1,000 open sessions.
+  std::this_thread::sleep_for(std::chrono::milliseconds(2500));
+  idle = residentKilobytes(pid);
+  std::vector<Token> open;
+  for (int i = 0; i < 1000; ++i) open.push_back(prepare(*proxy, url));
+  long held = residentKilobytes(pid);
+  for (const auto& token : open) end(*proxy, token);
+  ping(*proxy);
+  std::this_thread::sleep_for(std::chrono::milliseconds(2500));  // closes and their keep-alives
+  long after = residentKilobytes(pid);
+  std::printf(
+      "resident: idle %.2f MB, 1000 sessions %.2f MB (+%.2f, target <= 5), after %.2f MB "
+      "(+%.2f, target <= 1)\n",
+      idle / 1024.0, held / 1024.0, (held - idle) / 1024.0, after / 1024.0,
+      (after - idle) / 1024.0);
+
+  kill(pid, SIGTERM);
+  waitpid(pid, nullptr, 0);
+  std::filesystem::remove_all(recordings);
+  return 0;
+}
