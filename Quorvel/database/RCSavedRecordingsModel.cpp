@@ -194,21 +194,20 @@ RCSavedRecordingsModel::RCSavedRecordingsModel(std::string directory,
 
 RCSavedRecordingsModel::~RCSavedRecordingsModel() = default;
 
-void RCSavedRecordingsModel::checkQueue([[maybe_unused]] std::source_location caller) const {
+void RCSavedRecordingsModel::checkQueue([[maybe_unused]] const char* file,
+                                        [[maybe_unused]] int line) const {
 #if defined(QUORVEL_DCHECK_IS_ON)
-  if (queue_ != nullptr) {
-    platform::detail::checkOnQueue(*queue_, caller.file_name(), static_cast<int>(caller.line()));
-  }
+  if (queue_ != nullptr) platform::detail::checkOnQueue(*queue_, file, line);
 #endif
 }
 
 bool RCSavedRecordingsModel::hasChanges() const {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   return !pending_.empty();
 }
 
 std::string RCSavedRecordingsModel::storedPathForFile(std::string_view path) const {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   platform::URL url = platform::URL::fileURLWithPath(path);
   if (auto relative = RCPathRelativeToDirectory(url, directory_)) return *relative;
   return url.URLByStandardizingPath().path();
@@ -216,7 +215,7 @@ std::string RCSavedRecordingsModel::storedPathForFile(std::string_view path) con
 
 platform::Result<std::vector<std::shared_ptr<RCSavedRecording>>> RCSavedRecordingsModel::fetch(
     std::string_view where, std::string_view value) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   std::string sql = std::string(kColumns) + std::string(where) + " ORDER BY date, rowid";
   auto statement = database_->prepare(sql);
   if (!statement) return platform::fail(statement.error());
@@ -259,7 +258,7 @@ platform::Result<std::vector<std::shared_ptr<RCSavedRecording>>> RCSavedRecordin
 
 platform::Status RCSavedRecordingsModel::enumerateExistingRecordingsWithBlock(
     const RecordingVisitor& block) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   auto recordings = fetch("", "");
   if (!recordings) return platform::fail(recordings.error());
   for (const auto& recording : pending_) {
@@ -274,7 +273,7 @@ platform::Status RCSavedRecordingsModel::enumerateExistingRecordingsWithBlock(
 }
 
 void RCSavedRecordingsModel::performWithSavingDisabled(const std::function<void()>& block) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   ++savingDisabledDepth_;
   struct Restore {
     int& depth;
@@ -284,7 +283,7 @@ void RCSavedRecordingsModel::performWithSavingDisabled(const std::function<void(
 }
 
 platform::Status RCSavedRecordingsModel::saveIfNecessary() {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   if (pending_.empty()) return {};
   auto fail = [&](const platform::Error& error) {
     (void)database_->execute("ROLLBACK");
@@ -323,7 +322,7 @@ platform::Status RCSavedRecordingsModel::saveIfNecessary() {
 
 void RCSavedRecordingsModel::recordingDidChange(
     const std::shared_ptr<RCSavedRecording>& recording) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   bool listed = false;
   for (const auto& pending : pending_) listed = listed || pending == recording;
   if (!listed) pending_.push_back(recording);
@@ -332,7 +331,7 @@ void RCSavedRecordingsModel::recordingDidChange(
 
 std::shared_ptr<RCSavedRecording> RCSavedRecordingsModel::insertRecordingWithAudioFile(
     std::string_view path, double duration, platform::Date date) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   platform::URL url = platform::URL::fileURLWithPath(path);
   std::string title = url.URLByDeletingPathExtension().lastPathComponent();
   platform::UUID uuid = platform::UUID::random();
@@ -347,7 +346,7 @@ std::shared_ptr<RCSavedRecording> RCSavedRecordingsModel::insertRecordingWithAud
 
 platform::Result<std::shared_ptr<RCSavedRecording>>
 RCSavedRecordingsModel::recordingWithURIRepresentation(std::string_view uri) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   auto uuid = RCSavedRecording::uniqueIDFromURIRepresentation(uri);
   if (!uuid) return std::shared_ptr<RCSavedRecording>();
   for (const auto& recording : pending_) {
@@ -360,7 +359,7 @@ RCSavedRecordingsModel::recordingWithURIRepresentation(std::string_view uri) {
 
 platform::Result<std::shared_ptr<RCSavedRecording>> RCSavedRecordingsModel::recordingWithURL(
     const platform::URL& url) {
-  checkQueue();
+  checkQueue(__FILE__, __LINE__);
   std::string stored = storedPathForFile(url.path());
   for (const auto& recording : pending_) {
     if (recording->isNew_ && recording->storedPath_ == stored) return recording;

@@ -18,7 +18,6 @@
 #include <functional>
 #include <memory>
 #include <optional>
-#include <source_location>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -110,8 +109,8 @@ class RCSavedRecordingsModel : public std::enable_shared_from_this<RCSavedRecord
       const std::string& directory, platform::DispatchQueue* queue);
 
   // Aborts in debug builds when a queue-bound model is used off its queue,
-  // naming the calling member's line.
-  void checkQueue(std::source_location caller = std::source_location::current()) const;
+  // naming the calling member's line (see QV_CHECK_MODEL_QUEUE).
+  void checkQueue(const char* file, int line) const;
   void recordingDidChange(const std::shared_ptr<RCSavedRecording>& recording);
   platform::Result<std::vector<std::shared_ptr<RCSavedRecording>>> fetch(std::string_view where,
                                                                          std::string_view value);
