@@ -184,6 +184,21 @@ TEST(MainQueueRunTest, RealClockTimerFires) {
   EXPECT_EQ(queue.pendingCount(), 0u);
 }
 
+// Scheduling wakes a sleeping loop only for a new earliest deadline: a loop
+// asleep until an hour from now must still run a timer due in a millisecond.
+TEST(MainQueueRunTest, AnEarlierTimerWakesALoopSleepingUntilALaterOne) {
+  MainQueue queue;  // system clock
+  queue.after(std::chrono::hours(1), [] {});
+  std::promise<void> sleeping;
+  queue.async([&] { sleeping.set_value(); });
+  std::thread loop([&] { queue.run(); });
+  sleeping.get_future().wait();
+  queue.after(std::chrono::hours(2), [] {});
+  queue.after(milliseconds(1), [&] { queue.stop(); });
+  loop.join();  // hangs if the earlier timer did not wake the loop
+  EXPECT_EQ(queue.pendingCount(), 2u);
+}
+
 TEST(MainQueueRunTest, AQueueDestroyedBeforeItsClockIsForgotten) {
   ManualClock clock;
   {
