@@ -3,6 +3,7 @@
 
 #include <array>
 #include <cstdint>
+#include <cstring>
 #include <functional>
 #include <optional>
 #include <string>
@@ -33,8 +34,10 @@ class UUID {
 template <>
 struct std::hash<platform::UUID> {
   std::size_t operator()(const platform::UUID& uuid) const noexcept {
-    std::size_t h = 0;
-    for (auto b : uuid.bytes()) h = h * 131 + b;
-    return h;
+    // Random bytes hash themselves; the fixed version bits are in the middle.
+    std::uint64_t head, tail;
+    std::memcpy(&head, uuid.bytes().data(), 8);
+    std::memcpy(&tail, uuid.bytes().data() + 8, 8);
+    return static_cast<std::size_t>(head ^ (tail * 0x9E3779B97F4A7C15ull));
   }
 };

@@ -1,5 +1,7 @@
 // The shared value types: file URLs, errors, UUIDs, dates.
 #include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <set>
 #include <unordered_set>
@@ -89,6 +91,28 @@ TEST(UUIDTest, RandomRoundTripsAndIsUnique) {
   EXPECT_FALSE(UUID::fromString("E621E1F8-C36C-495A-93FC-0C247A3E6E5G"));
   EXPECT_EQ(UUID::fromString("e621e1f8-c36c-495a-93fc-0c247a3e6e5f")->string(),
             "E621E1F8-C36C-495A-93FC-0C247A3E6E5F");
+}
+
+// UUIDs are drawn from a per-thread buffer of random bytes; a forked child
+// must not hand out the identifiers its parent has buffered.
+TEST(UUIDTest, AForkedChildDrawsOtherIdentifiersThanItsParent) {
+  (void)UUID::random();  // fills this thread's buffer
+  int fds[2];
+  ASSERT_EQ(pipe(fds), 0);
+  pid_t child = fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    std::string text = UUID::random().string();
+    _exit(write(fds[1], text.data(), text.size()) == 36 ? 0 : 1);
+  }
+  std::string mine = UUID::random().string();
+  std::string theirs(36, '\0');
+  ASSERT_EQ(read(fds[0], theirs.data(), theirs.size()), 36);
+  int status = 0;
+  waitpid(child, &status, 0);
+  close(fds[0]);
+  close(fds[1]);
+  EXPECT_NE(mine, theirs);
 }
 
 TEST(DateTest, ParsesAndPrintsISO8601) {
