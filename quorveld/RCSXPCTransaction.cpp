@@ -24,6 +24,9 @@ RCSXPCTransaction::RCSXPCTransaction(std::string name)
     : _uuid(platform::UUID::random()), _name(std::move(name)) {}
 
 RCSXPCTransaction::~RCSXPCTransaction() {
+  // Nothing can begin a transaction that is being destroyed, so one that the
+  // table no longer holds has nothing left to end.
+  if (!_listed.load(std::memory_order_acquire)) return;
   RCSXPCTransactionController::sharedInstance().removeActiveTransactionWithIdentifier(
       _uuid, description());
 }

@@ -7,6 +7,7 @@
 // transaction ends it. Every member may be called from any thread.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <string>
 #include <vector>
@@ -48,8 +49,14 @@ class RCSXPCTransaction : public std::enable_shared_from_this<RCSXPCTransaction>
  private:
   explicit RCSXPCTransaction(std::string name);
 
+  friend class RCSXPCTransactionController;
+
   platform::UUID _uuid;
   std::string _name;
+  // Whether the controller's table holds this transaction. Written only on
+  // the controller's queue; read by the destructor, which skips the
+  // controller altogether for a transaction that was already ended.
+  mutable std::atomic<bool> _listed{false};
 };
 
 }  // namespace quorvel

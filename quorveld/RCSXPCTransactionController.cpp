@@ -32,31 +32,37 @@ void RCSXPCTransactionController::addActiveTransaction(RCSXPCTransaction& transa
   _serialQueue.sync([&] {
     QV_LOG(platform::kLogLevelDebug, "Activating XPC transaction: {}", transaction.description());
     _openTransactions.insert_or_assign(transaction._identifier(), transaction.weak_from_this());
+    transaction._listed.store(true, std::memory_order_release);
     _onQueueUpdateInternalTransactionState();
   });
 }
 
 void RCSXPCTransactionController::removeActiveTransaction(const RCSXPCTransaction& transaction) {
-  removeActiveTransactionWithIdentifier(transaction._identifier(), transaction.description());
+  // A live transaction is never ended from the controller's own queue (only
+  // a destructor can run there), so this can always wait for its turn.
+  _serialQueue.sync([&] { _onQueueRemove(transaction._identifier(), &transaction, {}); });
 }
 
 void RCSXPCTransactionController::removeActiveTransactionWithIdentifier(
     const platform::UUID& identifier, const std::string& description) {
   if (_serialQueue.isCurrent()) {
     _serialQueue.async(
-        [this, identifier, description] { _onQueueRemove(identifier, description); });
+        [this, identifier, description] { _onQueueRemove(identifier, nullptr, description); });
     return;
   }
-  _serialQueue.sync([&] { _onQueueRemove(identifier, description); });
+  _serialQueue.sync([&] { _onQueueRemove(identifier, nullptr, description); });
 }
 
 void RCSXPCTransactionController::_onQueueRemove(const platform::UUID& identifier,
-                                                 const std::string& description) {
+                                                 const RCSXPCTransaction* transaction,
+                                                 std::string_view description) {
   QV_DCHECK_ON_QUEUE(_serialQueue);
   auto entry = _openTransactions.find(identifier);
   if (entry == _openTransactions.end()) return;
-  QV_LOG(platform::kLogLevelDebug, "Deactivating XPC transaction: {}", description);
+  QV_LOG(platform::kLogLevelDebug, "Deactivating XPC transaction: {}",
+         transaction ? transaction->description() : std::string(description));
   _openTransactions.erase(entry);
+  if (transaction) transaction->_listed.store(false, std::memory_order_release);
   _onQueueUpdateInternalTransactionState();
 }
 

@@ -12,6 +12,7 @@
 #include <atomic>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <vector>
 
@@ -43,7 +44,10 @@ class RCSXPCTransactionController {
                                              const std::string& description);
   // Controller queue only (checked in debug builds): the bodies of removal
   // and of every change to the table, which begin or end the root.
-  void _onQueueRemove(const platform::UUID& identifier, const std::string& description);
+  // `transaction`, when it is still alive, is told it left the table and
+  // describes itself in the log line; else `description` does.
+  void _onQueueRemove(const platform::UUID& identifier, const RCSXPCTransaction* transaction,
+                      std::string_view description);
   void _onQueueUpdateInternalTransactionState();
 
   // Any thread.
