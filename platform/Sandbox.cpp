@@ -258,7 +258,7 @@ std::string applySeccomp() {
 // --- the rest -------------------------------------------------------------
 
 std::string formatBytes(std::uint64_t bytes) {
-  constexpr std::uint64_t kMiB = 1024 * 1024;
+  constexpr std::uint64_t kMiB = std::uint64_t{1} << 20;
   if (bytes % kMiB == 0) return fmt::format("{} MiB", bytes / kMiB);
   return fmt::format("{} bytes", bytes);
 }

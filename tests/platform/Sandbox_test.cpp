@@ -10,7 +10,6 @@
 #include <iconv.h>
 #include <sched.h>
 #include <signal.h>
-#include <sys/ptrace.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -25,7 +24,6 @@
 #include <functional>
 #include <future>
 #include <iostream>
-#include <new>
 #include <stdexcept>
 #include <thread>
 
@@ -35,36 +33,24 @@ namespace {
 namespace fs = std::filesystem;
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool kSanitized = true;
+#define SANDBOX_TEST_SANITIZED 1
 #elif defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer) || \
-    __has_feature(memory_sanitizer)
-constexpr bool kSanitized = true;
-#else
-constexpr bool kSanitized = false;
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+#define SANDBOX_TEST_SANITIZED 1
 #endif
-#else
-constexpr bool kSanitized = false;
 #endif
 
 // Collects the checks that failed inside the child.
-class Checks {
- public:
-  // Expects a call's result `ok`; on failure notes `what` and errno.
+struct Checks {
+  // Expects `ok`; on failure notes `what` and errno.
   void expect(bool ok, const std::string& what) {
-    if (!ok) failures_ += what + " (errno " + std::strerror(errno) + ")\n";
+    if (!ok) failures += what + " (" + std::strerror(errno) + ")\n";
   }
-  // Expects a call to have failed with `err`.
+  // Expects a call to have failed (-1) with `err`.
   void expectRefused(long result, int err, const std::string& what) {
-    if (result != -1 || errno != err) {
-      failures_ += what + " returned " + std::to_string(result) + ", errno " +
-                   std::strerror(errno) + "; wanted " + std::strerror(err) + "\n";
-    }
+    expect(result == -1 && errno == err, what + " wanted " + std::strerror(err) + ", got");
   }
-  const std::string& failures() const { return failures_; }
-
- private:
-  std::string failures_;
+  std::string failures;
 };
 
 struct Outcome {
@@ -95,13 +81,11 @@ Outcome runSandboxed(
     } catch (const std::exception& e) {
       c.expect(false, std::string("exception: ") + e.what());
     }
-    report += c.failures();
-    for (std::size_t at = 0; at < report.size();) {
-      ssize_t n = ::write(fds[1], report.data() + at, report.size() - at);
-      if (n <= 0) ::_exit(3);
-      at += static_cast<std::size_t>(n);
-    }
-    ::_exit(c.failures().empty() ? 0 : 1);
+    report += c.failures;
+    // Far below the pipe's capacity, so one write takes it all.
+    bool written =
+        ::write(fds[1], report.data(), report.size()) == static_cast<ssize_t>(report.size());
+    ::_exit(c.failures.empty() && written ? 0 : 1);
   }
   ::close(fds[1]);
   std::string report;
@@ -151,18 +135,10 @@ TEST_F(SandboxTest, ReachingOutRunningProgramsAndNewNamespacesAreRefused) {
     c.expect(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) == 0, "socketpair");
     char* const argv[] = {const_cast<char*>("true"), nullptr};
     c.expectRefused(::execve("/bin/true", argv, environ), EPERM, "execve");
-    c.expectRefused(::ptrace(PTRACE_TRACEME, 0, nullptr, nullptr), EPERM, "ptrace");
-    c.expectRefused(::unshare(CLONE_NEWUSER), EPERM, "unshare");
     long cloned = ::syscall(SYS_clone, CLONE_NEWUSER | SIGCHLD, nullptr, nullptr, nullptr, 0);
     if (cloned == 0) ::_exit(0);
     c.expectRefused(cloned, EPERM, "clone(CLONE_NEWUSER)");
-    c.expectRefused(::syscall(SYS_io_uring_setup, 8, nullptr), EPERM, "io_uring_setup");
-    // Plain processes and threads still start (glibc falls back from clone3).
-    pid_t child = ::fork();
-    if (child == 0) ::_exit(7);
-    int status = 0;
-    c.expect(child > 0 && ::waitpid(child, &status, 0) == child && WEXITSTATUS(status) == 7,
-             "fork");
+    // Threads still start: glibc falls back from clone3 to clone.
     std::promise<int> ran;
     std::thread([&] { ran.set_value(42); }).join();
     c.expect(ran.get_future().get() == 42, "thread");
@@ -211,7 +187,6 @@ TEST_F(SandboxTest, FilesystemRulesConfineReadsAndWrites) {
     // The worker's way of writing: a temp file, renamed over the result,
     // also across directories inside the write path.
     c.expect(canOpen(out / "result.tmp", O_WRONLY | O_CREAT | O_TRUNC), "create inside");
-    c.expect(::truncate((out / "result.tmp").c_str(), 4) == 0, "truncate inside");
     c.expect(::rename((out / "result.tmp").c_str(), (out / "result").c_str()) == 0, "rename");
     c.expect(::mkdir((out / "sub").c_str(), 0700) == 0, "mkdir inside");
     c.expect(::rename((out / "result").c_str(), (out / "sub" / "result").c_str()) == 0,
@@ -237,14 +212,15 @@ TEST_F(SandboxTest, AConfinedProcessStillLoadsLibrariesAndSystemData) {
     c.expect(canOpen("/dev/null", O_RDWR), "/dev/null");
     c.expect(canOpen("/dev/urandom", O_RDONLY), "/dev/urandom");
     c.expect(canOpen("/proc/self/maps", O_RDONLY), "/proc/self/maps");
-    c.expect(canOpen("/etc/localtime", O_RDONLY) || errno == ENOENT, "/etc/localtime");
     c.expect(canOpen("/sys/devices/system/cpu/online", O_RDONLY), "the CPU list");
   });
   EXPECT_TRUE(outcome.passed()) << outcome.failures;
 }
 
 TEST_F(SandboxTest, AllocationsBeyondTheAddressSpaceLimitFail) {
-  if (kSanitized) GTEST_SKIP() << "sanitizer runtimes reserve more than any useful limit";
+#ifdef SANDBOX_TEST_SANITIZED
+  GTEST_SKIP() << "sanitizer runtimes reserve more than any useful limit";
+#endif
   policy_.addressSpaceLimitBytes = 512ull << 20;
   Outcome outcome = runSandboxed(policy_, [](Checks& c) {
     void* (*volatile allocate)(std::size_t) = &std::malloc;
@@ -254,14 +230,6 @@ TEST_F(SandboxTest, AllocationsBeyondTheAddressSpaceLimitFail) {
     void* huge = allocate(std::size_t{1} << 30);
     c.expect(huge == nullptr, "a 1 GiB allocation");
     std::free(huge);
-    bool threw = false;
-    try {
-      auto* vector = new std::vector<char>(std::size_t{1} << 30);
-      delete vector;
-    } catch (const std::bad_alloc&) {
-      threw = true;
-    }
-    c.expect(threw, "operator new beyond the limit");
     rlimit limit{};
     c.expect(::getrlimit(RLIMIT_AS, &limit) == 0 && limit.rlim_max == (512ull << 20),
              "the hard limit, so that it cannot be raised again");
