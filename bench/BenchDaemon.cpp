@@ -1,0 +1,84 @@
+#include "bench/BenchDaemon.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <iterator>
+#include <set>
+#include <sstream>
+#include <vector>
+
+namespace quorvel::bench {
+
+BenchDaemon::BenchDaemon(const std::string& busAddress, const std::string& recordingsDirectory)
+    : program_(std::string(QUORVEL_BINARY_DIR) + "/bin/quorveld") {
+  std::vector<std::string> arguments{program_,
+                                     "--bus-address",
+                                     busAddress,
+                                     "--recordings-dir",
+                                     recordingsDirectory,
+                                     "--idle-exit-after",
+                                     "0"};
+  std::vector<char*> args;
+  for (auto& argument : arguments) args.push_back(argument.data());
+  args.push_back(nullptr);
+  std::vector<std::string> environment{"QUORVEL_LOG_CONSOLE=0", "QUORVEL_LOG_STDERR=1",
+                                       "QUORVEL_LOG_LEVEL=4"};
+  std::vector<char*> envp;
+  for (auto& entry : environment) envp.push_back(entry.data());
+  envp.push_back(nullptr);
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
+  if (posix_spawn(&pid_, program_.c_str(), &actions, nullptr, args.data(), envp.data()) != 0) {
+    pid_ = -1;
+  }
+  posix_spawn_file_actions_destroy(&actions);
+}
+
+BenchDaemon::~BenchDaemon() {
+  if (pid_ <= 0) return;
+  kill(pid_, SIGTERM);
+  waitpid(pid_, nullptr, 0);
+}
+
+long residentKilobytes(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.starts_with("VmRSS:")) return std::stol(line.substr(6));
+  }
+  return -1;
+}
+
+double cpuMicroseconds(pid_t pid) {
+  std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(stat)), {});
+  // Fields after the command name, which may hold spaces; utime and stime
+  // are the 12th and 13th of them.
+  std::istringstream fields(text.substr(text.rfind(')') + 2));
+  std::string skipped;
+  for (int i = 0; i < 11; ++i) fields >> skipped;
+  long user = 0, system = 0;
+  fields >> user >> system;
+  return static_cast<double>(user + system) * 1e6 / static_cast<double>(sysconf(_SC_CLK_TCK));
+}
+
+int mappedLibraryCount(pid_t pid) {
+  std::ifstream maps("/proc/" + std::to_string(pid) + "/maps");
+  std::set<std::string> libraries;
+  std::string line;
+  while (std::getline(maps, line)) {
+    auto slash = line.find('/');
+    if (slash == std::string::npos) continue;
+    std::string path = line.substr(slash);
+    if (path.find(".so") != std::string::npos) libraries.insert(path);
+  }
+  return static_cast<int>(libraries.size());
+}
+
+}  // namespace quorvel::bench
