@@ -5,10 +5,12 @@
 // generation number; every begin bumps the generation. A timer whose
 // generation is no longer the latest was cancelled by a begin (or re-armed by
 // a new period) and does nothing, so the idle handler runs only after a full
-// idle period without a root transaction.
+// idle period without a root transaction. The end of the root transaction
+// also trims the heap (see trimHeapWhileIdle).
 #include "platform/ProcessLifetime.h"
 
 #include <fmt/format.h>
+#include <malloc.h>
 
 #include <cstdio>
 #include <cstdlib>
@@ -64,6 +66,24 @@ void armIdleTimer(const std::shared_ptr<StateT>& state) {
   });
 }
 
+// With the state's mutex held, when the root transaction has just ended:
+// gives the heap memory freed during the busy spell back to the system, on
+// the main queue, unless work has begun again by then. Memory freed by other
+// threads stays in their malloc arenas otherwise, so an idle daemon would keep
+// the high-water mark of its busiest moment.
+template <class StateT>
+void trimHeapWhileIdle(const std::shared_ptr<StateT>& state) {
+  state->queue.async([weak = std::weak_ptr<StateT>(state), generation = state->generation] {
+    auto strong = weak.lock();
+    if (!strong) return;
+    {
+      std::lock_guard lock(strong->mutex);
+      if (strong->generation != generation) return;
+    }
+    malloc_trim(0);
+  });
+}
+
 }  // namespace
 
 void ProcessLifetime::setIdleExitAfter(Duration idle) {
@@ -111,6 +131,7 @@ void ProcessLifetime::endTransaction() {
     state_->inTransaction = false;
     armIdleTimer(state_);
     waiters.swap(state_->noTransactionWaiters);
+    trimHeapWhileIdle(state_);
   }
   for (auto& waiter : waiters) waiter();
 }
