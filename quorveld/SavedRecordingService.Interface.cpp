@@ -70,20 +70,6 @@ void SavedRecordingService::prepareToPreviewCompositionAVURL(
                         std::move(accessRequestHandler));
 }
 
-void SavedRecordingService::prepareToExportCompositionAVURL(
-    std::optional<platform::URL> compositionAVURL, bool /*cacheWaveform*/,
-    AccessRequestHandler accessRequestHandler) {
-  static constexpr const char* kSelector =
-      "prepareToExportCompositionAVURL:cacheWaveform:accessRequestHandler:";
-  if (!_checkPrepareRequest(kSelector, "export", compositionAVURL, accessRequestHandler)) return;
-  // An export is granted only once its recording is finalized, which this
-  // daemon cannot do yet.
-  accessRequestHandler(
-      std::nullopt,
-      platform::Error("org.freedesktop.DBus.Error.NotSupported", 0,
-                      fmt::format("-{} is not supported by this daemon yet", kSelector)));
-}
-
 void SavedRecordingService::prepareToTrimCompositionAVURL(
     std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler) {
   _prepareAccessSession("prepareToTrimCompositionAVURL:accessRequestHandler:", "trimming",
@@ -115,19 +101,6 @@ void SavedRecordingService::enableOrphanedFragmentCleanupForCompositionAVURL(
     std::optional<platform::URL> compositionAVURL) {
   _removeDisabledOrphanCleanupForCompositionAVURL(std::move(compositionAVURL),
                                                   rcs_currentConnection());
-}
-
-void SavedRecordingService::fetchExportingCompositionAVURLs(URLSetHandler reply) {
-  // Without a reply the request is ignored altogether.
-  if (!reply) return;
-  _performOnServiceQueue([this, self = shared_from_this(), reply = std::move(reply)]() mutable {
-    std::set<platform::URL> snapshot;
-    _serialQueue.sync([&] {
-      snapshot.insert(_compositionAVURLsBeingExported.begin(),
-                      _compositionAVURLsBeingExported.end());
-    });
-    reply(std::move(snapshot));
-  });
 }
 
 }  // namespace quorvel

@@ -2,6 +2,12 @@
 // deferral, the close procedure with the work that waits for a close, and
 // what a vanished client leaves behind.
 //
+// A close after the client vanished also finalizes the recording (with its
+// waveform) before the session goes; a capture or trimming session closed
+// normally leaves a recording with uncomposed fragments to a deferred
+// finalization, so recordings are finalized in the background after every
+// edit, not only on export.
+//
 // A close runs in steps on the service serial queue: the session is marked
 // closing, its recording's orphaned fragments are cleaned (a hop through
 // _performOnServiceQueue), and only then does it leave the registry,
@@ -141,14 +147,19 @@ void SavedRecordingService::_onQueueCloseAccessSession(
             QV_LOG(platform::kLogLevelNotice, "Finally closing access session: {}",
                    session->debugDescription());
             _onQueueFinishClosingAccessSession(session);
+            _onQueueScheduleFinalizationAfterEditing(session);
           });
           return;
         }
-        // An abnormal end also finalizes the recording before the session
-        // goes, once finalization is part of the daemon; until then the
-        // close goes straight on to its last step.
-        _performOnServiceQueue(
-            [this, self, session] { _onQueueFinishClosingAccessSession(session); });
+        // The client is gone: finalize what it left, with its waveform,
+        // before the session goes, whatever the outcome.
+        _attemptFinalizationOfCompositionAVURL(*session->accessToken().compositionAVURL(),
+                                               /*cacheWaveform=*/true, session,
+                                               [this, self, session](bool /*success*/) {
+                                                 _performOnServiceQueue([this, self, session] {
+                                                   _onQueueFinishClosingAccessSession(session);
+                                                 });
+                                               });
       });
 }
 
@@ -173,9 +184,13 @@ void SavedRecordingService::_onServiceQueueAttemptToRunningDeferredWorkAfterClos
     auto run = std::move(deferred->second.run);
     _compositionAVURLsDeferredAccessRequestBlocksByAVURL.erase(deferred);
     run(false);
+    return;
   }
-  // A waiting finalization goes after a waiting access request; it joins
-  // here with the finalization scheduling.
+  // A waiting finalization goes after a waiting access request, and waits
+  // for the next close when there was one.
+  if (std::erase(_compositionAVURLsToFinalize, *url) > 0) {
+    _attemptToRunDeferredFinalizationOfCompositionAVURL(*url);
+  }
 }
 
 void SavedRecordingService::_handleXPCDisconnect(

@@ -71,6 +71,7 @@ std::shared_ptr<SavedRecordingService> SavedRecordingService::makeForTesting(
 void SavedRecordingService::_init(bool watchDebugSignal) {
   // The queues were made by the constructor, the instance queue first.
   _assetSesionController = std::make_unique<AssetAccessSessionController>();
+  _assetExportController = std::make_shared<AssetExportController>();
   _isOrphanHandlingEnabled = true;
   if (watchDebugSignal) _setupSignalHandler();
 }

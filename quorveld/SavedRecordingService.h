@@ -39,6 +39,7 @@
 #include "platform/URL.h"
 #include "platform/dbus/Listener.h"
 #include "quorveld/AssetAccessSessionController.h"
+#include "quorveld/AssetExportController.h"
 
 namespace quorvel {
 
@@ -189,12 +190,38 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   void _removeDisabledOrphanCleanupAVURLsForConnection(
       const std::shared_ptr<platform::Connection>& xpcConnection);
 
+  // Finalization. Any thread: each hands its decision to the service serial
+  // queue.
+  //
+  // Finalizes the recording through the export controller unless another
+  // session than `ignoredAccessSession` holds it exclusively (then
+  // `completionBlock` gets false at once, on the service serial queue).
+  // Otherwise the recording is in the exporting set while there is work to
+  // do, the change is posted twice, and `completionBlock` (may be empty)
+  // gets the outcome on the main queue.
+  using FinalizationCompletionBlock = std::move_only_function<void(bool success)>;
+  void _attemptFinalizationOfCompositionAVURL(
+      const platform::URL& compositionAVURL, bool cacheWaveform,
+      std::shared_ptr<AssetAccessSession> ignoredAccessSession,
+      FinalizationCompletionBlock completionBlock);
+  // Finalizes the recording, with its waveform, under a shared "finalize"
+  // session of the daemon's own; when that session is refused the recording
+  // waits in _compositionAVURLsToFinalize for a later close.
+  void _attemptToRunDeferredFinalizationOfCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL);
+  // Emits ExportingCompositionAVURLsChanged on the bus. Any thread.
+  void _postExportingCompositionAVURLsChanged();
+
   // Tests: the service's waiting state. Must be called on the service
   // serial queue.
   std::size_t closingSessionCountForTesting() const { return _closingSessions.size(); }
   std::size_t deferredAccessRequestCountForTesting() const {
     return _compositionAVURLsDeferredAccessRequestBlocksByAVURL.size();
   }
+  const std::vector<platform::URL>& compositionAVURLsToFinalizeForTesting() const {
+    return _compositionAVURLsToFinalize;
+  }
+  AssetExportController& assetExportController() { return *_assetExportController; }
   // How many connections hold the recording's fragment cleanup off.
   std::size_t orphanedFragmentCleanupHoldCount(const platform::URL& url) const;
 
@@ -239,6 +266,9 @@ class SavedRecordingService final : public platform::ListenerDelegate,
                                                AccessSessionHandler accessSessionHandler,
                                                bool cancelled);
   void _onQueueFinishClosingAccessSession(const std::shared_ptr<AssetAccessSession>& session);
+  // After a capture or trimming session closed normally: a recording left
+  // with fragments not yet composed gets a deferred finalization.
+  void _onQueueScheduleFinalizationAfterEditing(const std::shared_ptr<AssetAccessSession>& session);
   void _onQueueCleanUpOrphanedFragments(const platform::URL& compositionAVURL,
                                         const std::shared_ptr<AssetAccessSession>& ignored);
 
@@ -260,6 +290,7 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // Made by _init; its open and close on the service serial queue only:
   std::unique_ptr<AssetAccessSessionController> _assetSesionController;
   std::unique_ptr<platform::SignalSource> _signalDispatchSource;
+  std::shared_ptr<AssetExportController> _assetExportController;
   // Inside _serialQueue only:
   std::unordered_set<platform::URL> _compositionAVURLsBeingExported;
 

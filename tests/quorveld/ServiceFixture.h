@@ -83,12 +83,17 @@ class ServiceTest : public ::testing::Test {
     service_->serviceSerialQueue().sync([] {});
   }
   // Moves the clock and runs what is due on the main queue, including the
-  // service-queue work that the due timers start.
+  // service-queue work that the due timers start and the export operations
+  // that work queues, until the three queues have nothing left to hand on.
   void advance(std::chrono::nanoseconds by) {
     clock_.advance(by);
-    main_.runUntilIdle();
-    drainServiceQueue();
-    main_.runUntilIdle();
+    // Each round moves every chain of work one hop further; no chain in the
+    // service has more hops than this.
+    for (int round = 0; round < 12; ++round) {
+      main_.runUntilIdle();
+      drainServiceQueue();
+      service_->assetExportController().waitUntilAllOperationsAreFinishedForTesting();
+    }
   }
   std::vector<LogLine> lines() {
     std::lock_guard lock(mutex_);

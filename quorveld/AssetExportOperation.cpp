@@ -1,0 +1,141 @@
+// The export operations. Their lines log under the export controller's tag.
+#define QV_LOG_TAG "AssetExportController"
+#include "quorveld/AssetExportOperation.h"
+
+#include <fmt/format.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <memory>
+#include <semaphore>
+
+#include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/composition/RCCompositionController.h"
+#include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
+#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
+#include "Quorvel/waveform/RCWaveform.h"
+#include "platform/Log.h"
+
+namespace quorvel {
+
+namespace {
+
+// How often the waveform data source saves what it has so far, in seconds.
+constexpr double kWaveformSegmentFlushInterval = 30.0;
+
+}  // namespace
+
+AssetExportOperation::AssetExportOperation(platform::URL compositionAVURL)
+    : _compositionAVURL(std::move(compositionAVURL)) {}
+
+std::string AssetExportOperation::description() const {
+  return fmt::format("{} : {}", platform::Operation::description(), _compositionAVURL.path());
+}
+
+void AssetExportOperation::addExportClientCompletionBlock(ExportClientCompletionBlock block) {
+  if (block) _exportClientCompletionBlock.push_back(std::move(block));
+}
+
+void AssetExportOperation::invokeExportClientCompletionBlocks() {
+  for (auto& block : _exportClientCompletionBlock) block(_exportSuccess, _exportError);
+}
+
+void AssetExportOperation::main() {
+  if (auto failed = _firstDependencyError()) {
+    QV_LOG(platform::kLogLevelError,
+           "ERROR: Skipping {} because a dependency failed with error: {}", description(),
+           failed->description());
+    _exportSuccess = false;
+    _exportError = RCGenericErrorWithUnderlyingError(*failed);
+    return;
+  }
+  std::optional<platform::Error> error;
+  _exportSuccess = run(&error);
+  _exportError = error;
+  if (error) {
+    QV_LOG(platform::kLogLevelError, "ERROR: {} failed with error: {}", description(),
+           error->description());
+  }
+}
+
+bool AssetExportOperation::run(std::optional<platform::Error>* /*error*/) { return false; }
+
+std::optional<platform::Error> AssetExportOperation::_firstDependencyError() const {
+  for (const auto& dependency : dependencies()) {
+    auto* operation = dynamic_cast<const AssetExportOperation*>(dependency.get());
+    if (operation && !operation->exportSuccess()) {
+      return operation->exportError() ? *operation->exportError() : RCGenericError();
+    }
+  }
+  return std::nullopt;
+}
+
+bool CompositionExportOperation::run(std::optional<platform::Error>* error) {
+  auto controller =
+      RCCompositionController::compositionControllerForComposedAVURL(compositionAVURL());
+  auto composition = controller->composition();
+  if (!composition) {
+    // No bundle: nothing to finalize. A bundle that does not load is a
+    // failure, not a success that would hand out stale audio.
+    platform::URL bundle = RCComposition::compositionBundleURLForComposedAVURL(compositionAVURL());
+    if (::access(bundle.path().c_str(), F_OK) != 0) return true;
+    if (error) {
+      *error = RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorCompositionFailed);
+    }
+    return false;
+  }
+  if (composition->decomposedFragments().empty()) return true;
+
+  // The old waveform describes the old audio; a failure (none there) is fine.
+  (void)RCRemoveItemInSavedRecordingsDirectory(RCWaveform::waveformURLForAVURL(compositionAVURL()));
+  QV_LOG(platform::kLogLevelDebug, "RUNNING asset finalization operation: {}", description());
+
+  struct Outcome {
+    std::binary_semaphore done{0};
+    bool success = true;
+    std::optional<platform::Error> error;
+  };
+  auto outcome = std::make_shared<Outcome>();
+  controller->rcs_composeToFinalDestinationAndDeleteDecomposedFragments(
+      /*deleteFragments=*/false, /*composeWaveform=*/true,
+      /*canGenerateWaveformByProcessingAVURL=*/false, [outcome](bool success) {
+        outcome->success = success;
+        if (!success) {
+          outcome->error =
+              RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorCompositionFailed);
+        }
+        outcome->done.release();
+      });
+  outcome->done.acquire();
+
+  QV_LOG(platform::kLogLevelDebug, "FINISHED asset finalization operation: {}", description());
+  if (error) *error = outcome->error;
+  return outcome->success;
+}
+
+bool GenerateWaveformOperation::run(std::optional<platform::Error>* /*error*/) {
+  platform::URL waveformURL = RCWaveform::waveformURLForAVURL(compositionAVURL());
+  if (::access(waveformURL.path().c_str(), F_OK) == 0) return true;
+  // Waveforms are written only beside recordings' own regular audio files.
+  struct stat info {};
+  if (!RCIsURLDirectlyInsideDirectory(compositionAVURL(), RCSavedRecordingsDirectory()) ||
+      ::lstat(compositionAVURL().path().c_str(), &info) != 0 || !S_ISREG(info.st_mode)) {
+    QV_LOG(platform::kLogLevelError,
+           "ERROR: not computing a waveform for {}: it is not a regular file directly inside the "
+           "recordings directory",
+           compositionAVURL().path());
+    return false;
+  }
+  QV_LOG(platform::kLogLevelDebug, "RUNNING waveform compute operation: {}", description());
+  RCFileInputWaveformDataSource dataSource(compositionAVURL(), /*savesGeneratedWaveform=*/true,
+                                           kWaveformSegmentFlushInterval);
+  dataSource.beginLoading();
+  bool finished = dataSource.waitUntilFinished();
+  QV_LOG(platform::kLogLevelDebug, "FINISHED waveform compute operation: {}", description());
+  return finished;
+}
+
+}  // namespace quorvel
