@@ -101,6 +101,10 @@ std::size_t AssetExportController::pendingOperationCountForTesting() {
   return count;
 }
 
+void AssetExportController::setMaxConcurrentOperationCountForTesting(int count) {
+  _operationQueue.setMaxConcurrentOperationCount(count);
+}
+
 void AssetExportController::waitUntilAllOperationsAreFinishedForTesting() {
   _operationQueue.waitUntilAllOperationsAreFinished();
 }

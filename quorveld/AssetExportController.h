@@ -44,6 +44,9 @@ class AssetExportController : public std::enable_shared_from_this<AssetExportCon
 
   // Tests: operations pending (queued or running, not yet answered).
   std::size_t pendingOperationCountForTesting();
+  // Tests: 0 holds every operation back (requests still fold and queue);
+  // the default lets two run.
+  void setMaxConcurrentOperationCountForTesting(int count);
   // Tests: blocks until every queued operation has finished.
   void waitUntilAllOperationsAreFinishedForTesting();
 

@@ -26,61 +26,6 @@ constexpr const char* kConflict = "org.quorvel.SavedRecordingService.Error.Confl
 constexpr const char* kSuperseded =
     "org.quorvel.SavedRecordingService.Error.DeferredRequestSuperseded";
 
-class SessionTest : public ServiceTest {
- protected:
-  void SetUp() override {
-    directory_ = std::filesystem::temp_directory_path() /
-                 ("quorvel-sessions-" + std::to_string(::getpid()) + "-" +
-                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    std::filesystem::remove_all(directory_);
-    RCSetSavedRecordingsDirectory(directory_.string());
-    ASSERT_EQ(RCSavedRecordingsDirectory(), directory_.string());  // made on first use
-    ServiceTest::SetUp();
-    ASSERT_TRUE(service_->start());
-  }
-  void TearDown() override {
-    ServiceTest::TearDown();
-    RCSetSavedRecordingsDirectory(std::nullopt);
-    std::filesystem::remove_all(directory_);
-  }
-
-  std::string url(const std::string& name) const {
-    return platform::URL::fileURLWithPath((directory_ / name).string()).absoluteString();
-  }
-  std::shared_ptr<platform::LocalReply> prepare(const std::string& peer, const std::string& member,
-                                                const std::string& recording) {
-    return call(peer, member, {url(recording)});
-  }
-  // The token a granted prepare answered.
-  BusValue token(const std::shared_ptr<platform::LocalReply>& reply) {
-    EXPECT_TRUE(reply->waitFor(10s));
-    EXPECT_FALSE(reply->isError()) << reply->errorName();
-    return reply->isError() ? BusValue::structure({"", 0, "", ""}) : reply->values().at(0);
-  }
-  void end(const std::string& peer, const BusValue& token) {
-    call(peer, "EndAccessSession", {token}, /*noReply=*/true);
-  }
-  // Holds the service queue until the returned latch is counted down, so
-  // the calls delivered meanwhile queue up in a known order.
-  std::shared_ptr<std::latch> holdServiceQueue() {
-    auto gate = std::make_shared<std::latch>(1);
-    service_->serviceSerialQueue().async([gate] { gate->wait(); });
-    return gate;
-  }
-  template <class T>
-  T onServiceQueue(std::function<T()> read) {
-    T value{};
-    service_->serviceSerialQueue().sync([&] { value = read(); });
-    return value;
-  }
-  std::size_t openSessions() {
-    return onServiceQueue<std::size_t>(
-        [&] { return service_->assetSessionController().activeSessions().size(); });
-  }
-
-  std::filesystem::path directory_;
-};
-
 TEST_F(SessionTest, SharedSessionsCoexistAndExclusiveOnesAreRefused) {
   auto first = prepare(":1.1", "PrepareToPreview", "A.m4a");
   auto second = prepare(":1.2", "PrepareToPreview", "A.m4a");
@@ -194,15 +139,8 @@ TEST_F(SessionTest, AVanishedClientTakesItsSessionsAndItsWaitingRequestWithIt) {
 }
 
 TEST_F(SessionTest, HoldsKeepOrphanedFragmentsUntilTheLastOneIsReleased) {
-  auto model = RCSavedRecordingsModel::modelWithDirectory(directory_.string());
-  ASSERT_TRUE(model) << model.error();
-  auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, "Walk");
-  ASSERT_TRUE(editor) << editor.error();
-  std::string tone = (directory_ / "tone.wav").string();
-  ASSERT_TRUE(testing::writeTone(tone, 0.2, "wav"));
-  auto fragment = editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(tone));
-  ASSERT_TRUE(fragment) << fragment.error();
-  std::filesystem::remove(tone);
+  auto editor = makeRecording("Walk", {0.2});
+  ASSERT_TRUE(editor);
   const std::filesystem::path bundle = editor->composition()->bundleURL().path();
   auto stray = [&] { std::ofstream(bundle / "stray.m4a") << "audio"; };
   stray();
@@ -230,7 +168,8 @@ TEST_F(SessionTest, HoldsKeepOrphanedFragmentsUntilTheLastOneIsReleased) {
   settle();
   EXPECT_EQ(holds(), 0u);
   EXPECT_FALSE(std::filesystem::exists(bundle / "stray.m4a"));
-  EXPECT_TRUE(std::filesystem::exists(fragment->AVOutputURL().path()));
+  EXPECT_TRUE(
+      std::filesystem::exists(editor->composition()->fragments().front().AVOutputURL().path()));
   EXPECT_EQ(linesContaining("NOTE: cleaning (deleting) orphaned fragment '" +
                             (bundle / "stray.m4a").string() + "' no longer in use.")
                 .size(),

@@ -285,10 +285,10 @@ TEST_F(ServiceTest, LaunchEventsArePostedInProcessOnTheMainQueue) {
 }
 
 TEST_F(ServiceTest, TheDebugSignalDumpsTheRegistryOnTheMainQueue) {
-  testing::internal::CaptureStderr();
+  ::testing::internal::CaptureStderr();
   service_->_handleDebugSignal();
   main_.runUntilIdle();
-  std::string dump = testing::internal::GetCapturedStderr();
+  std::string dump = ::testing::internal::GetCapturedStderr();
   EXPECT_EQ(dump, fmt::format("[{}] *** No Active Sessions ***\n",
                               service_->assetSessionController().description()));
 }

@@ -6,18 +6,27 @@
 
 #include <gtest/gtest.h>
 
+#include <unistd.h>
+
 #include <chrono>
+#include <filesystem>
+#include <functional>
+#include <latch>
 #include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "Quorvel/composition/RCCompositionEditor.h"
+#include "Quorvel/database/RCSavedRecordingsModel.h"
+#include "Quorvel/files/RCRecordingsDirectory.h"
 #include "platform/Log.h"
 #include "platform/MainQueue.h"
 #include "platform/ProcessLifetime.h"
 #include "platform/dbus/LocalListener.h"
 #include "quorveld/RCSXPCTransactionController.h"
 #include "quorveld/SavedRecordingService.h"
+#include "tests/support/AudioFixtures.h"
 
 namespace quorvel {
 
@@ -117,6 +126,84 @@ class ServiceTest : public ::testing::Test {
   std::shared_ptr<platform::LocalListener> listener_;
   std::mutex mutex_;
   std::vector<LogLine> lines_;
+};
+
+// A started service on a recordings directory of its own, with helpers to
+// prepare and end sessions as peers and to read the service's state.
+class SessionTest : public ServiceTest {
+ protected:
+  void SetUp() override {
+    directory_ = std::filesystem::temp_directory_path() /
+                 ("quorvel-sessions-" + std::to_string(::getpid()) + "-" +
+                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
+    std::filesystem::remove_all(directory_);
+    RCSetSavedRecordingsDirectory(directory_.string());
+    ASSERT_EQ(RCSavedRecordingsDirectory(), directory_.string());  // made on first use
+    ServiceTest::SetUp();
+    ASSERT_TRUE(service_->start());
+  }
+  void TearDown() override {
+    ServiceTest::TearDown();
+    RCSetSavedRecordingsDirectory(std::nullopt);
+    std::filesystem::remove_all(directory_);
+  }
+
+  std::string url(const std::string& name) const {
+    return platform::URL::fileURLWithPath((directory_ / name).string()).absoluteString();
+  }
+  std::shared_ptr<platform::LocalReply> prepare(const std::string& peer, const std::string& member,
+                                                const std::string& recording) {
+    return call(peer, member, {url(recording)});
+  }
+  // The token a granted prepare answered.
+  BusValue token(const std::shared_ptr<platform::LocalReply>& reply) {
+    EXPECT_TRUE(reply->waitFor(10s));
+    EXPECT_FALSE(reply->isError()) << reply->errorName();
+    return reply->isError() ? BusValue::structure({"", 0, "", ""}) : reply->values().at(0);
+  }
+  void end(const std::string& peer, const BusValue& token) {
+    call(peer, "EndAccessSession", {token}, /*noReply=*/true);
+  }
+  // Holds the service queue until the returned latch is counted down, so
+  // the calls delivered meanwhile queue up in a known order.
+  std::shared_ptr<std::latch> holdServiceQueue() {
+    auto gate = std::make_shared<std::latch>(1);
+    service_->serviceSerialQueue().async([gate] { gate->wait(); });
+    return gate;
+  }
+  template <class T>
+  T onServiceQueue(std::function<T()> read) {
+    T value{};
+    service_->serviceSerialQueue().sync([&] { value = read(); });
+    return value;
+  }
+  // A recording in the database whose fragments are tones of the given
+  // lengths, not yet composed. Returns its editor (nullopt on failure, with
+  // the test failed).
+  std::optional<RCCompositionEditor> makeRecording(const std::string& title,
+                                                   std::initializer_list<double> fragmentSeconds) {
+    auto model = RCSavedRecordingsModel::modelWithDirectory(directory_.string());
+    EXPECT_TRUE(model) << model.error();
+    if (!model) return std::nullopt;
+    auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, title);
+    EXPECT_TRUE(editor) << editor.error();
+    if (!editor) return std::nullopt;
+    std::string tone = (directory_ / "tone.wav").string();
+    for (double seconds : fragmentSeconds) {
+      EXPECT_TRUE(testing::writeTone(tone, seconds, "wav"));
+      auto fragment = editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(tone));
+      EXPECT_TRUE(fragment) << fragment.error();
+      if (!fragment) return std::nullopt;
+    }
+    std::filesystem::remove(tone);
+    return std::move(*editor);
+  }
+  std::size_t openSessions() {
+    return onServiceQueue<std::size_t>(
+        [&] { return service_->assetSessionController().activeSessions().size(); });
+  }
+
+  std::filesystem::path directory_;
 };
 
 }  // namespace quorvel
