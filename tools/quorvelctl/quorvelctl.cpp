@@ -1,5 +1,6 @@
 // quorvelctl: talks to quorveld from the command line. One subcommand per
-// request of the service, plus `watch` for the exporting-set signal.
+// request of the service, `watch` for the exporting-set signal, and the
+// recording management an app does itself (`new`, `list`, `info`).
 //
 //   quorvelctl capture URL                 prints the token
 //   quorvelctl capture URL -- COMMAND...   holds the session while COMMAND
@@ -16,17 +17,21 @@
 #include <CLI/CLI.hpp>
 #include <nlohmann/json.hpp>
 
+#include <chrono>
 #include <condition_variable>
 #include <csignal>
 #include <cstdio>
+#include <future>
 #include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
+#include "tools/quorvelctl/Recordings.h"
 
 namespace {
 
@@ -39,6 +44,7 @@ constexpr int kExitUnreachable = 3;
 
 struct Globals {
   std::string busAddress;
+  std::string recordingsDirectory;
   bool json = false;
 };
 
@@ -112,6 +118,31 @@ void endSession(SavedRecordingServiceClient& client, const RCSSavedRecordingAcce
   (void)client.fetchExportingCompositionAVURLs();
 }
 
+// Runs a prepare request; an export may take minutes (it finalizes first), so
+// on a terminal it shows how long it has waited.
+template <class Request>
+auto waitShowingElapsedTime(bool show, Request request) {
+  auto pending = std::async(std::launch::async, std::move(request));
+  if (!show) return pending.get();
+  const auto start = std::chrono::steady_clock::now();
+  while (pending.wait_for(std::chrono::milliseconds(200)) != std::future_status::ready) {
+    std::chrono::duration<double> waited = std::chrono::steady_clock::now() - start;
+    std::fprintf(stderr, "\rwaiting for the export: %.1f s", waited.count());
+  }
+  std::fprintf(stderr, "\r\033[K");
+  return pending.get();
+}
+
+void printURLs(const Globals& globals, const std::vector<platform::URL>& urls) {
+  if (globals.json) {
+    nlohmann::json list = nlohmann::json::array();
+    for (const auto& url : urls) list.push_back(url.absoluteString());
+    std::printf("%s\n", nlohmann::json{{"compositionAVURLs", list}}.dump().c_str());
+  } else {
+    for (const auto& url : urls) std::printf("%s\n", url.absoluteString().c_str());
+  }
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -122,6 +153,8 @@ int main(int argc, char** argv) {
   app.add_option("--bus-address", globals.busAddress,
                  "D-Bus address of the daemon's bus (default: the session bus)");
   app.add_flag("--json", globals.json, "print results as JSON");
+  app.add_option("--recordings-dir", globals.recordingsDirectory,
+                 "the recordings directory for new, list and info (default: as quorveld's)");
 
   struct Prepare {
     const char* name;
@@ -168,7 +201,18 @@ int main(int argc, char** argv) {
       app.add_subcommand("enable-orphan-handling", "switch the orphan recovery run on (runs it)");
   auto* fetch =
       app.add_subcommand("fetch-exporting", "list the recordings whose export is being prepared");
-  auto* watch = app.add_subcommand("watch", "print a line each time the exporting set changes");
+  auto* watch = app.add_subcommand(
+      "watch", "print the exporting set each time it changes, until interrupted");
+
+  std::string title;
+  std::vector<std::string> files;
+  auto* make = app.add_subcommand("new", "make a recording from audio files (no daemon needed)");
+  make->add_option("title", title, "the recording's title")->required();
+  make->add_option("files", files, "its audio, in order")->required();
+  auto* list = app.add_subcommand("list", "list the recordings in the database");
+  std::string infoURL;
+  auto* info = app.add_subcommand("info", "show a recording's fragments and composed state");
+  info->add_option("url", infoURL, "the recording's composed audio file")->required();
 
   try {
     app.parse(argc, argv);
@@ -176,6 +220,13 @@ int main(int argc, char** argv) {
     int code = app.exit(e);
     return code == 0 ? 0 : kExitUsage;
   }
+
+  if (!globals.recordingsDirectory.empty()) {
+    quorvel::RCSetSavedRecordingsDirectory(globals.recordingsDirectory);
+  }
+  if (*make) return quorvelctl::newRecording(title, files, globals.json);
+  if (*list) return quorvelctl::listRecordings(globals.json);
+  if (*info) return quorvelctl::showRecording(infoURL, globals.json);
 
   auto connected = SavedRecordingServiceClient::connect(globals.busAddress);
   if (!connected) {
@@ -194,8 +245,11 @@ int main(int argc, char** argv) {
     std::string_view kind = prepare.name;
     auto token = kind == "capture"   ? client.prepareToCapture(*url)
                  : kind == "preview" ? client.prepareToPreview(*url)
-                 : kind == "export"  ? client.prepareToExport(*url, prepare.cacheWaveform)
-                                     : client.prepareToTrim(*url);
+                 : kind == "export"
+                     ? waitShowingElapsedTime(
+                           isatty(STDERR_FILENO) && !globals.json,
+                           [&] { return client.prepareToExport(*url, prepare.cacheWaveform); })
+                     : client.prepareToTrim(*url);
     if (!token) return reportError(globals, token.error());
     if (!prepare.command.empty()) {
       int status = runCommand(prepare.command);
@@ -253,29 +307,33 @@ int main(int argc, char** argv) {
   if (*fetch) {
     auto urls = client.fetchExportingCompositionAVURLs();
     if (!urls) return reportError(globals, urls.error());
-    if (globals.json) {
-      nlohmann::json list = nlohmann::json::array();
-      for (const auto& url : *urls) list.push_back(url.absoluteString());
-      std::printf("%s\n", nlohmann::json{{"compositionAVURLs", list}}.dump().c_str());
-    } else {
-      for (const auto& url : *urls) std::printf("%s\n", url.absoluteString().c_str());
-    }
+    printURLs(globals, *urls);
     return 0;
   }
 
   if (*watch) {
+    // The signal arrives on the client's bus thread, which must not wait
+    // for a reply itself: the main thread asks for the set.
     std::mutex mutex;
-    std::condition_variable never;
-    client.setExportingCompositionAVURLsChangedHandler([&globals] {
-      if (globals.json) {
-        std::printf("{\"signal\":\"ExportingCompositionAVURLsChanged\"}\n");
-      } else {
-        std::printf("ExportingCompositionAVURLsChanged\n");
-      }
-      std::fflush(stdout);
+    std::condition_variable changed;
+    int pending = 0;
+    client.setExportingCompositionAVURLsChangedHandler([&] {
+      std::lock_guard lock(mutex);
+      ++pending;
+      changed.notify_one();
     });
-    std::unique_lock lock(mutex);
-    never.wait(lock, [] { return false; });  // until interrupted
+    for (;;) {  // until interrupted
+      {
+        std::unique_lock lock(mutex);
+        changed.wait(lock, [&] { return pending > 0; });
+        pending = 0;
+      }
+      auto urls = client.fetchExportingCompositionAVURLs();
+      if (!urls) return reportError(globals, urls.error());
+      if (!globals.json) std::printf("exporting set changed: %zu recording(s)\n", urls->size());
+      printURLs(globals, *urls);
+      std::fflush(stdout);
+    }
   }
   return 0;
 }
