@@ -8,6 +8,8 @@
 #include <string>
 
 #include "Quorvel/service/SavedRecordingServiceClient.h"
+#include "Quorvel/waveform/RCWaveformFile.h"
+#include "tests/support/AudioFixtures.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/TestBus.h"
 
@@ -147,6 +149,38 @@ TEST_F(DaemonTest, AKilledClientsSessionsCloseAndTheRecordingIsFreed) {
   EXPECT_EQ(quorvelctl({"capture", recording, "--", "true"}).status, 0) << daemon->output();
   daemon->sendSignal(SIGUSR1);
   EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
+}
+
+// A recording made with quorvelctl from three files is exported with its
+// waveform over the bus: the composed file decodes to the fragments' length
+// within one AAC frame per join, and the waveform covers the same length.
+TEST_F(DaemonTest, AnExportComposesTheFragmentsAndCachesTheWaveform) {
+  auto daemon = startDaemon();
+  std::filesystem::create_directories(recordings_);
+  std::vector<std::string> made{"new", "--recordings-dir", recordings_.string(), "Walk"};
+  const double seconds[] = {1.5, 0.75, 1.0};
+  for (int i = 0; i < 3; ++i) {
+    std::string file = (recordings_ / ("take" + std::to_string(i) + ".wav")).string();
+    ASSERT_TRUE(testing::writeTone(file, seconds[i], "wav"));
+    made.push_back(file);
+  }
+  auto created = quorvelctl(made);
+  ASSERT_EQ(created.status, 0) << created.output;
+  const std::filesystem::path audio = recordings_ / "Walk.m4a";
+
+  auto exported = quorvelctl({"export", audio.string(), "--cache-waveform", "--", "true"});
+  ASSERT_EQ(exported.status, 0) << exported.output << daemon->output();
+  auto pcm = testing::decodeToPCM(audio.string());
+  ASSERT_TRUE(pcm) << pcm.error();
+  constexpr double kAACFrame = 1024.0 / 44100.0;  // the longer of the rates we write
+  EXPECT_NEAR(pcm->seconds(), 3.25, 2 * kAACFrame + 0.001);
+  auto waveform =
+      RCReadWaveformFile(platform::URL::fileURLWithPath((recordings_ / "Walk.waveform").string()));
+  ASSERT_TRUE(waveform) << waveform.error();
+  EXPECT_NEAR(double(waveform->length() * waveform->samplesPerPixel()) / waveform->sampleRate(),
+              pcm->seconds(), 0.05);
+  auto info = quorvelctl({"info", "--recordings-dir", recordings_.string(), audio.string()});
+  EXPECT_EQ(info.output.find("not composed"), std::string::npos) << info.output;
 }
 
 TEST_F(DaemonTest, ForeignClientsGetTheContractsErrors) {
