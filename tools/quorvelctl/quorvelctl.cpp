@@ -24,6 +24,7 @@
 #include <string>
 #include <vector>
 
+#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
@@ -115,6 +116,7 @@ void endSession(SavedRecordingServiceClient& client, const RCSSavedRecordingAcce
 }  // namespace
 
 int main(int argc, char** argv) {
+  quorvel::RCUseInProcessMediaEngine();  // recording management reads audio here
   Globals globals;
   CLI::App app{"quorvelctl: talk to the quorveld saved-recordings daemon", "quorvelctl"};
   app.require_subcommand(1);
