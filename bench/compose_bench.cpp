@@ -19,8 +19,10 @@ extern "C" {
 #include <libavformat/avformat.h>
 }
 
+#include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioDecoder.h"
 #include "Quorvel/media/RCComposer.h"
+#include "Quorvel/media/RCMediaWorkerClient.h"
 
 namespace fs = std::filesystem;
 
@@ -105,6 +107,19 @@ int main() {
       std::exit(1);
     }
   });
+  // The same job as the daemon runs it: through a quorvel-media worker.
+  quorvel::RCSetSavedRecordingsDirectory(work.string());
+  quorvel::RCMediaWorkerClient::Options options;
+  options.workerPath = std::string(QUORVEL_BINARY_DIR) + "/bin/quorvel-media";
+  options.extraSandboxDirectories = {cache.string()};
+  quorvel::RCMediaWorkerClient worker(options);
+  const double viaWorker = bestOf(3, [&] {
+    if (auto status = worker.compose(segments, composed, std::nullopt, {}); !status) {
+      std::fprintf(stderr, "compose through the worker failed: %s\n",
+                   status.error().description().c_str());
+      std::exit(1);
+    }
+  });
   const double tool = bestOf(3, [&] {
     run("ffmpeg -v error -y -f concat -safe 0 -i '" + (work / "list.txt").string() + "' -c copy '" +
         (work / "tool.m4a").string() + "'");
@@ -114,6 +129,10 @@ int main() {
   std::printf("compose 3 x 20 min AAC, stream copy: %.3f s\n", ours);
   std::printf("ffmpeg -f concat -c copy:              %.3f s\n", tool);
   std::printf("ratio: %.3f (target <= 0.5)\n", ours / tool);
+  std::printf(
+      "the same through the quorvel-media worker: %.3f s; worker / in-process ratio %.3f "
+      "(target <= 1.1)\n",
+      viaWorker, viaWorker / ours);
   std::printf(
       "composed container duration %.4f s, decoded %.4f s, difference %.1f ms "
       "(one AAC frame = %.1f ms; 2 joins)\n",

@@ -18,6 +18,7 @@
 #include <thread>
 #include <vector>
 
+#include "bench/MappedLibraries.h"
 #include "tests/support/TestBus.h"
 
 extern char** environ;
@@ -83,6 +84,7 @@ int main(int argc, char** argv) {
 
   std::vector<double> startMillis;
   std::vector<long> idleKilobytes;
+  int libraries = 0;
   for (int run = 0; run < runs; ++run) {
     {
       std::lock_guard lock(mutex);
@@ -106,6 +108,7 @@ int main(int argc, char** argv) {
     // Past the start-up keep-alive periods: the daemon is idle.
     std::this_thread::sleep_for(std::chrono::milliseconds(2500));
     idleKilobytes.push_back(residentKilobytes(pid));
+    libraries = quorvel::bench::mappedSharedLibraries(pid);
     kill(pid, SIGTERM);
     waitpid(pid, nullptr, 0);
   }
@@ -117,6 +120,7 @@ int main(int argc, char** argv) {
       "exec to name owned: median %.1f ms (min %.1f, max %.1f) over %d runs; target <= 100 ms\n",
       medianStart, startMillis.front(), startMillis.back(), runs);
   std::printf("idle resident memory: median %.1f MB; target <= 15 MB\n", medianMB);
+  std::printf("shared libraries mapped by the idle daemon: %d\n", libraries);
   std::printf("ratios to targets: start-up %.2f, memory %.2f\n", medianStart / 100.0,
               medianMB / 15.0);
   std::filesystem::remove_all(recordings);
