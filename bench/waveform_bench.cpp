@@ -83,8 +83,11 @@ int main() {
       }
     };
   };
-  const double jobInProcess = bestOf(3, job(inProcess));
-  const double jobViaWorker = bestOf(3, job(worker));
+  double jobInProcess = 1e9, jobViaWorker = 1e9;
+  for (int round = 0; round < 3; ++round) {  // alternating: the same machine for both
+    jobInProcess = std::min(jobInProcess, bestOf(1, job(inProcess)));
+    jobViaWorker = std::min(jobViaWorker, bestOf(1, job(worker)));
+  }
   const double tool =
       bestOf(3, [&] { run("ffmpeg -v error -threads 1 -i '" + audio.string() + "' -f null -"); });
 
