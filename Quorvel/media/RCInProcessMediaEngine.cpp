@@ -108,7 +108,7 @@ class ProgressThrottle {
 
 platform::Result<RCMediaProbe> RCInProcessMediaEngine::probe(const platform::URL& url) {
   RCInstallFFmpegLogging();
-  const std::string path = url.path();
+  const std::string& path = url.path();
   auto input = openInput(path);
   if (!input) return platform::fail(input.error());
   RCMediaProbe probe;

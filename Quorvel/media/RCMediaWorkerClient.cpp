@@ -186,6 +186,7 @@ platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClie
     arguments.push_back("--allow=" + directory);
   }
   std::vector<char*> argv;
+  argv.reserve(arguments.size() + 1);
   for (std::string& argument : arguments) argv.push_back(argument.data());
   argv.push_back(nullptr);
 
