@@ -207,6 +207,10 @@ int main(int argc, char** argv) {
   platform::setLogIdentifier("quorvel-media");
   platform::logInitialize();
 
+  // Sent before the sandbox: the journal's socket opens with the first line,
+  // and the confined process may not create sockets.
+  QV_LOG(platform::kLogLevelNotice, "quorvel-media {} serving media jobs for {}", ::getpid(),
+         options.parentPid);
 #ifdef QUORVEL_MEDIA_HAS_SANDBOX
   {
     platform::SandboxPolicy policy;
@@ -217,7 +221,7 @@ int main(int argc, char** argv) {
 #else
     policy.addressSpaceLimitBytes = std::uint64_t(4) << 30;
 #endif
-    QV_LOG(platform::kLogLevelNotice, "quorvel-media sandbox: {}", platform::applySandbox(policy));
+    QV_LOG(platform::kLogLevelNotice, "quorvel-media {}", platform::applySandbox(policy));
   }
 #else
   QV_LOG(platform::kLogLevelDebug, "quorvel-media: built without a sandbox");
