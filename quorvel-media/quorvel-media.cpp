@@ -38,7 +38,7 @@
 #include "Quorvel/media/RCMediaProtocol.h"
 #include "platform/Log.h"
 
-#if __has_include("platform/Sandbox.h")
+#if QUORVEL_MEDIA_SANDBOX && __has_include("platform/Sandbox.h")
 #include "platform/Sandbox.h"
 #define QUORVEL_MEDIA_HAS_SANDBOX 1
 #endif

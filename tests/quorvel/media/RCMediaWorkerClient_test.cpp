@@ -119,8 +119,8 @@ TEST_F(MediaWorkerClientTest, EveryJobGivesWhatTheInProcessEngineGives) {
   EXPECT_NEAR(composedWaveform->durationSeconds(), 1.5, 0.01);
 
   // The waveform job writes what the in-process engine writes.
-  platform::URL viaWorker = platform::URL::fileURLWithPath(path("worker.waveform"));
-  platform::URL viaProcess = platform::URL::fileURLWithPath(path("process.waveform"));
+  platform::URL viaWorker = platform::URL::fileURLWithPath(recordingsPath("worker.waveform"));
+  platform::URL viaProcess = platform::URL::fileURLWithPath(recordingsPath("process.waveform"));
   fractions.clear();
   ASSERT_TRUE(engine.buildWaveform(titled, viaWorker,
                                    [&](double fraction) { fractions.push_back(fraction); }));
