@@ -275,8 +275,8 @@ platform::Result<RCMediaReply> RCMediaDecodeReply(std::string_view text) {
     }
     return reply;
   } catch (const Malformed& malformed) {
-    return platform::fail(RCMediaError(RCMediaErrorCodeWorkerFailed,
-                                       "malformed reply from quorvel-media: " + malformed.what));
+    return platform::fail(
+        RCMediaError(RCMediaErrorCodeWorkerFailed, "malformed reply: " + malformed.what));
   }
 }
 

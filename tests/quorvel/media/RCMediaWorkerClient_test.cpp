@@ -311,5 +311,46 @@ TEST_F(MediaWorkerClientTest, ManyThreadsShareTwoWorkersAndJobsCrossingAnIdleExi
   EXPECT_GE(mostWorkers.load(), 1u);
 }
 
+// Stand-ins for a broken or compromised worker, as shell scripts on the
+// worker's socket (descriptor 3): whatever they send, the job fails with
+// what went wrong and the stand-in is ended.
+TEST_F(MediaWorkerClientTest, AWorkerThatBreaksTheProtocolFailsItsJobWithWhatItDid) {
+  platform::URL file = tone("short.wav", 0.2);
+  auto fake = [&](const std::string& name, const std::string& script) {
+    std::string program = path(name);
+    testing::writeFile(program, "#!/bin/sh\n" + script + "\n");
+    fs::permissions(program, fs::perms::owner_all);
+    auto configured = options();
+    configured.workerPath = program;
+    return configured;
+  };
+  struct Case {
+    std::string name, script, error;
+  };
+  std::vector<Case> cases = {
+      // A frame of 2 GiB is refused from its header alone.
+      {"huge", R"(printf '\000\000\000\200' >&3; exec cat <&3 >/dev/null)",
+       "quorvel-media broke the protocol while probing short.wav: a frame of 2147483648 bytes "
+       "exceeds the limit"},
+      {"foreign", R"(printf '\024\000\000\000{"id":9,"result":{}}' >&3; exec cat <&3 >/dev/null)",
+       "quorvel-media broke the protocol while probing short.wav: a reply to another request"},
+      {"garbage", R"(printf '\004\000\000\000{]}x' >&3; exec cat <&3 >/dev/null)",
+       "quorvel-media broke the protocol while probing short.wav: malformed reply"},
+      {"crashing", "exit 3", "quorvel-media exited with status 3 while probing short.wav"},
+      // Exiting as an idle worker does is retried, but not for ever.
+      {"quitting", "exit 0", "quorvel-media exited with status 0 while probing short.wav"},
+  };
+  for (const Case& broken : cases) {
+    SCOPED_TRACE(broken.name);
+    RCMediaWorkerClient client(fake(broken.name, broken.script));
+    auto probe = client.probe(file);
+    ASSERT_FALSE(probe);
+    EXPECT_EQ(probe.error(), RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
+    EXPECT_TRUE(probe.error().localizedDescription().starts_with(broken.error))
+        << probe.error().localizedDescription();
+    EXPECT_TRUE(client.workerPids().empty());
+  }
+}
+
 }  // namespace
 }  // namespace quorvel
