@@ -352,5 +352,31 @@ TEST_F(MediaWorkerClientTest, AWorkerThatBreaksTheProtocolFailsItsJobWithWhatItD
   }
 }
 
+// The worker's FFmpeg opens only the containers recordings use: a valid
+// audio file of another format, which an app reads, is refused there.
+TEST_F(MediaWorkerClientTest, TheWorkerOpensOnlyTheFormatsRecordingsUse) {
+  // A Sun audio file: 24-byte big-endian header, then 0.1 s of 16-bit PCM.
+  auto be32 = [](std::uint32_t value) {
+    return std::string{char(value >> 24), char(value >> 16), char(value >> 8), char(value)};
+  };
+  const std::uint32_t bytes = 1600;
+  std::string au = ".snd" + be32(24) + be32(bytes) + be32(3) + be32(8000) + be32(1);
+  au += std::string(bytes, '\0');
+  testing::writeFile(recordingsPath("sun.au"), au);
+  platform::URL file = platform::URL::fileURLWithPath(recordingsPath("sun.au"));
+
+  auto inProcess = inProcess_.probe(file);
+  ASSERT_TRUE(inProcess) << inProcess.error();
+  EXPECT_TRUE(inProcess->playable);
+  ScopedMediaWorkerEngine worker(options());
+  auto confined = worker.client().probe(file);
+  ASSERT_FALSE(confined);
+  EXPECT_EQ(confined.error().domain(), kRCAudioAssetErrorDomain);
+  // The allowed formats still open there.
+  auto wav = worker.client().probe(tone("fine.wav", 0.1));
+  ASSERT_TRUE(wav) << wav.error();
+  EXPECT_TRUE(wav->playable);
+}
+
 }  // namespace
 }  // namespace quorvel
