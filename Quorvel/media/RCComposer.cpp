@@ -81,9 +81,14 @@ class Progress {
   }
   // `seconds` into the used range of `input`, which follows every segment
   // finished before.
-  void at(const Input& input, double seconds) const {
+  // Reports in steps of a thousandth at most: it runs once per packet.
+  void at(const Input& input, double seconds) {
     if (!report_ || !(total_ > 0)) return;
-    report_((done_ + std::clamp(seconds, 0.0, input.segment.contentDuration)) / total_);
+    const double fraction =
+        (done_ + std::clamp(seconds, 0.0, input.segment.contentDuration)) / total_;
+    if (fraction < reported_ + 0.001 && fraction < 1) return;
+    reported_ = fraction;
+    report_(fraction);
   }
   void finished(const Input& input) { done_ += input.segment.contentDuration; }
 
@@ -91,6 +96,7 @@ class Progress {
   const RCComposerProgress& report_;
   double total_ = 0;
   double done_ = 0;
+  double reported_ = -1;
 };
 
 std::string lowercase(std::string text) {
@@ -163,7 +169,7 @@ class StreamCopier {
     return {};
   }
 
-  platform::Status copy(Input& input, bool isFirst, const Progress& progress) {
+  platform::Status copy(Input& input, bool isFirst, Progress& progress) {
     RCAudioDecoder& decoder = *input.decoder;
     const AVRational streamBase = decoder.stream()->time_base;
     const AVRational base{1, rate_};
@@ -429,7 +435,7 @@ class Converter {
 };
 
 platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder, RCWaveformBuilder* waveform,
-                                 const Progress& progress) {
+                                 Progress& progress) {
   RCAudioDecoder& decoder = *input.decoder;
   if (auto opened = decoder.openCodec(); !opened) return opened;
   Converter converter(encoder, waveform);
