@@ -76,7 +76,7 @@ int mappedLibraryCount(pid_t pid) {
     auto slash = line.find('/');
     if (slash == std::string::npos) continue;
     std::string path = line.substr(slash);
-    if (path.find(".so") != std::string::npos) libraries.insert(path);
+    if (path.find(".so", path.rfind('/')) != std::string::npos) libraries.insert(path);
   }
   return static_cast<int>(libraries.size());
 }

@@ -9,6 +9,9 @@
 #include <functional>
 #include <string>
 
+#include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "Quorvel/media/RCMediaWorkerClient.h"
 #include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 
 namespace fs = std::filesystem;
@@ -64,12 +67,37 @@ int main() {
     }
     pixels = dataSource.waveform().length();
   });
+  // The waveform job in process and through a quorvel-media worker, as the
+  // daemon runs it.
+  quorvel::RCSetSavedRecordingsDirectory(work.string());
+  quorvel::RCMediaWorkerClient::Options options;
+  options.workerPath = std::string(QUORVEL_BINARY_DIR) + "/bin/quorvel-media";
+  quorvel::RCMediaWorkerClient worker(options);
+  quorvel::RCInProcessMediaEngine inProcess;
+  const auto destination = platform::URL::fileURLWithPath((work / "job.waveform").string());
+  auto job = [&](quorvel::RCMediaEngine& engine) {
+    return [&] {
+      if (auto status = engine.buildWaveform(url, destination, {}); !status) {
+        std::fprintf(stderr, "waveform job failed: %s\n", status.error().description().c_str());
+        std::exit(1);
+      }
+    };
+  };
+  double jobInProcess = 1e9, jobViaWorker = 1e9;
+  for (int round = 0; round < 3; ++round) {  // alternating: the same machine for both
+    jobInProcess = std::min(jobInProcess, bestOf(1, job(inProcess)));
+    jobViaWorker = std::min(jobViaWorker, bestOf(1, job(worker)));
+  }
   const double tool =
       bestOf(3, [&] { run("ffmpeg -v error -threads 1 -i '" + audio.string() + "' -f null -"); });
 
   std::printf("waveform of 20 min AAC (saved every 30 s, %zu pixels): %.3f s\n", pixels, ours);
   std::printf("ffmpeg -threads 1 -i FILE -f null -:               %.3f s\n", tool);
   std::printf("ratio: %.3f (target <= 1.1)\n", ours / tool);
+  std::printf(
+      "waveform job in process: %.3f s, through the quorvel-media worker: %.3f s; "
+      "worker / in-process ratio %.3f (target <= 1.1)\n",
+      jobInProcess, jobViaWorker, jobViaWorker / jobInProcess);
   fs::remove_all(work);
   return 0;
 }

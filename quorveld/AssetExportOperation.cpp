@@ -14,19 +14,12 @@
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
-#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "platform/Log.h"
 
 namespace quorvel {
-
-namespace {
-
-// How often the waveform data source saves what it has so far, in seconds.
-constexpr double kWaveformSegmentFlushInterval = 30.0;
-
-}  // namespace
 
 AssetExportOperation::AssetExportOperation(platform::URL compositionAVURL)
     : _compositionAVURL(std::move(compositionAVURL)) {}
@@ -130,10 +123,14 @@ bool GenerateWaveformOperation::run(std::optional<platform::Error>* /*error*/) {
     return false;
   }
   QV_LOG(platform::kLogLevelDebug, "RUNNING waveform compute operation: {}", description());
-  RCFileInputWaveformDataSource dataSource(compositionAVURL(), /*savesGeneratedWaveform=*/true,
-                                           kWaveformSegmentFlushInterval);
-  dataSource.beginLoading();
-  bool finished = dataSource.waitUntilFinished();
+  // The media worker decodes the audio and replaces the waveform file whole.
+  platform::Status built =
+      RCMediaEngine::current()->buildWaveform(compositionAVURL(), waveformURL, {});
+  if (!built) {
+    QV_LOG(platform::kLogLevelError, "ERROR: computing the waveform of {} failed: {}",
+           compositionAVURL().lastPathComponent(), built.error().description());
+  }
+  bool finished = static_cast<bool>(built);
   QV_LOG(platform::kLogLevelDebug, "FINISHED waveform compute operation: {}", description());
   return finished;
 }

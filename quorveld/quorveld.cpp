@@ -11,6 +11,7 @@
 #include <string>
 
 #include "Quorvel/database/RCSavedRecordingsModel.h"
+#include "Quorvel/media/RCMediaWorkerClient.h"
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "platform/Log.h"
 #include "platform/MainQueue.h"
@@ -82,6 +83,8 @@ int main(int argc, char** argv) {
   platform::logInitialize();
   if (options.verbose) platform::setLogThreshold(platform::kLogLevelDebug);
   QV_LOG(platform::kLogLevelDebug, "Starting xpc service");
+  // Audio files are parsed only in quorvel-media worker processes.
+  quorvel::RCMediaEngine::setCurrent(std::make_shared<quorvel::RCMediaWorkerClient>());
 
   if (!options.recordingsDirectory.empty()) {
     quorvel::RCSavedRecordingsModel::setSavedRecordingsDirectory(options.recordingsDirectory);

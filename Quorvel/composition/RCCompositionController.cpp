@@ -17,18 +17,27 @@
 // atomically), then the manifest that says the fragments are composed. A
 // crash in between leaves fragments marked decomposed beside an up-to-date
 // composed file, which the next finalization simply composes again.
+//
+// The composing itself runs in the process's media engine: in the daemon, a
+// worker process that may be killed mid-job. Its temporary output (a hidden
+// ".<name>.<random>.tmp" beside the composed file and beside the waveform)
+// would then stay behind, so every compose first removes such leftovers of
+// its own destinations. Only one compose of a composition runs at a time, so
+// no temporary file of a running job can be taken for a leftover.
 #include "Quorvel/composition/RCCompositionController.h"
 
+#include <dirent.h>
 #include <sys/stat.h>
 
 #include <cmath>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioAsset.h"
-#include "Quorvel/media/RCComposer.h"
+#include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "platform/GlobalQueue.h"
 #include "platform/Log.h"
@@ -52,6 +61,28 @@ FileState fileState(const platform::URL& url) {
 double fileDuration(const platform::URL& url) {
   auto asset = RCAudioAsset::assetWithURL(url);
   return asset ? asset->duration() : std::nan("");
+}
+
+// Removes temporary files an interrupted replacement of `destination` left.
+void removeLeftoverTemporaryFiles(const platform::URL& destination) {
+  const platform::URL directory = destination.URLByDeletingLastPathComponent();
+  const std::string prefix = "." + destination.lastPathComponent() + ".";
+  std::vector<std::string> leftovers;
+  if (DIR* listing = ::opendir(directory.path().c_str())) {
+    while (const dirent* entry = ::readdir(listing)) {
+      std::string_view name = entry->d_name;
+      if (name.starts_with(prefix) && RCIsAtomicReplaceTempName(name)) {
+        leftovers.emplace_back(name);
+      }
+    }
+    ::closedir(listing);
+  }
+  for (const std::string& name : leftovers) {
+    platform::URL url = directory.URLByAppendingPathComponent(name);
+    if (auto removed = RCRemoveItemInSavedRecordingsDirectory(url); removed) {
+      QV_LOG(platform::kLogLevelNotice, "NOTE: removed {}, left by an interrupted compose", name);
+    }
+  }
 }
 
 RCCompositionManifest repairedManifest(const RCComposition& composition) {
@@ -179,7 +210,12 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
   platform::URL destination = current->composedAVURL();
   std::optional<platform::URL> waveform;
   if (composeWaveform) waveform = RCWaveform::waveformURLForAVURL(destination);
-  if (auto composed = RCComposeAudio(segments, destination, waveform); !composed) return composed;
+  removeLeftoverTemporaryFiles(destination);
+  if (waveform) removeLeftoverTemporaryFiles(*waveform);
+  if (auto composed = RCMediaEngine::current()->compose(segments, destination, waveform, {});
+      !composed) {
+    return composed;
+  }
 
   for (RCCompositionManifestFragment& entry : manifest.fragments) entry.composed = true;
   manifest.recomputeTimeRanges();

@@ -13,7 +13,7 @@
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioAsset.h"
-#include "Quorvel/media/RCMP4Atoms.h"
+#include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "platform/Log.h"
 #include "platform/UUID.h"
@@ -321,7 +321,7 @@ platform::Status RCCompositionEditor::setTitle(RCSavedRecordingsModel& model, st
   if (auto saved = model.saveIfNecessary(); !saved) return saved;
   platform::URL composed = composition_->composedAVURL();
   if (composed.pathExtension() == "m4a" && exists(composed.path())) {
-    if (auto written = RCMP4WriteTitle(composed.path(), title, ""); !written) {
+    if (auto written = RCMediaEngine::current()->writeTitle(composed, title, ""); !written) {
       QV_LOG(platform::kLogLevelError, "WARNING: cannot write the title into {}: {}",
              composed.lastPathComponent(), written.error().localizedDescription());
     }

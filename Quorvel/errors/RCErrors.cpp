@@ -1,9 +1,5 @@
 #include "Quorvel/errors/RCErrors.h"
 
-extern "C" {
-#include <libavutil/error.h>
-}
-
 namespace quorvel {
 
 namespace {
@@ -24,12 +20,6 @@ platform::Error RCGenericErrorWithUnderlyingError(const platform::Error& underly
 
 platform::Error RCMediaError(RCMediaErrorCode code, std::string description) {
   return platform::Error(kRCMediaErrorDomain, code, std::move(description));
-}
-
-platform::Error RCMediaErrorFromAV(RCMediaErrorCode code, int averror, std::string_view what) {
-  char text[AV_ERROR_MAX_STRING_SIZE] = {};
-  av_strerror(averror, text, sizeof text);
-  return RCMediaError(code, fmt::format("{}: {}", what, text));
 }
 
 }  // namespace quorvel

@@ -75,10 +75,14 @@ enum RCMediaErrorCode : long {
   RCMediaErrorCodeFileSystem = 8,
   // A waveform file that is not a valid waveform.
   RCMediaErrorCodeCorruptWaveform = 9,
+  // The media worker could not run the job: it cannot be started, died,
+  // stalled or broke the protocol (or no media engine is installed).
+  RCMediaErrorCodeWorkerFailed = 10,
 };
 
 platform::Error RCMediaError(RCMediaErrorCode code, std::string description);
 // An error for a negative FFmpeg result `averror`, described as "<what>: <FFmpeg's text>".
+// Defined in libquorvel-media (RCFFmpegLogging.cpp), with the rest of the FFmpeg code.
 platform::Error RCMediaErrorFromAV(RCMediaErrorCode code, int averror, std::string_view what);
 
 // ---- MP4 atom reading and title writing ----

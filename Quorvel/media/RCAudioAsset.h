@@ -1,9 +1,10 @@
-// RCAudioAsset: an audio file opened with libavformat, for its duration and
-// its common metadata (titles and creation date).
+// RCAudioAsset: an audio file, for its duration and its common metadata
+// (titles and creation date), read through the process's media engine
+// (RCMediaEngine.h), so in the daemon the file is parsed by the media worker.
 //
-// assetWithURL opens the file once to read its streams and duration and
-// closes it again; the asset holds no file open afterwards. Metadata loads
-// asynchronously on RCAssetMetadataLoader's worker, which re-reads the file.
+// assetWithURL probes the file once for its streams and duration; the asset
+// holds no file open afterwards. Metadata loads asynchronously on
+// RCAssetMetadataLoader's worker, which probes the file again.
 // Immutable after creation: every member may be used from any thread.
 #pragma once
 

@@ -9,6 +9,7 @@ extern "C" {
 
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
+#include "Quorvel/media/RCMediaInput.h"
 
 namespace quorvel {
 
@@ -25,7 +26,7 @@ platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const pla
   RCInstallFFmpegLogging();
   const std::string name = url.lastPathComponent();
   AVFormatContext* format = nullptr;
-  int result = avformat_open_input(&format, url.path().c_str(), nullptr, nullptr);
+  int result = RCOpenMediaInput(&format, url.path().c_str());
   if (result < 0)
     return platform::fail(
         RCMediaErrorFromAV(RCMediaErrorCodeCannotOpen, result, "cannot open " + name));

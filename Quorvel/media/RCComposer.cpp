@@ -72,6 +72,33 @@ struct Input {
   std::unique_ptr<RCAudioDecoder> decoder;
 };
 
+// Reports how much of the segments' total length has been composed.
+class Progress {
+ public:
+  Progress(const RCComposerProgress& report, const std::vector<RCComposerSegment>& segments)
+      : report_(report) {
+    for (const RCComposerSegment& segment : segments) total_ += segment.contentDuration;
+  }
+  // `seconds` into the used range of `input`, which follows every segment
+  // finished before.
+  // Reports in steps of a thousandth at most: it runs once per packet.
+  void at(const Input& input, double seconds) {
+    if (!report_ || !(total_ > 0)) return;
+    const double fraction =
+        (done_ + std::clamp(seconds, 0.0, input.segment.contentDuration)) / total_;
+    if (fraction < reported_ + 0.001 && fraction < 1) return;
+    reported_ = fraction;
+    report_(fraction);
+  }
+  void finished(const Input& input) { done_ += input.segment.contentDuration; }
+
+ private:
+  const RCComposerProgress& report_;
+  double total_ = 0;
+  double done_ = 0;
+  double reported_ = -1;
+};
+
 std::string lowercase(std::string text) {
   std::transform(text.begin(), text.end(), text.begin(),
                  [](unsigned char c) { return char(std::tolower(c)); });
@@ -142,7 +169,7 @@ class StreamCopier {
     return {};
   }
 
-  platform::Status copy(Input& input, bool isFirst) {
+  platform::Status copy(Input& input, bool isFirst, Progress& progress) {
     RCAudioDecoder& decoder = *input.decoder;
     const AVRational streamBase = decoder.stream()->time_base;
     const AVRational base{1, rate_};
@@ -190,6 +217,7 @@ class StreamCopier {
         }
       }
       reachedEnd = pts + duration;
+      progress.at(input, double(pts - start) / rate_);
       if (auto sent = push(packet.get(), duration, end - pts); !sent) return sent;
     }
     if (!inRange) return platform::fail(truncatedError(input, 0.0));
@@ -284,14 +312,15 @@ class StreamCopier {
 
 platform::Status composeByCopy(std::vector<Input>& inputs, const std::string& path,
                                const std::string& extension, RCWaveformBuilder* waveform,
-                               double* composedSeconds) {
+                               Progress& progress, double* composedSeconds) {
   const AVCodecParameters* parameters = inputs.front().decoder->codecParameters();
   auto output = RCAudioOutput::open(path, extension, parameters);
   if (!output) return platform::fail(output.error());
   StreamCopier copier(**output, parameters, waveform);
   if (auto opened = copier.openWaveformDecoder(parameters); !opened) return opened;
   for (std::size_t i = 0; i < inputs.size(); ++i) {
-    if (auto copied = copier.copy(inputs[i], i == 0); !copied) return copied;
+    if (auto copied = copier.copy(inputs[i], i == 0, progress); !copied) return copied;
+    progress.finished(inputs[i]);
   }
   if (auto finished = copier.finish(); !finished) return finished;
   *composedSeconds = copier.composedSeconds();
@@ -405,8 +434,8 @@ class Converter {
   int capacity_ = 0;
 };
 
-platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder,
-                                 RCWaveformBuilder* waveform) {
+platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder, RCWaveformBuilder* waveform,
+                                 Progress& progress) {
   RCAudioDecoder& decoder = *input.decoder;
   if (auto opened = decoder.openCodec(); !opened) return opened;
   Converter converter(encoder, waveform);
@@ -429,6 +458,7 @@ platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder,
     const std::int64_t from = std::max(position, start);
     const std::int64_t to = std::min(position + frame->nb_samples, end);
     position += frame->nb_samples;
+    progress.at(input, double(position) / rate - input.segment.contentStart);
     if (to > from)
       return converter.push(frame, int(from - (position - frame->nb_samples)), int(to - from));
     return {};
@@ -451,12 +481,14 @@ platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder,
 platform::Status composeByReencoding(std::vector<Input>& inputs, const std::string& path,
                                      const std::string& extension,
                                      std::unique_ptr<RCWaveformBuilder>* waveform,
-                                     double* composedSeconds) {
+                                     Progress& progress, double* composedSeconds) {
   auto encoder = RCAudioEncoder::open(path, extension, inputs.front().decoder->codecParameters());
   if (!encoder) return platform::fail(encoder.error());
   if (*waveform) *waveform = std::make_unique<RCWaveformBuilder>((*encoder)->sampleRate());
   for (Input& input : inputs) {
-    if (auto done = reencodeSegment(input, **encoder, waveform->get()); !done) return done;
+    if (auto done = reencodeSegment(input, **encoder, waveform->get(), progress); !done)
+      return done;
+    progress.finished(input);
   }
   if (auto finished = (*encoder)->finish(); !finished) return finished;
   *composedSeconds = double((*encoder)->framesWritten()) / (*encoder)->sampleRate();
@@ -485,7 +517,9 @@ platform::Status validate(const std::vector<RCComposerSegment>& segments,
 
 platform::Status compose(const std::vector<RCComposerSegment>& segments,
                          const platform::URL& destination,
-                         const std::optional<platform::URL>& waveformDestination) {
+                         const std::optional<platform::URL>& waveformDestination,
+                         const RCComposerProgress& report) {
+  Progress progress(report, segments);
   const std::string extension = lowercase(destination.pathExtension());
   if (auto valid = validate(segments, destination, extension); !valid) return valid;
 
@@ -507,11 +541,13 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
     if (waveformDestination)
       waveform = std::make_unique<RCWaveformBuilder>(
           inputs.front().decoder->codecParameters()->sample_rate);
-    composed = composeByCopy(inputs, file->tempPath(), extension, waveform.get(), &seconds);
+    composed =
+        composeByCopy(inputs, file->tempPath(), extension, waveform.get(), progress, &seconds);
   } else {
     // The builder is created once the output's rate is known.
     if (waveformDestination) waveform = std::make_unique<RCWaveformBuilder>(1);
-    composed = composeByReencoding(inputs, file->tempPath(), extension, &waveform, &seconds);
+    composed =
+        composeByReencoding(inputs, file->tempPath(), extension, &waveform, progress, &seconds);
   }
   if (!composed) return composed;
 
@@ -538,11 +574,12 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
 
 platform::Status RCComposeAudio(const std::vector<RCComposerSegment>& segments,
                                 const platform::URL& destination,
-                                const std::optional<platform::URL>& waveformDestination) {
+                                const std::optional<platform::URL>& waveformDestination,
+                                const RCComposerProgress& progress) {
   RCInstallFFmpegLogging();
   QV_LOG(platform::kLogLevelDebug, "Composing {} fragment(s) into {}", segments.size(),
          destination.lastPathComponent());
-  auto status = compose(segments, destination, waveformDestination);
+  auto status = compose(segments, destination, waveformDestination, progress);
   if (!status)
     QV_LOG(platform::kLogLevelError, "ERROR: Composing {} failed: {}",
            destination.lastPathComponent(), status.error());

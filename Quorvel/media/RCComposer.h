@@ -19,26 +19,28 @@
 // on distinct destinations may run at the same time.
 #pragma once
 
+#include <functional>
 #include <optional>
 #include <vector>
 
+#include "Quorvel/media/RCMediaEngine.h"
 #include "platform/Error.h"
 #include "platform/URL.h"
 
 namespace quorvel {
 
-struct RCComposerSegment {
-  platform::URL fragmentURL;
-  double contentStart;     // seconds into the fragment's own audio
-  double contentDuration;  // seconds of it used
-};
+// Called on the composing thread, often, with the fraction of the segments'
+// total length composed so far.
+using RCComposerProgress = std::function<void(double fraction)>;
 
 // Concatenates the segments' used ranges, in order, into `destination` (its
 // extension picks the container: m4a, flac or wav). Writes the composed
 // waveform to `waveformDestination` when given. Never leaves a half file.
+// Reports its progress to `progress` when given.
 // Errors are in kRCMediaErrorDomain (or POSIX for file system failures).
 platform::Status RCComposeAudio(
     const std::vector<RCComposerSegment>& segments, const platform::URL& destination,
-    const std::optional<platform::URL>& waveformDestination = std::nullopt);
+    const std::optional<platform::URL>& waveformDestination = std::nullopt,
+    const RCComposerProgress& progress = {});
 
 }  // namespace quorvel

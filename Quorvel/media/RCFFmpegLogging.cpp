@@ -1,6 +1,7 @@
 #include "Quorvel/media/RCFFmpegLogging.h"
 
 extern "C" {
+#include <libavutil/error.h>
 #include <libavutil/log.h>
 }
 
@@ -8,6 +9,7 @@ extern "C" {
 #include <mutex>
 #include <string>
 
+#include "Quorvel/errors/RCErrors.h"
 #include "platform/Log.h"
 
 namespace quorvel {
@@ -54,6 +56,12 @@ void routeFFmpegLog(void* avcl, int level, const char* format, va_list args) {
 void RCInstallFFmpegLogging() {
   static std::once_flag once;
   std::call_once(once, [] { av_log_set_callback(&routeFFmpegLog); });
+}
+
+platform::Error RCMediaErrorFromAV(RCMediaErrorCode code, int averror, std::string_view what) {
+  char text[AV_ERROR_MAX_STRING_SIZE] = {};
+  av_strerror(averror, text, sizeof text);
+  return RCMediaError(code, fmt::format("{}: {}", what, text));
 }
 
 }  // namespace quorvel

@@ -28,6 +28,7 @@
 #include <vector>
 
 #include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
@@ -146,6 +147,7 @@ void printURLs(const Globals& globals, const std::vector<platform::URL>& urls) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  quorvel::RCUseInProcessMediaEngine();  // recording management reads audio here
   Globals globals;
   CLI::App app{"quorvelctl: talk to the quorveld saved-recordings daemon", "quorvelctl"};
   app.require_subcommand(1);

@@ -2,6 +2,8 @@
 // what an app builds through the editor composes into a playable file of the
 // right length, a crash mid-capture is repaired into a consistent manifest,
 // and audio that cannot be read makes composing fail instead of vanishing.
+// Every test runs twice: with the media work in process, as in an app, and
+// through the quorvel-media worker, as in the daemon.
 #include <gtest/gtest.h>
 
 #include <fstream>
@@ -15,6 +17,7 @@
 #include "Quorvel/media/RCMP4Atoms.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/MediaWorker.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
 
 namespace quorvel {
@@ -22,10 +25,16 @@ namespace {
 
 namespace fs = std::filesystem;
 
-class CompositionControllerTest : public testing::RecordingsDirectoryTest {
+class CompositionControllerTest : public testing::RecordingsDirectoryTest,
+                                  public ::testing::WithParamInterface<bool> {
  protected:
   void SetUp() override {
     RecordingsDirectoryTest::SetUp();
+    if (GetParam()) {
+      auto options = testing::ScopedMediaWorkerEngine::defaults();
+      options.extraSandboxDirectories = {root_.string()};
+      worker_.emplace(std::move(options));
+    }
     auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
     ASSERT_TRUE(model) << model.error();
     model_ = *model;
@@ -60,9 +69,10 @@ class CompositionControllerTest : public testing::RecordingsDirectoryTest {
   }
 
   std::shared_ptr<RCSavedRecordingsModel> model_;
+  std::optional<testing::ScopedMediaWorkerEngine> worker_;
 };
 
-TEST_F(CompositionControllerTest, AnEditedRecordingComposesToItsFragmentsUsedRanges) {
+TEST_P(CompositionControllerTest, AnEditedRecordingComposesToItsFragmentsUsedRanges) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Walk");
   ASSERT_TRUE(editor) << editor.error();
   platform::URL composed = editor->composedAVURL();
@@ -103,7 +113,7 @@ TEST_F(CompositionControllerTest, AnEditedRecordingComposesToItsFragmentsUsedRan
   EXPECT_EQ((*recording)->URIRepresentation(), reloaded->composition()->savedRecordingURI());
 }
 
-TEST_F(CompositionControllerTest, NewRecordingsGetFreeNamesAndBadNamesAreRefused) {
+TEST_P(CompositionControllerTest, NewRecordingsGetFreeNamesAndBadNamesAreRefused) {
   fs::create_directories(recordings_);
   std::ofstream(recordings_ / "Memo.flac") << "taken by a bare file";
   auto first = RCCompositionEditor::createCompositionForNewRecording(*model_, "Memo", "wav");
@@ -123,7 +133,7 @@ TEST_F(CompositionControllerTest, NewRecordingsGetFreeNamesAndBadNamesAreRefused
   EXPECT_EQ(records, 2);
 }
 
-TEST_F(CompositionControllerTest, RepairAfterACrashMidCaptureLeavesAConsistentManifest) {
+TEST_P(CompositionControllerTest, RepairAfterACrashMidCaptureLeavesAConsistentManifest) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Crash", "wav");
   ASSERT_TRUE(editor);
   ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("base.wav", 1.0)));
@@ -173,7 +183,7 @@ TEST_F(CompositionControllerTest, RepairAfterACrashMidCaptureLeavesAConsistentMa
   EXPECT_NEAR(durationOf(editor->composedAVURL()), 1.75, 0.02);
 }
 
-TEST_F(CompositionControllerTest, UnreadableAudioStaysAndMakesComposingFail) {
+TEST_P(CompositionControllerTest, UnreadableAudioStaysAndMakesComposingFail) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Broken", "m4a");
   ASSERT_TRUE(editor);
   ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("good.m4a", 0.5)));
@@ -199,7 +209,7 @@ TEST_F(CompositionControllerTest, UnreadableAudioStaysAndMakesComposingFail) {
   EXPECT_TRUE(logged("ERROR: composing Broken.m4a failed"));
 }
 
-TEST_F(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextTrim) {
+TEST_P(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextTrim) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Trim", "flac");
   ASSERT_TRUE(editor);
   ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("a.flac", 1.0)));
@@ -229,7 +239,7 @@ TEST_F(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextT
   EXPECT_NEAR(durationOf(editor->composedAVURL()), 0.75, 0.01);
 }
 
-TEST_F(CompositionControllerTest, TrimmingAwayAFragmentOrphansItsFile) {
+TEST_P(CompositionControllerTest, TrimmingAwayAFragmentOrphansItsFile) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Cut", "wav");
   ASSERT_TRUE(editor);
   ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("a.wav", 1.0)));
@@ -254,7 +264,7 @@ TEST_F(CompositionControllerTest, TrimmingAwayAFragmentOrphansItsFile) {
   EXPECT_EQ(editor->composition()->composedDuration(), 0);
 }
 
-TEST_F(CompositionControllerTest, ControllersExistOnlyForAudioFilesDirectlyInTheDirectory) {
+TEST_P(CompositionControllerTest, ControllersExistOnlyForAudioFilesDirectlyInTheDirectory) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Here", "wav");
   ASSERT_TRUE(editor);
   ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("a.wav", 0.25)));
@@ -276,6 +286,11 @@ TEST_F(CompositionControllerTest, ControllersExistOnlyForAudioFilesDirectlyInThe
   EXPECT_FALSE(RCCompositionEditor::editorForComposedAVURL(
       platform::URL::fileURLWithPath((root_ / "Here.wav").string())));
 }
+
+INSTANTIATE_TEST_SUITE_P(Engines, CompositionControllerTest, ::testing::Values(false, true),
+                         [](const ::testing::TestParamInfo<bool>& info) {
+                           return info.param ? "ThroughTheWorker" : "InProcess";
+                         });
 
 }  // namespace
 }  // namespace quorvel

@@ -1,0 +1,152 @@
+// The real quorveld reads audio only through its quorvel-media workers: a
+// session on a recording left by a crashed capture repairs it through a
+// worker, the worker dies with the daemon, and a daemon without its worker
+// binary still serves every request.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <string>
+
+#include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/composition/RCCompositionEditor.h"
+#include "Quorvel/database/RCSavedRecordingsModel.h"
+#include "Quorvel/service/SavedRecordingServiceClient.h"
+#include "tests/support/AudioFixtures.h"
+#include "tests/support/DaemonProcess.h"
+#include "tests/support/TestBus.h"
+
+namespace quorvel {
+namespace {
+
+namespace fs = std::filesystem;
+using testing::DaemonProcess;
+
+// The children of `pid`, from every one of its threads.
+std::vector<pid_t> childrenOf(pid_t pid) {
+  std::vector<pid_t> children;
+  for (const auto& task : fs::directory_iterator("/proc/" + std::to_string(pid) + "/task")) {
+    std::ifstream list(task.path() / "children");
+    pid_t child = 0;
+    while (list >> child) children.push_back(child);
+  }
+  return children;
+}
+
+std::string commandName(pid_t pid) {
+  std::ifstream comm("/proc/" + std::to_string(pid) + "/comm");
+  std::string name;
+  std::getline(comm, name);
+  return name;
+}
+
+class MediaWorkerDaemonTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    recordings_ = fs::temp_directory_path() /
+                  ("quorvel-it-" + std::to_string(getpid()) + "-" +
+                   ::testing::UnitTest::GetInstance()->current_test_info()->name());
+    fs::remove_all(recordings_);
+    fs::create_directories(recordings_);
+  }
+  void TearDown() override {
+    ::unsetenv("QUORVEL_MEDIA_WORKER");
+    RCSavedRecordingsModel::resetSharedModelsForTesting();
+    RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
+    fs::remove_all(recordings_);
+  }
+
+  // A recording "Walk" whose last capture wrote 0.75 s of audio and crashed
+  // before recording its length.
+  platform::URL crashedRecording() {
+    RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
+    auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+    EXPECT_TRUE(model);
+    auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, "Walk", "wav");
+    EXPECT_TRUE(editor);
+    std::string source = (recordings_ / "source.wav").string();
+    EXPECT_TRUE(testing::writeTone(source, 1.0, "wav"));
+    EXPECT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(source)));
+    auto captured = editor->beginFragment("wav");
+    EXPECT_TRUE(captured);
+    EXPECT_TRUE(testing::writeTone(captured->path(), 0.75, "wav"));
+    fs::remove(source);
+    bundle_ = RCComposition::compositionBundleURLForComposedAVURL(editor->composedAVURL());
+    return editor->composedAVURL();
+  }
+
+  std::optional<double> lastFragmentDuration() {
+    auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(*bundle_);
+    if (!composition) return std::nullopt;
+    return composition->fragments().back().contentDuration();
+  }
+
+  std::unique_ptr<DaemonProcess> startDaemon() {
+    auto daemon = std::make_unique<DaemonProcess>(
+        std::vector<std::string>{"--bus-address", bus_.address(), "--recordings-dir",
+                                 recordings_.string(), "--idle-exit-after", "0"});
+    EXPECT_TRUE(daemon->waitForLine("[BusListener] listening as")) << daemon->output();
+    return daemon;
+  }
+
+  platform::testing::TestBus bus_;
+  fs::path recordings_;
+  std::optional<platform::URL> bundle_;
+};
+
+TEST_F(MediaWorkerDaemonTest, RepairRunsInAWorkerThatDiesWithTheDaemon) {
+  platform::URL walk = crashedRecording();
+  ASSERT_FALSE(lastFragmentDuration());
+  auto daemon = startDaemon();
+  auto client = SavedRecordingServiceClient::connect(bus_.address());
+  ASSERT_TRUE(client);
+  auto token = (*client)->prepareToCapture(walk);
+  ASSERT_TRUE(token) << token.error() << daemon->output();
+  ASSERT_TRUE(daemon->waitForLine("repaired the fragment metadata of Walk.composition"))
+      << daemon->output();
+  std::optional<double> repaired = lastFragmentDuration();
+  ASSERT_TRUE(repaired);
+  EXPECT_NEAR(*repaired, 0.75, 0.01);
+
+  std::vector<pid_t> workers;
+  for (pid_t child : childrenOf(daemon->pid())) {
+    if (commandName(child) == "quorvel-media") workers.push_back(child);
+  }
+  ASSERT_EQ(workers.size(), 1u) << daemon->output();
+  int worker = int(::syscall(SYS_pidfd_open, workers[0], 0));
+  ASSERT_GE(worker, 0);
+
+  daemon->sendSignal(SIGKILL);
+  ASSERT_TRUE(daemon->waitForExit());
+  pollfd ended{worker, POLLIN, 0};
+  EXPECT_EQ(::poll(&ended, 1, 10000), 1) << "the worker outlived the daemon";
+  ::close(worker);
+}
+
+TEST_F(MediaWorkerDaemonTest, WithoutItsWorkerTheDaemonStillServesAndSaysWhy) {
+  platform::URL walk = crashedRecording();
+  ::setenv("QUORVEL_MEDIA_WORKER", (recordings_ / "no-such-worker").c_str(), 1);
+  auto daemon = startDaemon();
+  auto client = SavedRecordingServiceClient::connect(bus_.address());
+  ASSERT_TRUE(client);
+  auto token = (*client)->prepareToCapture(walk);
+  ASSERT_TRUE(token) << token.error() << daemon->output();
+  EXPECT_TRUE(daemon->waitForLine("cannot start the media worker " +
+                                  (recordings_ / "no-such-worker").string()))
+      << daemon->output();
+  // Nothing it could not read was dropped or changed.
+  EXPECT_FALSE(lastFragmentDuration());
+  (*client)->endAccessSessionWithToken(*token);
+  auto again = (*client)->prepareToPreview(walk);
+  EXPECT_TRUE(again) << daemon->output();
+  auto exporting = (*client)->fetchExportingCompositionAVURLs();
+  EXPECT_TRUE(exporting);
+}
+
+}  // namespace
+}  // namespace quorvel
