@@ -134,16 +134,5 @@ TEST(AccessTokenTest, NoTokenAndMalformedTuplesAreNoToken) {
   EXPECT_FALSE(noURL->compositionAVURL());
 }
 
-TEST(AccessTokenTest, DebugDescriptionNamesEveryField) {
-  auto token = RCSSavedRecordingAccessToken::tokenWithName(
-      "trimming", 2, platform::URL::fileURLWithPath("/r/a b.m4a"));
-  std::string text = token.debugDescription();
-  for (const std::string& part :
-       {std::string("trimming"), std::string("exclusive"), std::string("file:///r/a%20b.m4a"),
-        token.identifier().string()}) {
-    EXPECT_NE(text.find(part), std::string::npos) << text;
-  }
-}
-
 }  // namespace
 }  // namespace quorvel
