@@ -17,19 +17,13 @@
 namespace platform {
 namespace {
 
-TEST(SerialQueueTest, RunsAsyncTasksInOrderOnOneThreadThatIsNotTheCaller) {
-  SerialQueue queue("test.order");
-  std::vector<int> seen;
+// Their order is the stress test's business below.
+TEST(SerialQueueTest, RunsAsyncTasksOnOneThreadThatIsNotTheCaller) {
+  SerialQueue queue("test.thread");
   std::vector<std::thread::id> threads;
-  for (int i = 0; i < 1000; ++i) {
-    queue.async([&, i] {
-      seen.push_back(i);
-      threads.push_back(std::this_thread::get_id());
-    });
-  }
+  for (int i = 0; i < 100; ++i) queue.async([&] { threads.push_back(std::this_thread::get_id()); });
   queue.sync([] {});
-  ASSERT_EQ(seen.size(), 1000u);
-  for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[i], i);
+  ASSERT_EQ(threads.size(), 100u);
   for (auto id : threads) EXPECT_EQ(id, threads.front());
   EXPECT_NE(threads.front(), std::this_thread::get_id());
 }
