@@ -149,15 +149,23 @@ TEST_F(ServiceTest, EveryPrepareKindLogsItsArrivalAndAnswers) {
   struct Kind {
     const char* member;
     BusValues arguments;
+    const char* name;
     const char* word;
     int accessType;  // 0: the request is not served yet
   };
-  const std::string url = "file:///recordings/New%20Recording.m4a";
   for (const Kind& kind : std::vector<Kind>{
-           {"PrepareToPreview", {url}, "preview", 1},
-           {"PrepareToExport", {url, true}, "export", 0},
-           {"PrepareToTrim", {"/recordings/Trim Recording.m4a"}, "trimming", 2},
-           {"PrepareToCapture", {"file:///recordings/Capture%20Recording.m4a"}, "capture", 2},
+           {"PrepareToPreview", {"file:///recordings/New%20Recording.m4a"}, "New", "preview", 1},
+           {"PrepareToExport",
+            {"file:///recordings/New%20Recording.m4a", true},
+            "New",
+            "export",
+            0},
+           {"PrepareToTrim", {"/recordings/Trim Recording.m4a"}, "Trim", "trimming", 2},
+           {"PrepareToCapture",
+            {"file:///recordings/Capture%20Recording.m4a"},
+            "Capture",
+            "capture",
+            2},
        }) {
     auto reply = call(":1.3", kind.member, kind.arguments);
     ASSERT_TRUE(reply->waitFor(10s));
@@ -169,10 +177,7 @@ TEST_F(ServiceTest, EveryPrepareKindLogsItsArrivalAndAnswers) {
     }
     EXPECT_EQ(linesContaining(fmt::format("[SavedRecordingService] Received request to prepare "
                                           "'{} Recording.m4a' for {}...",
-                                          kind.word == std::string("trimming")  ? "Trim"
-                                          : kind.word == std::string("capture") ? "Capture"
-                                                                                : "New",
-                                          kind.word))
+                                          kind.name, kind.word))
                   .size(),
               1u);
   }
