@@ -115,8 +115,6 @@ TEST(AccessTokenTest, TupleRoundTripComparesEqualAndSeparateTokensNever) {
 TEST(AccessTokenTest, NoTokenAndMalformedTuplesAreNoToken) {
   EXPECT_FALSE(
       RCSSavedRecordingAccessToken::fromTuple(RCSSavedRecordingAccessToken::noTokenTuple()));
-  EXPECT_EQ(RCSSavedRecordingAccessToken::noTokenTuple(),
-            (RCSSavedRecordingAccessToken::Tuple{"", 0, "", ""}));
   auto good = RCSSavedRecordingAccessToken::tokenWithName(
                   "capture", 2, platform::URL::fileURLWithPath("/r/a.m4a"))
                   .toTuple();
