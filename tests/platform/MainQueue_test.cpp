@@ -177,13 +177,6 @@ TEST(MainQueueRunTest, StopFromATaskEndsRunAndAnEarlyStopEndsTheNextRun) {
   EXPECT_EQ(ran, 2);
 }
 
-TEST(MainQueueRunTest, RealClockTimerFires) {
-  MainQueue queue;  // system clock
-  queue.after(milliseconds(1), [&] { queue.stop(); });
-  queue.run();  // returns only once the timer ran
-  EXPECT_EQ(queue.pendingCount(), 0u);
-}
-
 // Scheduling wakes a sleeping loop only for a new earliest deadline: a loop
 // asleep until an hour from now must still run a timer due in a millisecond.
 TEST(MainQueueRunTest, AnEarlierTimerWakesALoopSleepingUntilALaterOne) {

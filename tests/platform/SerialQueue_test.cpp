@@ -17,19 +17,13 @@
 namespace platform {
 namespace {
 
-TEST(SerialQueueTest, RunsAsyncTasksInOrderOnOneThreadThatIsNotTheCaller) {
-  SerialQueue queue("test.order");
-  std::vector<int> seen;
+// Their order is the stress test's business below.
+TEST(SerialQueueTest, RunsAsyncTasksOnOneThreadThatIsNotTheCaller) {
+  SerialQueue queue("test.thread");
   std::vector<std::thread::id> threads;
-  for (int i = 0; i < 1000; ++i) {
-    queue.async([&, i] {
-      seen.push_back(i);
-      threads.push_back(std::this_thread::get_id());
-    });
-  }
+  for (int i = 0; i < 100; ++i) queue.async([&] { threads.push_back(std::this_thread::get_id()); });
   queue.sync([] {});
-  ASSERT_EQ(seen.size(), 1000u);
-  for (int i = 0; i < 1000; ++i) EXPECT_EQ(seen[i], i);
+  ASSERT_EQ(threads.size(), 100u);
   for (auto id : threads) EXPECT_EQ(id, threads.front());
   EXPECT_NE(threads.front(), std::this_thread::get_id());
 }
@@ -58,40 +52,25 @@ TEST(SerialQueueTest, SyncWaitsBehindQueuedWorkAndKeepsFifoWithAsync) {
 TEST(SerialQueueTest, CurrentQueueFollowsNestedSync) {
   SerialQueue outer("test.outer");
   SerialQueue inner("test.inner");
-  struct Seen {
-    std::thread::id ranOn;
-    DispatchQueue* before = nullptr;
-    DispatchQueue* insideInner = nullptr;
-    bool outerCurrentInsideInner = false;
-    bool innerCurrentInsideInner = false;
-    DispatchQueue* after = nullptr;
-  } seen;
-  outer.sync([&] {
-    seen.ranOn = std::this_thread::get_id();
-    seen.before = DispatchQueue::current();
-    inner.sync([&] {
-      seen.insideInner = DispatchQueue::current();
-      seen.outerCurrentInsideInner = outer.isCurrent();
-      seen.innerCurrentInsideInner = inner.isCurrent();
-    });
-    seen.after = DispatchQueue::current();
-  });
-  EXPECT_EQ(seen.ranOn, std::this_thread::get_id());  // sync runs on the caller's thread
-  EXPECT_EQ(seen.before, &outer);
-  EXPECT_EQ(seen.insideInner, &inner);
-  EXPECT_TRUE(seen.outerCurrentInsideInner);
-  EXPECT_TRUE(seen.innerCurrentInsideInner);
-  EXPECT_EQ(seen.after, &outer);
-  EXPECT_FALSE(outer.isCurrent());
-  EXPECT_EQ(DispatchQueue::current(), nullptr);
-
-  // The same from the outer queue's own worker thread.
-  std::promise<bool> fromWorker;
-  outer.async([&] {
+  // From the caller's thread (sync runs there) and from the outer queue's own
+  // worker: the inner queue is current inside, the outer one still counts.
+  auto nested = [&] {
     bool ok = DispatchQueue::current() == &outer && !inner.isCurrent();
     inner.sync([&] { ok = ok && outer.isCurrent() && DispatchQueue::current() == &inner; });
-    fromWorker.set_value(ok && DispatchQueue::current() == &outer);
+    return ok && DispatchQueue::current() == &outer;
+  };
+  std::thread::id ranOn;
+  bool fromCaller = false;
+  outer.sync([&] {
+    ranOn = std::this_thread::get_id();
+    fromCaller = nested();
   });
+  EXPECT_EQ(ranOn, std::this_thread::get_id());
+  EXPECT_TRUE(fromCaller);
+  EXPECT_FALSE(outer.isCurrent());
+  EXPECT_EQ(DispatchQueue::current(), nullptr);
+  std::promise<bool> fromWorker;
+  outer.async([&] { fromWorker.set_value(nested()); });
   EXPECT_TRUE(fromWorker.get_future().get());
 }
 

@@ -126,24 +126,5 @@ TEST_F(IdleExitTest, AKeepAliveHeldAfterTheListenerStoppedHoldsTheMainQueue) {
   expectMainQueueStopped();
 }
 
-TEST_F(IdleExitTest, InstalledItRunsWhenTheProcessIsIdle) {
-  platform::ManualClock clock;
-  platform::MainQueue main{clock, "lifetime main"};
-  platform::ProcessLifetime ownLifetime{main};
-  auto installed = IdleExit::install(service_, ownLifetime, main);
-  ownLifetime.setIdleExitAfter(5s);
-  ownLifetime.enableTransactions();
-  clock.advance(5s);
-  main.runUntilIdle();  // the idle handler starts the sequence
-  EXPECT_TRUE(listener_->isNameReleased());
-  service_->serviceSerialQueue().sync([] {});
-  main.runUntilIdle();
-  bool stoppedOwn = false;
-  main.async([&] { stoppedOwn = installed->hasStoppedMainQueue(); });
-  main.runUntilIdle();
-  EXPECT_TRUE(stoppedOwn);
-  main.run();
-}
-
 }  // namespace
 }  // namespace quorvel

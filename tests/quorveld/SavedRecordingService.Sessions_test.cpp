@@ -32,16 +32,15 @@ TEST_F(SessionTest, SharedSessionsCoexistAndExclusiveOnesAreRefused) {
   EXPECT_EQ(token(first).fields().at(1).asInt32(), 1);
   EXPECT_EQ(token(second).fields().at(1).asInt32(), 1);
   EXPECT_NE(token(first).fields().at(3).asString(), token(second).fields().at(3).asString());
-  for (const char* member : {"PrepareToCapture", "PrepareToTrim"}) {
-    auto refused = prepare(":1.3", member, "A.m4a");
-    ASSERT_TRUE(refused->waitFor(10s));
-    EXPECT_EQ(refused->errorName(), kConflict);
-  }
+  auto refused = [&](const char* member, const char* recording) {
+    auto reply = prepare(":1.3", member, recording);
+    return reply->waitFor(10s) && reply->errorName() == kConflict;
+  };
+  EXPECT_TRUE(refused("PrepareToCapture", "A.m4a"));
+  EXPECT_TRUE(refused("PrepareToTrim", "A.m4a"));
   // An exclusive session refuses shared ones on its recording only.
   EXPECT_EQ(token(prepare(":1.3", "PrepareToCapture", "B.m4a")).fields().at(1).asInt32(), 2);
-  auto refused = prepare(":1.4", "PrepareToPreview", "B.m4a");
-  ASSERT_TRUE(refused->waitFor(10s));
-  EXPECT_EQ(refused->errorName(), kConflict);
+  EXPECT_TRUE(refused("PrepareToPreview", "B.m4a"));
 
   // Ending through another connection works; ending again does nothing more.
   end(":1.4", token(first));
@@ -53,19 +52,17 @@ TEST_F(SessionTest, SharedSessionsCoexistAndExclusiveOnesAreRefused) {
   EXPECT_EQ(linesContaining("Closing access session").size(), closing.size());
   EXPECT_EQ(linesContaining("Ending access session").size(), 2u);
 
+  const std::vector<std::string> steps = {"Ending access session", "Closing access session",
+                                          "Scheduling orphan fragment cleanup for closing session",
+                                          "Finally closing access session"};
   std::vector<std::string> order;
   for (const auto& line : lines()) {
-    for (const char* step : {"Ending access session", "Closing access session",
-                             "Scheduling orphan fragment cleanup for closing session",
-                             "Finally closing access session"}) {
+    for (const auto& step : steps) {
       if (line.text.find(step) != std::string::npos) order.push_back(step);
     }
   }
   ASSERT_GE(order.size(), 4u);
-  EXPECT_EQ(std::vector(order.begin(), order.begin() + 4),
-            (std::vector<std::string>{"Ending access session", "Closing access session",
-                                      "Scheduling orphan fragment cleanup for closing session",
-                                      "Finally closing access session"}));
+  EXPECT_EQ(std::vector(order.begin(), order.begin() + 4), steps);
 }
 
 TEST_F(SessionTest, ConflictsWaitBehindAClosingSessionAndTheNewestWins) {
@@ -99,9 +96,7 @@ TEST_F(SessionTest, ConflictsWaitBehindAClosingSessionAndTheNewestWins) {
   gate->count_down();
   settle();
   EXPECT_FALSE(waiting->isAnswered());
-  EXPECT_EQ(
-      onServiceQueue<std::size_t>([&] { return service_->deferredAccessRequestCountForTesting(); }),
-      1u);
+  EXPECT_EQ(deferredRequests(), 1u);
   end(":1.4", trimToken);
   EXPECT_EQ(token(waiting).fields().at(1).asInt32(), 1);
 }
@@ -123,19 +118,14 @@ TEST_F(SessionTest, AVanishedClientTakesItsSessionsAndItsWaitingRequestWithIt) {
 
   listener_->vanish(":1.3");
   settle();
-  EXPECT_EQ(
-      onServiceQueue<std::size_t>([&] { return service_->deferredAccessRequestCountForTesting(); }),
-      0u);
+  EXPECT_EQ(deferredRequests(), 0u);
   EXPECT_TRUE(waiting->values().empty());  // never granted
 
   listener_->vanish(":1.1");
   settle();
   EXPECT_EQ(linesContaining("for terminated connection: <connection :1.1>").size(), 2u);
   EXPECT_EQ(linesContaining("Finally closing access session").size(), 1u);  // B's only
-  EXPECT_EQ(openSessions(), 0u);
-  EXPECT_EQ(onServiceQueue<std::size_t>([&] { return service_->closingSessionCountForTesting(); }),
-            0u);
-  EXPECT_FALSE(controller().isInTransaction());
+  expectNothingLeft();
 }
 
 TEST_F(SessionTest, HoldsKeepOrphanedFragmentsUntilTheLastOneIsReleased) {
@@ -248,13 +238,7 @@ TEST_F(SessionTest, StressOfRandomClientsLeavesNothingBehind) {
   for (auto& thread : clients) thread.join();
   settle();
 
-  EXPECT_EQ(openSessions(), 0u);
-  EXPECT_EQ(onServiceQueue<std::size_t>([&] { return service_->closingSessionCountForTesting(); }),
-            0u);
-  EXPECT_EQ(
-      onServiceQueue<std::size_t>([&] { return service_->deferredAccessRequestCountForTesting(); }),
-      0u);
-  EXPECT_FALSE(controller().isInTransaction());
+  expectNothingLeft();
   for (const auto& list : requests) {
     for (const auto& request : list) EXPECT_EQ(request.reply->answerCount(), 1);
   }

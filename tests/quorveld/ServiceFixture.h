@@ -202,6 +202,18 @@ class SessionTest : public ServiceTest {
     return onServiceQueue<std::size_t>(
         [&] { return service_->assetSessionController().activeSessions().size(); });
   }
+  std::size_t deferredRequests() {
+    return onServiceQueue<std::size_t>(
+        [&] { return service_->deferredAccessRequestCountForTesting(); });
+  }
+  // Nothing open, closing or waiting, and no keep-alive held.
+  void expectNothingLeft() {
+    EXPECT_EQ(openSessions(), 0u);
+    EXPECT_EQ(
+        onServiceQueue<std::size_t>([&] { return service_->closingSessionCountForTesting(); }), 0u);
+    EXPECT_EQ(deferredRequests(), 0u);
+    EXPECT_FALSE(controller().isInTransaction());
+  }
 
   std::filesystem::path directory_;
 };

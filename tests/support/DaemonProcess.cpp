@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <initializer_list>
 #include <stdexcept>
 
 extern char** environ;
@@ -37,6 +38,25 @@ std::vector<std::string> daemonEnvironment() {
   return environment;
 }
 
+// Starts `argv` with stdin on /dev/null and `outputs` (stdout, stderr or both)
+// on a pipe; the pipe's read end, or -1 with the spawn error in `error`.
+int spawn(pid_t& pid, const std::vector<std::string>& arguments, char* const* envp,
+          std::initializer_list<int> outputs, int& error) {
+  int pipeFds[2];
+  if (pipe2(pipeFds, O_CLOEXEC) != 0) throw std::runtime_error("pipe failed");
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  for (int fd : outputs) posix_spawn_file_actions_adddup2(&actions, pipeFds[1], fd);
+  posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
+  auto argv = argvOf(arguments);
+  error = posix_spawnp(&pid, argv[0], &actions, nullptr, argv.data(), envp);
+  posix_spawn_file_actions_destroy(&actions);
+  close(pipeFds[1]);
+  if (error == 0) return pipeFds[0];
+  close(pipeFds[0]);
+  return -1;
+}
+
 }  // namespace
 
 std::string DaemonProcess::programPath(const std::string& name) {
@@ -48,23 +68,11 @@ DaemonProcess::DaemonProcess(std::vector<std::string> arguments)
 
 DaemonProcess::DaemonProcess(const std::string& program, std::vector<std::string> arguments) {
   arguments.insert(arguments.begin(), program);
-  int pipeFds[2];
-  if (pipe2(pipeFds, O_CLOEXEC) != 0) throw std::runtime_error("pipe failed");
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_adddup2(&actions, pipeFds[1], STDERR_FILENO);
-  posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
   auto environment = daemonEnvironment();
-  auto argv = argvOf(arguments);
-  auto envp = argvOf(environment);
-  int error = posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), envp.data());
-  posix_spawn_file_actions_destroy(&actions);
-  close(pipeFds[1]);
-  if (error != 0) {
-    close(pipeFds[0]);
-    throw std::runtime_error("cannot start " + program + ": " + std::strerror(error));
-  }
-  reader_ = std::thread([this, fd = pipeFds[0]] { capture(fd); });
+  int error = 0;
+  int fd = spawn(pid_, arguments, argvOf(environment).data(), {STDERR_FILENO}, error);
+  if (fd < 0) throw std::runtime_error("cannot start " + program + ": " + std::strerror(error));
+  reader_ = std::thread([this, fd] { capture(fd); });
 }
 
 DaemonProcess::~DaemonProcess() {
@@ -99,14 +107,7 @@ void DaemonProcess::capture(int fd) {
 }
 
 bool DaemonProcess::waitForLine(const std::string& text, std::chrono::milliseconds timeout) {
-  std::unique_lock lock(mutex_);
-  std::size_t checked = 0;
-  return changed_.wait_for(lock, timeout, [&] {
-    for (; checked < lines_.size(); ++checked) {
-      if (lines_[checked].find(text) != std::string::npos) return true;
-    }
-    return closed_;
-  }) && checked < lines_.size();
+  return waitForLines(text, 1, timeout);
 }
 
 bool DaemonProcess::waitForLines(const std::string& text, std::size_t count,
@@ -156,33 +157,17 @@ std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout)
 void DaemonProcess::sendSignal(int signo) const { ::kill(pid_, signo); }
 
 DaemonProcess::CommandResult DaemonProcess::run(const std::vector<std::string>& argv) {
-  int pipeFds[2];
-  if (pipe2(pipeFds, O_CLOEXEC) != 0) throw std::runtime_error("pipe failed");
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_adddup2(&actions, pipeFds[1], STDOUT_FILENO);
-  posix_spawn_file_actions_adddup2(&actions, pipeFds[1], STDERR_FILENO);
-  posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
-  auto args = argvOf(argv);
   pid_t pid = -1;
-  int error = posix_spawnp(&pid, args[0], &actions, nullptr, args.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  close(pipeFds[1]);
-  if (error != 0) {
-    close(pipeFds[0]);
-    return {127, std::string("cannot run ") + argv[0] + ": " + std::strerror(error)};
-  }
+  int error = 0;
+  int fd = spawn(pid, argv, environ, {STDOUT_FILENO, STDERR_FILENO}, error);
+  if (fd < 0) return {127, std::string("cannot run ") + argv[0] + ": " + std::strerror(error)};
   std::string output;
   char buffer[4096];
-  ssize_t n;
-  while ((n = read(pipeFds[0], buffer, sizeof buffer)) != 0) {
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      break;
-    }
-    output.append(buffer, static_cast<std::size_t>(n));
+  for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) != 0;) {
+    if (n > 0) output.append(buffer, static_cast<std::size_t>(n));
+    if (n < 0 && errno != EINTR) break;
   }
-  close(pipeFds[0]);
+  close(fd);
   int status = 0;
   while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
   }

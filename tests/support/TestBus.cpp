@@ -74,16 +74,14 @@ TestBus::TestBus(Options options) {
   std::string pattern = (std::filesystem::temp_directory_path() / "qv-bus-XXXXXX").string();
   if (!::mkdtemp(pattern.data())) failWith("mkdtemp");
   directory_ = pattern;
-  configPath_ = directory_ + "/bus.conf";
-  {
-    std::ofstream out(configPath_);
-    out << configuration(directory_, options);
-    if (!out) failWith("writing " + configPath_);
+  const std::string configPath = directory_ + "/bus.conf";
+  if (!(std::ofstream(configPath) << configuration(directory_, options))) {
+    failWith("writing " + configPath);
   }
 
   int fds[2];
   if (::pipe2(fds, O_CLOEXEC) != 0) failWith("pipe");
-  std::string configArgument = "--config-file=" + configPath_;
+  std::string configArgument = "--config-file=" + configPath;
   const char* argv[] = {"dbus-daemon", configArgument.c_str(), "--nofork", "--print-address=1",
                         nullptr};
   // The daemon's warnings (it cannot raise its fd limit unprivileged) would

@@ -35,16 +35,11 @@ class TestBus {
 
   // The address to connect to, e.g. "unix:path=/tmp/qv-bus-XXXX/dbus-abc,guid=...".
   const std::string& address() const { return address_; }
-  pid_t pid() const { return pid_; }
-  // The generated configuration file.
-  const std::string& configPath() const { return configPath_; }
   // Ends the daemon now and waits for it (to test a lost bus). Idempotent.
   void kill();
-  bool isRunning() const { return pid_ > 0; }
 
  private:
   std::string directory_;
-  std::string configPath_;
   std::string address_;
   pid_t pid_ = -1;
 };
