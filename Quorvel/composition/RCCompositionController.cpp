@@ -217,6 +217,17 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
     return composed;
   }
 
+  // Composing takes long; an app may have changed the manifest meanwhile
+  // (appended a fragment, say). Saving the one composed from would undo that
+  // change, and the new fragment would then look orphaned and be deleted. So
+  // the composed file stays (it holds what was composed), the manifest on
+  // disk stays as it is, and the next finalization composes again.
+  auto onDisk = RCComposition::load(current->bundleURL());
+  if (!onDisk || (*onDisk)->manifest() != current->manifest()) {
+    return platform::fail(RCError(RCErrorCodeInvalidManifest,
+                                  "the manifest of " + current->bundleURL().lastPathComponent() +
+                                      " changed while it was composed; it was left as it is"));
+  }
   for (RCCompositionManifestFragment& entry : manifest.fragments) entry.composed = true;
   manifest.recomputeTimeRanges();
   std::vector<platform::URL> toDelete;

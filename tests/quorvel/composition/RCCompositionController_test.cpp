@@ -15,6 +15,7 @@
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/media/RCAudioAsset.h"
 #include "Quorvel/media/RCMP4Atoms.h"
+#include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/MediaWorker.h"
@@ -111,6 +112,63 @@ TEST_P(CompositionControllerTest, AnEditedRecordingComposesToItsFragmentsUsedRan
   ASSERT_TRUE(recording && *recording);
   EXPECT_EQ((*recording)->customLabel(), "Walk in the park");
   EXPECT_EQ((*recording)->URIRepresentation(), reloaded->composition()->savedRecordingURI());
+}
+
+// An engine that runs `during` in the middle of composing, as an app that
+// edits the recording while the daemon composes it.
+class InterruptedComposeEngine : public RCMediaEngine {
+ public:
+  InterruptedComposeEngine(std::shared_ptr<RCMediaEngine> inner, std::function<void()> during)
+      : inner_(std::move(inner)), during_(std::move(during)) {}
+  platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
+    return inner_->probe(url);
+  }
+  platform::Status compose(const std::vector<RCComposerSegment>& segments,
+                           const platform::URL& destination,
+                           const std::optional<platform::URL>& waveform,
+                           const RCMediaProgress& progress) override {
+    auto composed = inner_->compose(segments, destination, waveform, progress);
+    during_();
+    return composed;
+  }
+  platform::Status buildWaveform(const platform::URL& audio, const platform::URL& destination,
+                                 const RCMediaProgress& progress) override {
+    return inner_->buildWaveform(audio, destination, progress);
+  }
+  platform::Status writeTitle(const platform::URL& file, const std::string& title,
+                              const std::string& language) override {
+    return inner_->writeTitle(file, title, language);
+  }
+
+ private:
+  std::shared_ptr<RCMediaEngine> inner_;
+  std::function<void()> during_;
+};
+
+TEST_P(CompositionControllerTest, AFragmentAppendedWhileComposingIsNeitherLostNorOrphaned) {
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Talk");
+  ASSERT_TRUE(editor) << editor.error();
+  ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("one.wav", 0.5)));
+  platform::URL composed = editor->composedAVURL();
+  auto controller = RCCompositionController::compositionControllerForComposedAVURL(composed);
+  platform::URL second = tone("two.wav", 0.5, 880);
+  auto inner = RCMediaEngine::current();
+  RCMediaEngine::setCurrent(std::make_shared<InterruptedComposeEngine>(inner, [&] {
+    auto app = RCCompositionEditor::editorForComposedAVURL(composed);
+    ASSERT_TRUE(app) << app.error();
+    ASSERT_TRUE(app->appendFragmentFromAudioFile(second));
+  }));
+  EXPECT_FALSE(compose(*controller, false, false));
+  RCMediaEngine::setCurrent(inner);
+
+  // The appended fragment is still in the manifest, still to be composed,
+  // and the next compose takes both.
+  auto reloaded = RCCompositionController::compositionControllerForComposedAVURL(composed);
+  ASSERT_TRUE(reloaded->composition());
+  ASSERT_EQ(reloaded->composition()->fragments().size(), 2u);
+  EXPECT_EQ(reloaded->composition()->decomposedFragments().size(), 2u);
+  ASSERT_TRUE(compose(*reloaded, false, false));
+  EXPECT_NEAR(durationOf(composed), 1.0, 0.05);
 }
 
 TEST_P(CompositionControllerTest, NewRecordingsGetFreeNamesAndBadNamesAreRefused) {
