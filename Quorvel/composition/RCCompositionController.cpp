@@ -150,9 +150,16 @@ RCCompositionController::compositionControllerForComposedAVURL(const platform::U
            "ERROR: no composition for '{}': it does not have a capture format's extension",
            composedAVURL.lastPathComponent());
   } else {
+    platform::URL standardized = composedAVURL.URLByStandardizingPath();
     composition = RCComposition::compositionLoadedFromCompositionBundleURL(
-        RCComposition::compositionBundleURLForComposedAVURL(
-            composedAVURL.URLByStandardizingPath()));
+        RCComposition::compositionBundleURLForComposedAVURL(standardized));
+    // The bundle is found by the name's stem: Walk.flac finds the bundle of
+    // Walk.m4a, which is another recording's.
+    if (composition && composition->composedAVURL().path() != standardized.path()) {
+      QV_LOG(platform::kLogLevelError, "ERROR: no composition for '{}': its bundle belongs to '{}'",
+             composedAVURL.lastPathComponent(), composition->composedAVURL().lastPathComponent());
+      composition = nullptr;
+    }
   }
   return std::make_shared<RCCompositionController>(std::move(composition));
 }

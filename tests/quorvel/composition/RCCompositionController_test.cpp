@@ -291,6 +291,11 @@ TEST_P(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextT
   ASSERT_TRUE(again) << again.error();
   ASSERT_TRUE(again->trimToTimeRange({0.5, 0.75}));
   EXPECT_NEAR(again->composition()->composedDuration(), 0.75, 1e-9);
+  // The same name with another capture extension is not this recording.
+  platform::URL otherExtension = platform::URL::fileURLWithPath(
+      editor->composedAVURL().path().substr(0, editor->composedAVURL().path().size() - 4) + "m4a");
+  EXPECT_FALSE(RCCompositionController::compositionControllerForComposedAVURL(otherExtension)
+                   ->composition());
   auto retrimmed =
       RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
   ASSERT_TRUE(compose(*retrimmed, false, false));
