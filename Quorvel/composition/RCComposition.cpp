@@ -126,7 +126,7 @@ std::vector<RCCompositionFragment> RCComposition::fragments() const {
 std::vector<RCCompositionFragment> RCComposition::decomposedFragments() const {
   std::vector<RCCompositionFragment> result;
   for (const auto& entry : manifest_.fragments) {
-    if (!entry.composed) result.push_back(fragmentFor(entry));
+    if (!entry.composed && !entry.unreadable) result.push_back(fragmentFor(entry));
   }
   return result;
 }

@@ -196,15 +196,23 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
 
   RCCompositionManifest manifest = current->manifest();
   std::vector<RCComposerSegment> segments;
+  bool leftOut = false;
   for (RCCompositionManifestFragment& entry : manifest.fragments) {
     platform::URL url = current->URLForFragmentFile(entry.file);
-    if (!entry.contentDuration) {
+    if (!entry.contentDuration || entry.unreadable) {
+      // A fragment whose file cannot be read is left out, not allowed to
+      // make the whole recording impossible to finalize; its file stays.
       double duration = fileDuration(url);
-      if (!std::isfinite(duration)) {
-        return platform::fail(
-            RCError(RCErrorCodeUnreadableAudio, "fragment '" + entry.file + "' cannot be read"));
+      entry.unreadable = !std::isfinite(duration);
+      if (entry.unreadable) {
+        QV_LOG(platform::kLogLevelError,
+               "WARNING: leaving fragment '{}' of {} out of the composed audio: it cannot be read",
+               entry.file, current->bundleURL().lastPathComponent());
+        leftOut = true;
+        continue;
       }
-      entry.contentDuration = std::max(0.0, duration - entry.contentStart);
+      if (!entry.contentDuration)
+        entry.contentDuration = std::max(0.0, duration - entry.contentStart);
     }
     if (*entry.contentDuration > 0) {
       segments.push_back(RCComposerSegment{url, entry.contentStart, *entry.contentDuration});
@@ -212,7 +220,8 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
   }
   if (segments.empty()) {
     return platform::fail(
-        RCError(RCErrorCodeInvalidEdit, "the fragments hold no audio to compose"));
+        leftOut ? RCError(RCErrorCodeUnreadableAudio, "none of the fragments can be read")
+                : RCError(RCErrorCodeInvalidEdit, "the fragments hold no audio to compose"));
   }
   platform::URL destination = current->composedAVURL();
   std::optional<platform::URL> waveform;
@@ -235,14 +244,19 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
                                   "the manifest of " + current->bundleURL().lastPathComponent() +
                                       " changed while it was composed; it was left as it is"));
   }
-  for (RCCompositionManifestFragment& entry : manifest.fragments) entry.composed = true;
+  // A left-out fragment stays listed, open-ended (no time in the
+  // composition), so nothing deletes its file.
+  for (RCCompositionManifestFragment& entry : manifest.fragments) {
+    entry.composed = !entry.unreadable;
+  }
   manifest.recomputeTimeRanges();
   std::vector<platform::URL> toDelete;
   if (deleteFragments) {
-    for (const auto& entry : manifest.fragments) {
+    std::erase_if(manifest.fragments, [&](const RCCompositionManifestFragment& entry) {
+      if (entry.unreadable) return false;
       toDelete.push_back(current->URLForFragmentFile(entry.file));
-    }
-    manifest.fragments.clear();
+      return true;
+    });
   }
   auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(manifest));
   if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) return saved;

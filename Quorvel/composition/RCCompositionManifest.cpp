@@ -108,6 +108,12 @@ platform::Result<RCCompositionManifestFragment> fragment(const Json& object,
     return platform::fail(invalid(prefix + "composed is not true or false"));
   }
   result.composed = composed->get<bool>();
+  if (const Json* unreadable = member(object, "unreadable")) {  // optional
+    if (!unreadable->is_boolean()) {
+      return platform::fail(invalid(prefix + "unreadable is not true or false"));
+    }
+    result.unreadable = unreadable->get<bool>();
+  }
   return result;
 }
 
@@ -176,10 +182,12 @@ std::string RCCompositionManifest::serialize() const {
   for (const RCCompositionManifestFragment& entry : fragments) {
     Json content{{"start", entry.contentStart},
                  {"duration", entry.contentDuration ? Json(*entry.contentDuration) : Json()}};
-    fragmentList.push_back(Json{{"file", entry.file},
-                                {"timeRangeInComposition", rangeJson(entry.timeRangeInComposition)},
-                                {"contentRange", std::move(content)},
-                                {"composed", entry.composed}});
+    Json fragment{{"file", entry.file},
+                  {"timeRangeInComposition", rangeJson(entry.timeRangeInComposition)},
+                  {"contentRange", std::move(content)},
+                  {"composed", entry.composed}};
+    if (entry.unreadable) fragment["unreadable"] = true;
+    fragmentList.push_back(std::move(fragment));
   }
   Json root{{"formatVersion", kFormatVersion},
             {"composedAVURL", composedName},

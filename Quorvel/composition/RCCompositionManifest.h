@@ -47,6 +47,10 @@ struct RCCompositionManifestFragment {
   // nullopt: to the end of the file (capture in progress).
   std::optional<double> contentDuration;
   bool composed = false;
+  // Its file could not be read when the recording was last composed (a
+  // capture cut off before its header, say): it was left out of the composed
+  // audio, and its file stays for whoever can still rescue it.
+  bool unreadable = false;
   friend bool operator==(const RCCompositionManifestFragment&,
                          const RCCompositionManifestFragment&) = default;
 };

@@ -241,7 +241,7 @@ TEST_P(CompositionControllerTest, RepairAfterACrashMidCaptureLeavesAConsistentMa
   EXPECT_NEAR(durationOf(editor->composedAVURL()), 1.75, 0.02);
 }
 
-TEST_P(CompositionControllerTest, UnreadableAudioStaysAndMakesComposingFail) {
+TEST_P(CompositionControllerTest, UnreadableAudioIsLeftOutAndKept) {
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, "Broken", "m4a");
   ASSERT_TRUE(editor);
   ASSERT_TRUE(editor->appendFragmentFromAudioFile(tone("good.m4a", 0.5)));
@@ -258,13 +258,34 @@ TEST_P(CompositionControllerTest, UnreadableAudioStaysAndMakesComposingFail) {
   ASSERT_EQ(controller->composition()->fragments().size(), 2u);
   EXPECT_FALSE(controller->composition()->fragments()[1].contentDuration());
   EXPECT_TRUE(logged("cannot be read; keeping it"));
-  std::string manifestBefore = controller->composition()->manifest().serialize();
 
-  EXPECT_FALSE(compose(*controller, false, false));
-  EXPECT_FALSE(fs::exists(editor->composedAVURL().path()));
-  EXPECT_EQ(controller->composition()->decomposedFragments().size(), 2u);
-  EXPECT_EQ(controller->composition()->manifest().serialize(), manifestBefore);
-  EXPECT_TRUE(logged("ERROR: composing Broken.m4a failed"));
+  // The readable rest is composed, even when fragments are deleted after;
+  // the cut-off file stays listed, so nothing deletes it.
+  ASSERT_TRUE(compose(*controller, true, false));
+  EXPECT_TRUE(logged("WARNING: leaving fragment '" + cut->lastPathComponent() +
+                     "' of Broken.composition out of the composed audio"));
+  EXPECT_NEAR(durationOf(editor->composedAVURL()), 0.5, 0.05);
+  EXPECT_TRUE(fs::exists(cut->path()));
+  auto reloaded =
+      RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
+  ASSERT_EQ(reloaded->composition()->fragments().size(), 1u);
+  EXPECT_TRUE(reloaded->composition()->manifest().fragments[0].unreadable);
+  EXPECT_TRUE(reloaded->composition()->decomposedFragments().empty());
+  EXPECT_NEAR(reloaded->composition()->composedDuration(), 0.5, 1e-6);
+
+  // With nothing readable at all, composing fails and changes nothing.
+  auto lone = RCCompositionEditor::createCompositionForNewRecording(*model_, "Lost", "m4a");
+  ASSERT_TRUE(lone);
+  auto lost = lone->beginFragment("m4a");
+  ASSERT_TRUE(lost);
+  fs::copy_file(cut->path(), lost->path());
+  auto nothing =
+      RCCompositionController::compositionControllerForComposedAVURL(lone->composedAVURL());
+  std::string manifestBefore = nothing->composition()->manifest().serialize();
+  EXPECT_FALSE(compose(*nothing, false, false));
+  EXPECT_FALSE(fs::exists(lone->composedAVURL().path()));
+  EXPECT_EQ(nothing->composition()->manifest().serialize(), manifestBefore);
+  EXPECT_TRUE(logged("ERROR: composing Lost.m4a failed"));
 }
 
 TEST_P(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextTrim) {
