@@ -233,8 +233,8 @@ platform::Result<RCSSavedRecordingAccessToken> waitForToken(Start start) {
     if (token) {
       promise.set_value(std::move(*token));
     } else {
-      promise.set_value(platform::fail(error.value_or(
-          platform::Error(RCSDBusErrorGeneric, 0, "the daemon answered neither token nor error"))));
+      promise.set_value(platform::fail(error.value_or(platform::Error(
+          RCSDBusErrorGeneric, 0, "no access was granted: the recording could not be finalized"))));
     }
   });
   return future.get();

@@ -4,6 +4,7 @@
 // binary still serves every request.
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sys/inotify.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -12,6 +13,7 @@
 #include <filesystem>
 #include <fstream>
 #include <string>
+#include <thread>
 
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionEditor.h"
@@ -146,6 +148,59 @@ TEST_F(MediaWorkerDaemonTest, WithoutItsWorkerTheDaemonStillServesAndSaysWhy) {
   EXPECT_TRUE(again) << daemon->output();
   auto exporting = (*client)->fetchExportingCompositionAVURLs();
   EXPECT_TRUE(exporting);
+}
+
+// Blocks until a file whose name starts with `prefix` is created in the
+// directory `watch` was made for.
+void waitForCreation(int watch, const std::string& prefix) {
+  alignas(inotify_event) char buffer[4096];
+  for (;;) {
+    ssize_t length = ::read(watch, buffer, sizeof buffer);
+    ASSERT_GT(length, 0);
+    for (char* at = buffer; at < buffer + length;) {
+      auto* event = reinterpret_cast<inotify_event*>(at);
+      if (event->len > 0 && std::string(event->name).starts_with(prefix)) return;
+      at += sizeof(inotify_event) + event->len;
+    }
+  }
+}
+
+TEST_F(MediaWorkerDaemonTest, AWorkerKilledMidExportFailsThatExportAndTheNextOneSucceeds) {
+  RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
+  auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+  ASSERT_TRUE(model);
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, "Long", "m4a");
+  ASSERT_TRUE(editor);
+  std::string source = (recordings_ / "source.wav").string();
+  ASSERT_TRUE(testing::writeTone(source, 30.0, "wav"));
+  for (int i = 0; i < 3; ++i) {  // wav into m4a: composing re-encodes, which takes a while
+    ASSERT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(source)));
+  }
+  fs::remove(source);
+  const platform::URL audio = editor->composedAVURL();
+  auto daemon = startDaemon();
+  auto client = SavedRecordingServiceClient::connect(bus_.address());
+  ASSERT_TRUE(client);
+
+  int watch = inotify_init1(IN_CLOEXEC);
+  ASSERT_GE(watch, 0);
+  ASSERT_GE(inotify_add_watch(watch, recordings_.c_str(), IN_CREATE), 0);
+  platform::Result<RCSSavedRecordingAccessToken> first = platform::fail(platform::Error("", 0, ""));
+  std::thread exporter([&] { first = (*client)->prepareToExport(audio, false); });
+  waitForCreation(watch, ".Long.m4a");  // the composer's temporary output
+  ::close(watch);
+  for (pid_t child : childrenOf(daemon->pid())) {
+    if (commandName(child) == "quorvel-media") ::kill(child, SIGKILL);
+  }
+  exporter.join();
+  EXPECT_FALSE(first);
+  EXPECT_TRUE(daemon->waitForLine("died with SIGKILL")) << daemon->output();
+  EXPECT_FALSE(fs::exists(audio.path()));  // no half-written composed file
+
+  auto second = (*client)->prepareToExport(audio, false);
+  ASSERT_TRUE(second) << second.error() << daemon->output();
+  (*client)->endAccessSessionWithToken(*second);
+  EXPECT_TRUE(fs::exists(audio.path()));
 }
 
 }  // namespace
