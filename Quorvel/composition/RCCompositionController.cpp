@@ -30,6 +30,10 @@
 #include <sys/stat.h>
 
 #include <cmath>
+#include <cstdint>
+#include <mutex>
+#include <optional>
+#include <unordered_map>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
 #include "Quorvel/errors/RCErrors.h"
@@ -57,10 +61,58 @@ FileState fileState(const platform::URL& url) {
   return FileState::Present;
 }
 
+// Durations already read, by file identity. Every session that opens or
+// closes on a recording repairs it, and reading a duration is a media job
+// (in the daemon, a round trip to its worker); a fragment file does not
+// change once captured, and one that does gets a new size or mtime.
+class DurationCache {
+ public:
+  struct Identity {
+    dev_t device;
+    ino_t inode;
+    off_t size;
+    std::int64_t modifiedNanoseconds;
+    friend bool operator==(const Identity&, const Identity&) = default;
+  };
+
+  std::optional<double> find(const std::string& path, const Identity& identity) {
+    std::lock_guard lock(mutex_);
+    auto entry = entries_.find(path);
+    if (entry == entries_.end() || !(entry->second.first == identity)) return std::nullopt;
+    return entry->second.second;
+  }
+  void insert(const std::string& path, const Identity& identity, double duration) {
+    std::lock_guard lock(mutex_);
+    if (entries_.size() >= kCapacity) entries_.clear();
+    entries_[path] = {identity, duration};
+  }
+
+ private:
+  static constexpr std::size_t kCapacity = 4096;
+  std::mutex mutex_;
+  std::unordered_map<std::string, std::pair<Identity, double>> entries_;
+};
+
+DurationCache& durationCache() {
+  static DurationCache* cache = new DurationCache();
+  return *cache;
+}
+
 // The file's duration in seconds; NaN when it cannot be read.
 double fileDuration(const platform::URL& url) {
+  struct stat info {};
+  std::optional<DurationCache::Identity> identity;
+  if (::stat(url.path().c_str(), &info) == 0 && S_ISREG(info.st_mode)) {
+    identity = DurationCache::Identity{
+        info.st_dev, info.st_ino, info.st_size,
+        std::int64_t{info.st_mtim.tv_sec} * 1'000'000'000 + info.st_mtim.tv_nsec};
+    if (auto known = durationCache().find(url.path(), *identity)) return *known;
+  }
   auto asset = RCAudioAsset::assetWithURL(url);
-  return asset ? asset->duration() : std::nan("");
+  double duration = asset ? asset->duration() : std::nan("");
+  // Only what was read is kept: a failure may be passing (a worker that died).
+  if (identity && std::isfinite(duration)) durationCache().insert(url.path(), *identity, duration);
+  return duration;
 }
 
 // Removes temporary files an interrupted replacement of `destination` left.
