@@ -30,6 +30,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "Quorvel/errors/RCErrors.h"
@@ -156,7 +157,11 @@ class Channel {
 };
 
 void serve(Channel& channel, quorvel::RCMediaEngine& engine, std::chrono::duration<double> idle) {
-  while (std::optional<std::string> body = channel.receive(idle)) {
+  // A worker is started for a request that is on its way: the first one is
+  // waited for without the idle limit (end of file still ends the wait), so
+  // a short idle time cannot make a new worker leave before its first job.
+  std::chrono::duration<double> wait = std::chrono::hours(24);
+  while (std::optional<std::string> body = channel.receive(std::exchange(wait, idle))) {
     auto request = quorvel::RCMediaDecodeRequest(*body);
     if (!request) {
       // No id to answer to: the daemon will see its job end with the worker.
