@@ -24,6 +24,7 @@
 #include "Quorvel/composition/RCCompositionEditor.h"
 #include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "bench/BenchDaemon.h"
 #include "tests/support/TestBus.h"
 
@@ -101,6 +102,7 @@ void exportThroughTheBus(const std::string& address, const std::string& path) {
 }  // namespace
 
 int main() {
+  quorvel::RCUseInProcessMediaEngine();  // this process makes the recordings, as an app does
   platform::testing::TestBus bus;
   const fs::path cache = fs::temp_directory_path() / "quorvel-bench-audio";
   fs::create_directories(cache);
