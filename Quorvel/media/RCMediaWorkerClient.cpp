@@ -53,8 +53,11 @@ namespace {
 constexpr const char* kWorkerName = "quorvel-media";
 // The descriptor the worker finds its socket on.
 constexpr int kWorkerSocketFd = 3;
-// How often a job is retried when its worker exited idle under it.
-constexpr int kAttempts = 3;
+// How often a job is tried when workers exit idle under it. Such a retry is
+// always safe (the worker never read the job) and always ends: a new worker
+// waits for its first job, so only pooled workers can leave under one, and
+// several jobs racing for the two slots may each meet a leaving worker.
+constexpr int kAttempts = 10;
 
 platform::Error workerError(std::string text) {
   return RCMediaError(RCMediaErrorCodeWorkerFailed, std::move(text));
