@@ -7,13 +7,13 @@ namespace quorvel {
 platform::InterfaceDescription RCSSavedRecordingServiceConnection::serviceInterface() {
   auto method = [](const char* name, const char* in, std::vector<std::string> inNames,
                    const char* out, std::vector<std::string> outNames, bool noReply = false) {
-    return platform::MethodSpec{.name = name,
-                                .inputSignature = in,
-                                .inputNames = std::move(inNames),
-                                .outputSignature = out,
-                                .outputNames = std::move(outNames),
-                                .noReply = noReply,
-                                .handler = {}};
+    return platform::MethodDescription{.name = name,
+                                       .inputSignature = in,
+                                       .inputNames = std::move(inNames),
+                                       .outputSignature = out,
+                                       .outputNames = std::move(outNames),
+                                       .noReply = noReply,
+                                       .handler = {}};
   };
   return platform::InterfaceDescription{
       .name = RCSSavedRecordingServiceInterfaceName,
@@ -35,7 +35,7 @@ platform::InterfaceDescription RCSSavedRecordingServiceConnection::serviceInterf
               method(RCSMethodEnableOrphanHandling, "", {}, "", {}),
               method(RCSMethodFetchExportingCompositionAVURLs, "", {}, "as", {"compositionAVURLs"}),
           },
-      .signals = {platform::SignalSpec{
+      .signals = {platform::SignalDescription{
           .name = RCSavedRecordingServiceDidChangeExportingCompositionAVURLsDistributedNotification,
           .signature = "",
           .names = {}}},

@@ -152,10 +152,10 @@ Status BusListener::resume() {
   }
   try {
     core_->object = sdbus::createObject(*core_->bus, options_.objectPath);
-    for (const MethodSpec& declared : interface.methods) {
+    for (const MethodDescription& declared : interface.methods) {
       sdbus::Flags flags;
       if (declared.noReply) flags.set(sdbus::Flags::METHOD_NO_REPLY);
-      const MethodSpec* method = &declared;
+      const MethodDescription* method = &declared;
       auto callback = [this, method](sdbus::MethodCall call) {
         std::string sender = call.getSender();
         bool noReply = call.doesntExpectReply();
@@ -184,7 +184,7 @@ Status BusListener::resume() {
                                       declared.outputSignature, std::move(callback), flags);
       }
     }
-    for (const SignalSpec& signal : interface.signals) {
+    for (const SignalDescription& signal : interface.signals) {
       core_->object->registerSignal(interface.name, signal.name, signal.signature, signal.names);
     }
     core_->object->finishRegistration();

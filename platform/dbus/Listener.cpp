@@ -7,7 +7,7 @@
 namespace platform {
 
 Listener::Listener(InterfaceDescription interface) : interface_(std::move(interface)) {
-  for (const MethodSpec& method : interface_.methods) methodsByName_[method.name] = &method;
+  for (const MethodDescription& method : interface_.methods) methodsByName_[method.name] = &method;
 }
 
 Listener::~Listener() = default;
@@ -22,7 +22,7 @@ ListenerDelegate* Listener::delegate() const {
   return delegate_;
 }
 
-const MethodSpec* Listener::method(std::string_view name) const {
+const MethodDescription* Listener::method(std::string_view name) const {
   auto it = methodsByName_.find(name);
   return it == methodsByName_.end() ? nullptr : it->second;
 }
@@ -44,7 +44,7 @@ Status Listener::validateInterface() const {
   };
   if (interface_.name.empty()) return invalid("no name");
   std::set<std::string> names;
-  for (const MethodSpec& method : interface_.methods) {
+  for (const MethodDescription& method : interface_.methods) {
     if (method.name.empty() || !names.insert(method.name).second)
       return invalid("missing or duplicate method name '" + method.name + "'");
     if (!isSupportedSignature(method.inputSignature) ||
@@ -52,15 +52,16 @@ Status Listener::validateInterface() const {
       return invalid("unsupported signature in method " + method.name);
     if (!method.handler) return invalid("method " + method.name + " has no handler");
   }
-  for (const SignalSpec& signal : interface_.signals) {
+  for (const SignalDescription& signal : interface_.signals) {
     if (signal.name.empty() || !isSupportedSignature(signal.signature))
       return invalid("bad signal '" + signal.name + "'");
   }
   return {};
 }
 
-void Listener::dispatch(const std::string& sender, const MethodSpec& method, BusValues arguments,
-                        bool noReplyExpected, std::unique_ptr<IncomingCall::Responder> responder) {
+void Listener::dispatch(const std::string& sender, const MethodDescription& method,
+                        BusValues arguments, bool noReplyExpected,
+                        std::unique_ptr<IncomingCall::Responder> responder) {
   std::shared_ptr<Connection> connection;
   ListenerDelegate* delegate = nullptr;
   bool isNew = false;

@@ -36,7 +36,7 @@ namespace platform {
 class Listener;
 
 // One method of the published interface.
-struct MethodSpec {
+struct MethodDescription {
   std::string name;
   std::string inputSignature;           // e.g. "sb"; "" for none
   std::vector<std::string> inputNames;  // argument names shown by introspection
@@ -47,7 +47,7 @@ struct MethodSpec {
 };
 
 // One signal of the published interface.
-struct SignalSpec {
+struct SignalDescription {
   std::string name;
   std::string signature;
   std::vector<std::string> names;
@@ -67,8 +67,8 @@ struct SignalMatch {
 
 struct InterfaceDescription {
   std::string name;  // e.g. "org.quorvel.SavedRecordingService1"
-  std::vector<MethodSpec> methods;
-  std::vector<SignalSpec> signals;
+  std::vector<MethodDescription> methods;
+  std::vector<SignalDescription> signals;
   // Signals of others the listener subscribes to, installed before the name
   // is requested.
   std::vector<SignalMatch> matches;
@@ -113,7 +113,7 @@ class Listener {
 
   const InterfaceDescription& interfaceDescription() const { return interface_; }
   // The method `name` of the interface, or nullptr.
-  const MethodSpec* method(std::string_view name) const;
+  const MethodDescription* method(std::string_view name) const;
 
   // The table of accepted (and refused) peers.
   std::size_t connectionCount() const;
@@ -127,7 +127,7 @@ class Listener {
 
   // Delivery thread: routes a call of `method` from peer `sender`, creating
   // and offering the peer's connection first when it is new.
-  void dispatch(const std::string& sender, const MethodSpec& method, BusValues arguments,
+  void dispatch(const std::string& sender, const MethodDescription& method, BusValues arguments,
                 bool noReplyExpected, std::unique_ptr<IncomingCall::Responder> responder);
   // Delivery thread: `uniqueName` has left the bus; invalidates its
   // connection, if any, exactly once.
@@ -140,7 +140,7 @@ class Listener {
 
  private:
   InterfaceDescription interface_;
-  std::map<std::string, const MethodSpec*, std::less<>> methodsByName_;
+  std::map<std::string, const MethodDescription*, std::less<>> methodsByName_;
   mutable std::mutex mutex_;  // guards the fields below
   ListenerDelegate* delegate_ = nullptr;
   std::map<std::string, std::shared_ptr<Connection>> connections_;

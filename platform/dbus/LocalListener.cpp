@@ -160,7 +160,7 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
 void LocalListener::deliverChecked(const std::string& sender, const std::string& member,
                                    BusValues arguments, bool noReplyExpected,
                                    std::unique_ptr<IncomingCall::Responder> responder) {
-  const MethodSpec* declared = method(member);
+  const MethodDescription* declared = method(member);
   if (!declared) {
     if (!noReplyExpected) {
       responder->sendError(

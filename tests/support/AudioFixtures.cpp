@@ -87,7 +87,7 @@ platform::Status writeTone(const std::string& path, double seconds, const std::s
                            int sampleRate, int channels, double frequencyHz, double amplitude,
                            M4ALayout layout) {
   return writeTone(
-      path, ToneSpec{seconds, format, sampleRate, channels, frequencyHz, amplitude, layout, {}});
+      path, ToneOptions{seconds, format, sampleRate, channels, frequencyHz, amplitude, layout, {}});
 }
 
 platform::Status writeDamagedAudio(const std::string& dir) {
@@ -119,7 +119,7 @@ platform::Status writeDamagedAudio(const std::string& dir) {
   return {};
 }
 
-platform::Status writeTone(const std::string& path, const ToneSpec& tone) {
+platform::Status writeTone(const std::string& path, const ToneOptions& tone) {
   RCInstallFFmpegLogging();
   auto choice = choose(tone.format);
   if (!choice) return platform::fail(choice.error());

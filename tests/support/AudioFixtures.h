@@ -17,7 +17,7 @@ namespace quorvel::testing {
 // the muxer writes it by default, or before it ("faststart").
 enum class M4ALayout { MoovAtEnd, MoovFirst };
 
-struct ToneSpec {
+struct ToneOptions {
   double seconds = 1.0;
   // "m4a" (AAC in MP4), "flac" or "wav" (16-bit PCM).
   std::string format = "m4a";
@@ -32,7 +32,7 @@ struct ToneSpec {
 };
 
 // Writes a sine tone to `path` (replacing any file there).
-platform::Status writeTone(const std::string& path, const ToneSpec& tone);
+platform::Status writeTone(const std::string& path, const ToneOptions& tone);
 platform::Status writeTone(const std::string& path, double seconds, const std::string& format,
                            int sampleRate = 44100, int channels = 1, double frequencyHz = 440.0,
                            double amplitude = 0.5, M4ALayout layout = M4ALayout::MoovAtEnd);

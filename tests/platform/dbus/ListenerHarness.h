@@ -205,7 +205,7 @@ class BusHarness {
       proxy.callMethod(message);
       return [] { return Answer{}; };
     }
-    const MethodSpec* method = listener_.method(member);
+    const MethodDescription* method = listener_.method(member);
     std::string signature = method ? method->outputSignature : "";
     auto promise = std::make_shared<std::promise<Answer>>();
     std::shared_future<Answer> answer = promise->get_future().share();

@@ -113,7 +113,7 @@ TEST_F(RCAudioAssetTest, TitleItemsAreTheFilesOwn) {
   ASSERT_TRUE(metadata) << metadata.error();
   EXPECT_EQ(metadata->titleItems, (std::vector<RCMetadataItem>{{"Bonjour", "fra"}}));
 
-  testing::ToneSpec tone;
+  testing::ToneOptions tone;
   tone.seconds = 0.5;
   tone.metadata = {{"title", "Plain"}, {"creation_time", "2021-06-07T08:09:10.000000Z"}};
   ASSERT_TRUE(writeTone(path("many.m4a"), tone));

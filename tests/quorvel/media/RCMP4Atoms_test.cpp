@@ -116,7 +116,7 @@ TEST_F(RCMP4AtomsTest, ASingleTaggedTitleIsOneItemThoughLibavformatShowsTwo) {
 TEST_F(RCMP4AtomsTest, UntaggedTitlesFromTheMuxerAndOursAreOneTitle) {
   // The muxer writes an untagged title as an iTunes-style item.
   const std::string file = path("muxed.m4a");
-  testing::ToneSpec tone;
+  testing::ToneOptions tone;
   tone.seconds = 0.5;
   tone.metadata = {{"title", "From the muxer"}};
   ASSERT_TRUE(writeTone(file, tone));

@@ -41,17 +41,17 @@ class MediaWorkerClientTest : public testing::RecordingsDirectoryTest {
 
   static RCMediaWorkerClient::Options options() { return ScopedMediaWorkerEngine::defaults(); }
 
-  platform::URL tone(const std::string& name, const testing::ToneSpec& spec) {
+  platform::URL tone(const std::string& name, const testing::ToneOptions& shape) {
     std::string file = (recordings_ / name).string();
-    auto written = testing::writeTone(file, spec);
+    auto written = testing::writeTone(file, shape);
     EXPECT_TRUE(written) << written.error();
     return platform::URL::fileURLWithPath(file);
   }
   platform::URL tone(const std::string& name, double seconds) {
-    testing::ToneSpec spec;
-    spec.seconds = seconds;
-    spec.format = fs::path(name).extension().string().substr(1);
-    return tone(name, spec);
+    testing::ToneOptions shape;
+    shape.seconds = seconds;
+    shape.format = fs::path(name).extension().string().substr(1);
+    return tone(name, shape);
   }
 
   // A recording "Walk" of two decomposed fragments, made in process.
@@ -84,10 +84,10 @@ class MediaWorkerClientTest : public testing::RecordingsDirectoryTest {
 };
 
 TEST_F(MediaWorkerClientTest, EveryJobGivesWhatTheInProcessEngineGives) {
-  testing::ToneSpec spec;
-  spec.seconds = 1.5;
-  spec.metadata = {{"title", "Walk"}, {"creation_time", "2020-01-02T03:04:05Z"}};
-  platform::URL titled = tone("titled.m4a", spec);
+  testing::ToneOptions shape;
+  shape.seconds = 1.5;
+  shape.metadata = {{"title", "Walk"}, {"creation_time", "2020-01-02T03:04:05Z"}};
+  platform::URL titled = tone("titled.m4a", shape);
   platform::URL flac = tone("b.flac", 0.5);
   ScopedMediaWorkerEngine worker(options());
   RCMediaEngine& engine = worker.client();
