@@ -23,29 +23,14 @@ extern "C" {
 #include "Quorvel/media/RCAudioDecoder.h"
 #include "Quorvel/media/RCComposer.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
+#include "bench/BenchTiming.h"
 
 namespace fs = std::filesystem;
 
 namespace {
 
-double seconds(const std::function<void()>& work) {
-  const auto start = std::chrono::steady_clock::now();
-  work();
-  return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-}
-
-double bestOf(int runs, const std::function<void()>& work) {
-  double best = 1e9;
-  for (int i = 0; i < runs; ++i) best = std::min(best, seconds(work));
-  return best;
-}
-
-void run(const std::string& command) {
-  if (std::system(command.c_str()) != 0) {
-    std::fprintf(stderr, "failed: %s\n", command.c_str());
-    std::exit(1);
-  }
-}
+using quorvel::bench::bestOf;
+using quorvel::bench::run;
 
 // 20 minutes of AAC (a sweep over noise, so the encoder works as on speech).
 std::string input(const fs::path& cache, int index) {

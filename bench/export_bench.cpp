@@ -26,28 +26,19 @@
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "bench/BenchDaemon.h"
+#include "bench/BenchTiming.h"
 #include "tests/support/TestBus.h"
 
 namespace fs = std::filesystem;
 
 namespace {
 
+using quorvel::bench::run;
+using quorvel::bench::seconds;
+
 constexpr const char* kService = "org.quorvel.SavedRecordingService";
 constexpr const char* kPath = "/org/quorvel/SavedRecordingService";
 constexpr const char* kInterface = "org.quorvel.SavedRecordingService1";
-
-double seconds(const std::function<void()>& work) {
-  const auto start = std::chrono::steady_clock::now();
-  work();
-  return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-}
-
-void run(const std::string& command) {
-  if (std::system(command.c_str()) != 0) {
-    std::fprintf(stderr, "failed: %s\n", command.c_str());
-    std::exit(1);
-  }
-}
 
 // AAC of `length` seconds (a tone over noise, so the encoder works as on
 // speech), made once and kept in the cache.

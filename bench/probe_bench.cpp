@@ -16,22 +16,14 @@
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
+#include "bench/BenchTiming.h"
 #include "tests/support/AudioFixtures.h"
 
 namespace fs = std::filesystem;
 
 namespace {
 
-double bestOf(int runs, const std::function<void()>& work) {
-  double best = 1e9;
-  for (int i = 0; i < runs; ++i) {
-    const auto start = std::chrono::steady_clock::now();
-    work();
-    best = std::min(
-        best, std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
-  }
-  return best;
-}
+using quorvel::bench::bestOf;
 
 }  // namespace
 

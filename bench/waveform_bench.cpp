@@ -13,28 +13,14 @@
 #include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
 #include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
+#include "bench/BenchTiming.h"
 
 namespace fs = std::filesystem;
 
 namespace {
 
-double bestOf(int runs, const std::function<void()>& work) {
-  double best = 1e9;
-  for (int i = 0; i < runs; ++i) {
-    const auto start = std::chrono::steady_clock::now();
-    work();
-    best = std::min(
-        best, std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
-  }
-  return best;
-}
-
-void run(const std::string& command) {
-  if (std::system(command.c_str()) != 0) {
-    std::fprintf(stderr, "failed: %s\n", command.c_str());
-    std::exit(1);
-  }
-}
+using quorvel::bench::bestOf;
+using quorvel::bench::run;
 
 }  // namespace
 
