@@ -15,6 +15,8 @@
 #include <csignal>
 #include <mutex>
 
+#include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
+#include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "platform/GlobalQueue.h"
 #include "platform/Log.h"
@@ -164,8 +166,15 @@ void SavedRecordingService::_onQueuePerformOrphanHandlingIfEnabled() {
         "[Orphan-Recovery] Skipping orphan handling because it is temporarily disabled for sync");
     return;
   }
-  // The recovery run itself is not part of this daemon yet.
-  QV_LOG(platform::kLogLevelNotice, "[Orphan-Recovery] Orphan recovery is not available yet");
+  auto model = RCSavedRecordingsModel::sharedModelForQueue(_serviceSerialQueue);
+  if (!model) {
+    QV_LOG(platform::kLogLevelError,
+           "[Orphan-Recovery] Skipping orphan handling: the recordings database cannot be used: {}",
+           model.error());
+    return;
+  }
+  RCSOrphanHandling(**model).performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs(
+      _onQueue_composedAVURLsWithActiveSessionsOrScheduledWork());
 }
 
 }  // namespace quorvel

@@ -29,6 +29,7 @@
 #include <dirent.h>
 #include <sys/stat.h>
 
+#include <cerrno>
 #include <cmath>
 #include <cstdint>
 #include <mutex>
@@ -56,7 +57,11 @@ enum class FileState { Missing, Empty, Present };
 
 FileState fileState(const platform::URL& url) {
   struct stat info {};
-  if (::lstat(url.path().c_str(), &info) != 0) return FileState::Missing;
+  // Only ENOENT means gone: a file that cannot be looked at now (EACCES,
+  // EIO…) is kept, and reading its duration then reports it.
+  if (::lstat(url.path().c_str(), &info) != 0) {
+    return errno == ENOENT ? FileState::Missing : FileState::Present;
+  }
   if (S_ISREG(info.st_mode) && info.st_size == 0) return FileState::Empty;
   return FileState::Present;
 }

@@ -34,6 +34,20 @@ std::shared_ptr<RCAudioAsset> RCAudioAsset::assetWithURL(const platform::URL& ur
   return std::make_shared<RCAudioAsset>(url, probe->duration, std::move(probe->containerName));
 }
 
+platform::Result<std::shared_ptr<RCAudioAsset>> RCAudioAsset::examineAssetWithURL(
+    const platform::URL& url) {
+  auto probe = RCMediaEngine::current()->probe(url);
+  if (!probe) {
+    // The media engine reports what it read and found unusable in the asset
+    // domain; anything else (POSIX, the worker's own failures) is a failure
+    // to look.
+    if (probe.error().domain() == kRCAudioAssetErrorDomain) return nullptr;
+    return platform::fail(probe.error());
+  }
+  if (!probe->playable) return nullptr;
+  return std::make_shared<RCAudioAsset>(url, probe->duration, std::move(probe->containerName));
+}
+
 platform::Result<RCCommonMetadata> RCAudioAsset::loadCommonMetadata() const {
   return readCommonMetadata(url_);
 }

@@ -38,6 +38,12 @@ class RCAudioAsset {
   // nullptr when the file cannot be opened (missing, unreadable, not a
   // regular file, not a media file) or holds no audio stream.
   static std::shared_ptr<RCAudioAsset> assetWithURL(const platform::URL& url);
+  // The same, telling a file that was read and holds no playable audio
+  // (nullptr: not a media file, or no audio stream) from one that could not
+  // be examined (an error: I/O failure, no permission, a media worker that
+  // died or timed out), which says nothing about its contents.
+  static platform::Result<std::shared_ptr<RCAudioAsset>> examineAssetWithURL(
+      const platform::URL& url);
 
   const platform::URL& url() const { return url_; }
   // In seconds; NaN when the file does not say.

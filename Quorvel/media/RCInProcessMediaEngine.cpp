@@ -9,6 +9,7 @@ extern "C" {
 #include <strings.h>
 #include <sys/stat.h>
 
+#include <cerrno>
 #include <chrono>
 #include <cmath>
 #include <cstring>
@@ -37,6 +38,28 @@ platform::Error assetError(long code, std::string text) {
   return platform::Error(kRCAudioAssetErrorDomain, code, std::move(text));
 }
 
+bool isSystemError(int status) {
+  switch (AVUNERROR(status)) {
+    case EACCES:
+    case EPERM:
+    case EIO:
+    case ENOMEM:
+    case EMFILE:
+    case ENFILE:
+    case ENOENT:
+    case EAGAIN:
+    case EINTR:
+    case ENXIO:
+    case ENODEV:
+    case EBUSY:
+    case ETIMEDOUT:
+    case ELOOP:
+      return true;
+    default:
+      return false;
+  }
+}
+
 // Opens `path` with libavformat. Only regular files: a FIFO or a device
 // would block the open or the reads forever.
 platform::Result<Input> openInput(const std::string& path) {
@@ -48,6 +71,11 @@ platform::Result<Input> openInput(const std::string& path) {
   AVFormatContext* raw = nullptr;
   const int status = RCOpenMediaInput(&raw, path.c_str());
   if (status < 0) {
+    // A system error says nothing about the contents (the file could not be
+    // read); everything else is libavformat finding no media it can open.
+    if (isSystemError(status)) {
+      return platform::fail(platform::posixError(AVUNERROR(status), "open " + path));
+    }
     char text[AV_ERROR_MAX_STRING_SIZE] = {};
     av_strerror(status, text, sizeof text);
     return platform::fail(assetError(2, fmt::format("cannot open {}: {}", path, text)));

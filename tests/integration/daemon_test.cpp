@@ -5,8 +5,10 @@
 
 #include <csignal>
 #include <filesystem>
+#include <fstream>
 #include <string>
 
+#include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
 #include "tests/support/AudioFixtures.h"
@@ -30,7 +32,11 @@ class DaemonTest : public ::testing::Test {
                    ::testing::UnitTest::GetInstance()->current_test_info()->name());
     std::filesystem::remove_all(recordings_);
   }
-  void TearDown() override { std::filesystem::remove_all(recordings_); }
+  void TearDown() override {
+    std::filesystem::remove_all(recordings_);
+    for (int i = 0; i < 3; ++i)
+      std::filesystem::remove(recordings_.string() + "-take" + std::to_string(i) + ".wav");
+  }
 
   std::unique_ptr<DaemonProcess> startDaemon(const std::string& idleExitAfter = "0") {
     auto daemon = std::make_unique<DaemonProcess>(
@@ -160,7 +166,9 @@ TEST_F(DaemonTest, AnExportComposesTheFragmentsAndCachesTheWaveform) {
   std::vector<std::string> made{"new", "--recordings-dir", recordings_.string(), "Walk"};
   const double seconds[] = {1.5, 0.75, 1.0};
   for (int i = 0; i < 3; ++i) {
-    std::string file = (recordings_ / ("take" + std::to_string(i) + ".wav")).string();
+    // Outside the recordings directory, where the orphan recovery run would
+    // take them for recordings of their own.
+    std::string file = (recordings_.string() + "-take" + std::to_string(i) + ".wav");
     ASSERT_TRUE(testing::writeTone(file, seconds[i], "wav"));
     made.push_back(file);
   }
@@ -181,6 +189,36 @@ TEST_F(DaemonTest, AnExportComposesTheFragmentsAndCachesTheWaveform) {
               pcm->seconds(), 0.05);
   auto info = quorvelctl({"info", "--recordings-dir", recordings_.string(), audio.string()});
   EXPECT_EQ(info.output.find("not composed"), std::string::npos) << info.output;
+}
+
+// A directory seeded with orphans: the run (here the one that enabling
+// orphan handling starts, which answers after it) keeps one of two identical
+// files and recovers it with the title stored in it, deletes the unplayable
+// file, and leaves what is not a recording alone.
+TEST_F(DaemonTest, OrphansDroppedIntoTheDirectoryAreRecoveredOrRemoved) {
+  std::filesystem::create_directories(recordings_);
+  auto path = [&](const char* name) { return (recordings_ / name).string(); };
+  ASSERT_TRUE(testing::writeTone(path("Found.m4a"), 1.0, "m4a"));
+  ASSERT_TRUE(RCMediaEngine::current()->writeTitle(
+      platform::URL::fileURLWithPath(path("Found.m4a")), "Found on a card", ""));
+  std::filesystem::copy_file(path("Found.m4a"), path("Found again.m4a"));
+  std::filesystem::copy_file(path("Found.m4a"), path("notes.txt"));
+  {
+    std::ofstream noise(path("Noise.wav"));
+    noise << std::string(4096, 'x');
+  }
+  auto daemon = startDaemon();
+  auto enabled = quorvelctl({"enable-orphan-handling"});
+  ASSERT_EQ(enabled.status, 0) << enabled.output;
+
+  EXPECT_TRUE(std::filesystem::exists(path("Found.m4a")));
+  EXPECT_TRUE(std::filesystem::exists(path("notes.txt")));
+  EXPECT_FALSE(std::filesystem::exists(path("Found again.m4a"))) << daemon->output();
+  EXPECT_FALSE(std::filesystem::exists(path("Noise.wav")));
+  auto listed = quorvelctl({"list", "--recordings-dir", recordings_.string()});
+  ASSERT_EQ(listed.status, 0) << listed.output;
+  EXPECT_NE(listed.output.find("Found on a card"), std::string::npos) << listed.output;
+  EXPECT_EQ(listed.output.find("Noise"), std::string::npos) << listed.output;
 }
 
 TEST_F(DaemonTest, ForeignClientsGetTheContractsErrors) {

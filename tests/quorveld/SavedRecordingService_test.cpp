@@ -52,14 +52,14 @@ TEST_F(ServiceTest, AFailedStartTriesANewListenerAndASecondStartKeepsIt) {
   ASSERT_TRUE(service_->start());
   const auto starting = linesContaining("Starting service 'org.quorvel.SavedRecordingService'");
   advance(1s);
-  const auto passes = linesContaining("[Orphan-Recovery]");
+  const auto passes = linesContaining("checking for orphaned recordings");
   ASSERT_TRUE(service_->start());  // a second start keeps its listener but runs a pass
   EXPECT_EQ(made, 2);
   EXPECT_EQ(service_->listener(), listener_);
   EXPECT_FALSE(call(":1.1", "FetchExportingCompositionAVURLs")->isError());
   EXPECT_EQ(linesContaining("Starting service 'org.quorvel.SavedRecordingService'"), starting);
   advance(1s);
-  EXPECT_EQ(linesContaining("[Orphan-Recovery]").size(), passes.size() + 1);
+  EXPECT_EQ(linesContaining("checking for orphaned recordings").size(), passes.size() + 1);
 }
 
 TEST_F(ServiceTest, WithoutClientsTheRootIsHeldUntilTwoSeconds) {
@@ -69,7 +69,7 @@ TEST_F(ServiceTest, WithoutClientsTheRootIsHeldUntilTwoSeconds) {
   ASSERT_TRUE(listener_);
 
   advance(1s);  // the first orphan-handling pass runs
-  EXPECT_EQ(linesContaining("[Orphan-Recovery]").size(), 1u);
+  EXPECT_EQ(linesContaining("checking for orphaned recordings").size(), 1u);
   EXPECT_TRUE(controller().isInTransaction());
   advance(999ms);
   EXPECT_TRUE(controller().isInTransaction());

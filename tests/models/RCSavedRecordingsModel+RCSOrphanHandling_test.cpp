@@ -1,0 +1,296 @@
+// The orphan recovery run on a real recordings directory: real audio made by
+// the tests, a real database, the in-process media engine. Checks what stays,
+// what goes, what is inserted with which title, and what is digested.
+#include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <map>
+
+#include "Models/RCPathOrder.h"
+#include "Quorvel/composition/RCCompositionEditor.h"
+#include "Quorvel/files/RCFileCreationDate.h"
+#include "Quorvel/locale/RCLocalizedRecordingDate.h"
+#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "tests/support/AudioFixtures.h"
+#include "tests/support/RecordingsDirectoryFixture.h"
+
+namespace quorvel {
+namespace {
+
+namespace fs = std::filesystem;
+
+// The in-process engine, except that probing a file whose name contains
+// "Flaky" fails as an I/O error does.
+class FlakyDiskEngine : public RCMediaEngine {
+ public:
+  platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
+    if (url.lastPathComponent().find("Flaky") != std::string::npos)
+      return platform::fail(platform::posixError(EIO, "read " + url.path()));
+    return disk_.probe(url);
+  }
+  platform::Status compose(const std::vector<RCComposerSegment>& segments,
+                           const platform::URL& destination,
+                           const std::optional<platform::URL>& waveform,
+                           const RCMediaProgress& progress) override {
+    return disk_.compose(segments, destination, waveform, progress);
+  }
+  platform::Status buildWaveform(const platform::URL& audio, const platform::URL& destination,
+                                 const RCMediaProgress& progress) override {
+    return disk_.buildWaveform(audio, destination, progress);
+  }
+  platform::Status writeTitle(const platform::URL& file, const std::string& title,
+                              const std::string& language) override {
+    return disk_.writeTitle(file, title, language);
+  }
+
+ private:
+  RCInProcessMediaEngine disk_;
+};
+
+class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
+ protected:
+  void SetUp() override {
+    RecordingsDirectoryTest::SetUp();
+    if (const char* language = std::getenv("LANGUAGE")) savedLanguage_ = language;
+  }
+  void TearDown() override {
+    if (savedLanguage_) {
+      ::setenv("LANGUAGE", savedLanguage_->c_str(), 1);
+    } else {
+      ::unsetenv("LANGUAGE");
+    }
+    RCUseInProcessMediaEngine();
+    RecordingsDirectoryTest::TearDown();
+  }
+
+  std::shared_ptr<RCSavedRecordingsModel> model() {
+    if (!model_) {
+      auto opened = RCSavedRecordingsModel::modelWithDirectory(
+          RCSavedRecordingsModel::savedRecordingsDirectory());
+      EXPECT_TRUE(opened) << opened.error();
+      model_ = *opened;
+    }
+    return model_;
+  }
+  void tone(const std::string& name, double seconds, double frequency = 440) {
+    testing::ToneOptions options;
+    options.seconds = seconds;
+    options.frequencyHz = frequency;
+    options.format = fs::path(name).extension().string().substr(1);
+    ASSERT_TRUE(testing::writeTone(recordingsPath(name), options));
+  }
+  void copy(const std::string& from, const std::string& to) {
+    fs::copy_file(recordingsPath(from), recordingsPath(to));
+  }
+  static void age(const fs::path& path, double seconds) {
+    fs::last_write_time(
+        path, fs::last_write_time(path) - std::chrono::duration_cast<fs::file_time_type::duration>(
+                                              std::chrono::duration<double>(seconds)));
+  }
+  RCSOrphanHandling::Statistics run(const std::vector<platform::URL>& inUse = {}) {
+    RCSOrphanHandling handling(*model());
+    handling.performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs(inUse);
+    return handling.statistics();
+  }
+  // File name -> title of every database recording.
+  std::map<std::string, std::string> titles() {
+    std::map<std::string, std::string> found;
+    EXPECT_TRUE(model()->enumerateExistingRecordingsWithBlock([&](const auto& recording, bool&) {
+      found[recording->url() ? recording->url()->lastPathComponent() : ""] =
+          recording->customLabel();
+    }));
+    return found;
+  }
+  bool present(const std::string& name) const { return fs::exists(recordingsPath(name)); }
+  std::size_t linesContaining(const std::string& text) {
+    auto lines = logLines();
+    return std::count_if(lines.begin(), lines.end(),
+                         [&](const std::string& line) { return line.find(text) != line.npos; });
+  }
+  // Makes every database recording an orphan: a new, empty database.
+  void forgetDatabase() {
+    model_.reset();
+    for (const char* suffix : {"", "-wal", "-shm"})
+      fs::remove(recordingsPath(std::string(RCSavedRecordingsModel::kDatabaseFileName) + suffix));
+  }
+
+  std::shared_ptr<RCSavedRecordingsModel> model_;
+  std::optional<std::string> savedLanguage_;
+};
+
+TEST(PathOrderTest, ShorterFirstThenDigitRunsByValue) {
+  std::vector<std::string> paths{"/r/13.m4a", "/r/10.m4a",      "/r/9.m4a",  "/r/12.m4a",
+                                 "/r/b.m4a",  "/r/Take 12.m4a", "/r/B.m4a",  "/r/Take 2.m4a",
+                                 "/r/😀.m4a",  "/r/ab.m4a",      "/r/007.m4a"};
+  std::sort(paths.begin(), paths.end(), RCPathOrderLess);
+  EXPECT_EQ(paths, (std::vector<std::string>{"/r/9.m4a", "/r/B.m4a", "/r/b.m4a", "/r/10.m4a",
+                                             "/r/12.m4a", "/r/13.m4a", "/r/ab.m4a", "/r/😀.m4a",
+                                             "/r/007.m4a", "/r/Take 2.m4a", "/r/Take 12.m4a"}));
+  EXPECT_EQ(RCUTF16Length("😀é"), 3u);
+  EXPECT_EQ(RCNumericCompare("a01", "a1"), 0);
+}
+
+// Identical orphans keep the first in path order, a copy of a database
+// recording's file goes, same size with other bytes stays, empty and
+// unplayable files go, other extensions stay, and only files whose sizes
+// collide are digested.
+TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
+  tone("Kept.m4a", 1.0);
+  model()->insertRecordingWithAudioFile(recordingsPath("Kept.m4a"), 1.0, platform::Date::now());
+  copy("Kept.m4a", "Copy of kept.m4a");
+  copy("Kept.m4a", "Same size.m4a");
+  {
+    std::string bytes = testing::readFile(recordingsPath("Same size.m4a"));
+    bytes[bytes.size() / 2] = char(bytes[bytes.size() / 2] ^ 0x55);
+    testing::writeFile(recordingsPath("Same size.m4a"), bytes);
+  }
+  tone("Recording.m4a", 2.0, 330);
+  copy("Recording.m4a", "Recording 2.m4a");
+  tone("10.wav", 0.5);
+  copy("10.wav", "9.wav");
+  tone("12.flac", 0.5);
+  copy("12.flac", "13.flac");
+  testing::writeFile(recordingsPath("Empty.m4a"), "");
+  testing::writeFile(recordingsPath("Noise.m4a"), std::string(3000, 'x'));
+  copy("Recording.m4a", "Upper.M4A");
+  copy("Recording.m4a", "Other.mp3");
+  fs::create_directory(recordingsPath("Folder.m4a"));
+
+  auto statistics = run();
+
+  std::map<std::string, std::string> recorded = titles();
+  for (const char* stays : {"Kept.m4a", "Same size.m4a", "Recording.m4a", "9.wav", "12.flac"}) {
+    EXPECT_TRUE(present(stays)) << stays;
+    EXPECT_TRUE(recorded.contains(stays)) << stays;
+  }
+  EXPECT_EQ(recorded.size(), 5u);
+  for (const char* goes :
+       {"Copy of kept.m4a", "Recording 2.m4a", "10.wav", "13.flac", "Empty.m4a", "Noise.m4a"}) {
+    EXPECT_FALSE(present(goes)) << goes;
+  }
+  for (const char* untouched : {"Upper.M4A", "Other.mp3", "Folder.m4a"})
+    EXPECT_TRUE(present(untouched)) << untouched;
+  EXPECT_EQ(linesContaining("orphanPath = Copy of kept.m4a matches existing file = Kept.m4a"), 1u);
+  EXPECT_EQ(linesContaining("orphanPath = Empty.m4a matches"), 0u);
+  EXPECT_EQ(linesContaining("'Empty.m4a' already has a duplicate"), 1u);
+  EXPECT_EQ(linesContaining("'Noise.m4a' unable to load AVURLAsset"), 1u);
+  // Kept, its copy and the changed copy; each identical pair; nothing else.
+  EXPECT_EQ(statistics.filesDigested, 9u);
+  EXPECT_EQ(statistics.assetsProbed, 5u);  // the four unique orphans and Noise
+  EXPECT_EQ(statistics.recordingsInserted, 4u);
+}
+
+// Bundles: one a client names through "..", one recovered into the database
+// with its record written into its manifest, an empty old one removed, an
+// empty young one and an unloadable one left alone.
+TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
+  const std::string take = (root_ / "take.wav").string();
+  ASSERT_TRUE(testing::writeTone(take, 1.0, "wav"));
+  for (const char* name : {"Walk", "Stray"}) {
+    auto editor = RCCompositionEditor::createCompositionForNewRecording(*model(), name);
+    ASSERT_TRUE(editor) << editor.error();
+    ASSERT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take)));
+  }
+  for (const char* name : {"Hollow", "Fresh"})
+    ASSERT_TRUE(RCCompositionEditor::createCompositionForNewRecording(*model(), name));
+  fs::create_directory(recordingsPath("Broken.composition"));
+  testing::writeFile(recordingsPath("Broken.composition/manifest.json"), "{");
+  fs::create_directory(recordingsPath("Lower.COMPOSITION"));
+  forgetDatabase();
+  for (const char* name : {"Hollow.composition", "Broken.composition", "Lower.COMPOSITION"})
+    age(recordingsPath(name), 3600);
+
+  run({platform::URL::fileURLWithPath(recordingsPath("x/../Walk.m4a"))});
+
+  EXPECT_EQ(titles().size(), 1u);
+  auto stray =
+      model()->recordingWithURL(platform::URL::fileURLWithPath(recordingsPath("Stray.m4a")));
+  ASSERT_TRUE(stray && *stray);
+  auto recovered =
+      RCComposition::load(platform::URL::fileURLWithPath(recordingsPath("Stray.composition")));
+  ASSERT_TRUE(recovered) << recovered.error();
+  EXPECT_EQ((*recovered)->savedRecordingURI(), (*stray)->URIRepresentation());
+  EXPECT_FALSE(present("Hollow.composition"));
+  for (const char* stays : {"Walk.composition", "Fresh.composition", "Broken.composition",
+                            "Lower.COMPOSITION", "Stray.composition"}) {
+    EXPECT_TRUE(present(stays)) << stays;
+  }
+  EXPECT_EQ(linesContaining("Leaving composition (Broken.composition) alone"), 1u);
+  EXPECT_EQ(linesContaining("(Walk.composition)"), 0u);
+}
+
+// What must survive: a database recording named through another spelling of
+// the directory, a hard link to it, a file the media engine could not read,
+// and a young leftover of an atomic replace (an old one goes).
+TEST_F(OrphanHandlingTest, NeverDeletesWhatItCouldNotProveOrphaned) {
+  tone("Only.m4a", 1.0);
+  const fs::path alias = root_ / "Alias";
+  fs::create_directory_symlink(recordings_, alias);
+  RCSavedRecordingsModel::setSavedRecordingsDirectory(alias.string());
+  model()->insertRecordingWithAudioFile(recordingsPath("Only.m4a"), 1.0, platform::Date::now());
+  fs::create_hard_link(recordingsPath("Only.m4a"), recordingsPath("Linked.m4a"));
+  tone("Flaky.m4a", 1.5);
+  copy("Flaky.m4a", "Flaky copy.m4a");
+  testing::writeFile(recordingsPath(".Old.m4a.abcdefgh.tmp"), "old");
+  testing::writeFile(recordingsPath(".New.m4a.abcdefgh.tmp"), "new");
+  age(recordingsPath(".Old.m4a.abcdefgh.tmp"), 2 * 3600);
+  RCMediaEngine::setCurrent(std::make_shared<FlakyDiskEngine>());
+
+  run();
+
+  for (const char* stays : {"Only.m4a", "Linked.m4a", "Flaky.m4a", ".New.m4a.abcdefgh.tmp"})
+    EXPECT_TRUE(present(stays)) << stays;
+  EXPECT_FALSE(present(".Old.m4a.abcdefgh.tmp"));
+  // The copy of the file that could not be examined still duplicates it.
+  EXPECT_FALSE(present("Flaky copy.m4a"));
+  EXPECT_EQ(titles().size(), 1u);
+  EXPECT_EQ(linesContaining("'Only.m4a'"), 0u);
+  EXPECT_EQ(linesContaining("'Flaky.m4a' could not be examined"), 1u);
+}
+
+// Titles follow the preferred languages; the container's creation date is
+// used only without a title; a missing file changes nothing.
+TEST_F(OrphanHandlingTest, RecoveredTitlesAndDatesComeFromTheFile) {
+  const auto created = platform::Date::fromISO8601("2020-01-02T03:04:05Z");
+  testing::ToneOptions options;
+  options.metadata = {{"creation_time", "2020-01-02T03:04:05Z"}};
+  for (const char* name : {"Tagged.m4a", "Single.m4a"})
+    ASSERT_TRUE(testing::writeTone(recordingsPath(name), options));
+  auto engine = RCMediaEngine::current();
+  auto url = [&](const char* name) { return platform::URL::fileURLWithPath(recordingsPath(name)); };
+  ASSERT_TRUE(engine->writeTitle(url("Tagged.m4a"), "Walk", "eng"));
+  ASSERT_TRUE(engine->writeTitle(url("Tagged.m4a"), "Spaziergang", "deu"));
+  ASSERT_TRUE(engine->writeTitle(url("Single.m4a"), "Solo", "fra"));
+  auto recording = [&](const char* name) {
+    return model()->insertRecordingWithAudioFile(recordingsPath(name), 1, platform::Date::now());
+  };
+
+  ::setenv("LANGUAGE", "fr:de:en", 1);
+  auto tagged = recording("Tagged.m4a");
+  ASSERT_TRUE(RCSApplyAssetMetadataToRecording(*tagged));
+  EXPECT_EQ(tagged->customLabel(), "Spaziergang");
+  EXPECT_EQ(tagged->date(), RCFileCreationDate(recordingsPath("Tagged.m4a")));
+
+  ::setenv("LANGUAGE", "it", 1);  // neither title: the container's date
+  ASSERT_TRUE(RCSApplyAssetMetadataToRecording(*tagged));
+  EXPECT_EQ(tagged->date(), created);
+  EXPECT_EQ(tagged->customLabel(), RCLocalizedRecordingDateWithOptions(*created, 3));
+
+  auto single = recording("Single.m4a");  // one title is the title, whatever its language
+  ASSERT_TRUE(RCSApplyAssetMetadataToRecording(*single));
+  EXPECT_EQ(single->customLabel(), "Solo");
+  EXPECT_NE(single->date(), created);
+
+  auto missing = recording("Missing.m4a");
+  const std::string before = missing->customLabel();
+  EXPECT_FALSE(RCSApplyAssetMetadataToRecording(*missing));
+  EXPECT_EQ(missing->customLabel(), before);
+}
+
+}  // namespace
+}  // namespace quorvel
