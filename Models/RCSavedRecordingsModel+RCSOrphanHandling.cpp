@@ -86,6 +86,8 @@ std::optional<RCMetadataItem> chooseTitleItem(const std::vector<RCMetadataItem>&
 struct RCSOrphanHandling::Entry {
   struct stat info {};
   bool exists = false;
+  // In the in-use set when the directory was listed (the set only grows).
+  bool inUse = false;
 };
 
 // The run's file access. Sizes and identities of in-use files come from the
@@ -104,25 +106,31 @@ class RCSOrphanHandling::FileManager {
   const std::string& directory() const { return directory_; }
   bool directoryResolved() const { return !resolvedDirectory_.empty(); }
 
-  // `url` standardized, and in the directory's own spelling when its parent
-  // is the directory reached another way.
-  platform::URL canonicalURL(const platform::URL& url) {
-    platform::URL standardized = url.URLByStandardizingPath();
-    platform::URL parent = standardized.URLByDeletingLastPathComponent();
-    if (parent.path() == directory_ || resolvedDirectory_.empty()) return standardized;
-    auto [found, inserted] = resolvedParents_.try_emplace(parent.path());
+  // The standardized path of `url`, in the directory's own spelling when
+  // its parent is the directory reached another way. Paths elsewhere are
+  // remembered: the listing does not size them.
+  std::string canonicalPath(const platform::URL& url) { return canonicalPath(url.path()); }
+  std::string canonicalPath(std::string_view file) {
+    std::string path = RCURLSet::standardizedPath(file);
+    const std::size_t slash = path.rfind('/');
+    const std::string_view parent =
+        std::string_view(path).substr(0, std::max<std::size_t>(slash, 1));
+    if (parent == directory_) return path;
+    auto [found, inserted] = resolvedParents_.try_emplace(std::string(parent));
     if (inserted) {
-      char* resolved = ::realpath(parent.path().c_str(), nullptr);
+      char* resolved = ::realpath(found->first.c_str(), nullptr);
       found->second = resolved && resolved == resolvedDirectory_;
       std::free(resolved);
     }
-    if (!found->second) return standardized;
-    return platform::URL::fileURLWithPath(directory_ + "/" + standardized.lastPathComponent());
+    if (found->second) return directory_ + path.substr(slash);
+    elsewhere_.push_back(path);
+    return path;
   }
+  const std::vector<std::string>& elsewhere() const { return elsewhere_; }
 
-  // Lists the directory: one lstat per entry. A directory that cannot be
-  // listed gives no entries.
-  std::vector<platform::URL> list() {
+  // Lists the directory: one lstat per entry, and whether `inUse` holds it.
+  // A directory that cannot be listed gives no entries.
+  std::vector<platform::URL> list(const RCURLSet& inUse) {
     std::vector<platform::URL> urls;
     DIR* stream = ::opendir(directory_.c_str());
     if (!stream) {
@@ -135,25 +143,29 @@ class RCSOrphanHandling::FileManager {
       if (name == "." || name == "..") continue;
       Entry entry;
       entry.exists = ::fstatat(fd, item->d_name, &entry.info, AT_SYMLINK_NOFOLLOW) == 0;
+      std::string path = directory_ + "/" + std::string(name);
+      entry.inUse = entry.exists && inUse.containsPath(path);
       entries_.emplace(std::string(name), entry);
-      urls.push_back(platform::URL::fileURLWithPath(directory_ + "/" + std::string(name)));
+      urls.push_back(platform::URL::fileURLWithPath(path));
     }
     ::closedir(stream);
     return urls;
   }
 
-  // What the listing saw of `url`, or a fresh lstat for a file elsewhere.
-  Entry entryFor(const platform::URL& url) {
-    if (url.URLByDeletingLastPathComponent().path() == directory_) {
-      auto found = entries_.find(url.lastPathComponent());
+  // What the listing saw of `path`, or a fresh lstat for a file elsewhere.
+  Entry entryFor(std::string_view path) const {
+    const std::size_t slash = path.rfind('/');
+    if (path.substr(0, slash) == directory_) {
+      auto found = entries_.find(std::string(path.substr(slash + 1)));
       return found == entries_.end() ? Entry{} : found->second;
     }
-    return lstatNow(url);
+    return lstatNow(std::string(path));
   }
+  const std::unordered_map<std::string, Entry>& entries() const { return entries_; }
 
-  static Entry lstatNow(const platform::URL& url) {
+  static Entry lstatNow(const std::string& path) {
     Entry entry;
-    entry.exists = ::lstat(url.path().c_str(), &entry.info) == 0;
+    entry.exists = ::lstat(path.c_str(), &entry.info) == 0;
     return entry;
   }
 
@@ -172,6 +184,7 @@ class RCSOrphanHandling::FileManager {
   std::string resolvedDirectory_;
   std::unordered_map<std::string, bool> resolvedParents_;
   std::unordered_map<std::string, Entry> entries_;
+  std::vector<std::string> elsewhere_;
 };
 
 // ---- title and date ----
@@ -192,11 +205,11 @@ bool RCSApplyAssetMetadataToRecording(RCSavedRecording& recording) {
     std::binary_semaphore loaded{0};
   };
   auto chosen = std::make_shared<Chosen>();
-  asset->loadCommonMetadataAsync([chosen](platform::Result<RCCommonMetadata> metadata) {
-    if (metadata) {
-      chosen->titleItem = chooseTitleItem(metadata->titleItems);
-      if (!chosen->titleItem) chosen->dateItem = metadata->creationDate;
-    }
+  asset->loadCommonMetadataAsync([chosen](platform::Result<RCCommonMetadata>&& metadata) {
+    // A load that failed chooses nothing.
+    RCCommonMetadata found = metadata ? std::move(*metadata) : RCCommonMetadata{};
+    chosen->titleItem = chooseTitleItem(found.titleItems);
+    if (!chosen->titleItem) chosen->dateItem = found.creationDate;
     chosen->loaded.release();
   });
   chosen->loaded.acquire();
@@ -234,20 +247,23 @@ void RCSOrphanHandling::performOrphanRecoveryAndCleanupWithExternallyInUseCompos
       "recordings.");
   statistics_ = {};
   FileManager fileManager(model_.directory());
-  auto inUse = std::make_unique<RCURLSet>();
+  std::vector<platform::URL> handedIn;
+  handedIn.reserve(externallyInUseComposedAVURLs.size());
   for (const platform::URL& url : externallyInUseComposedAVURLs)
-    inUse->addURL(fileManager.canonicalURL(url));
+    handedIn.push_back(platform::URL::fileURLWithPath(fileManager.canonicalPath(url)));
+  std::unique_ptr<RCURLSet> inUse = RCURLSet::setWithURLs(handedIn);
 
   // Without the database's recordings every file would look orphaned: a
   // database that cannot be read ends the run here.
   const auto& extensions = RCCaptureFormat::fileExtensionsSupported();
-  auto walked = model_.enumerateExistingRecordingsWithBlock([&](const auto& recording, bool&) {
-    std::optional<platform::URL> url = recording->url();
-    if (!url) return;
-    platform::URL canonical = fileManager.canonicalURL(*url);
-    inUse->addURL(canonical);
-    for (const std::string& extension : extensions)
-      inUse->addURL(canonical.URLByReplacingPathExtension(extension));
+  auto walked = model_.enumerateRecordingFilePathsWithBlock([&](const std::string& file) {
+    std::string path = fileManager.canonicalPath(file);
+    inUse->addPath(path);
+    // The same name in every capture format.
+    const std::size_t slash = path.rfind('/');
+    const std::size_t dot = path.rfind('.');
+    std::string stem = dot == std::string::npos || dot < slash ? path : path.substr(0, dot);
+    for (const std::string& extension : extensions) inUse->addPath(stem + "." + extension);
   });
   if (!walked || !fileManager.directoryResolved()) {
     ORPHAN_LOG("ERROR: leaving the recordings directory alone: {}",
@@ -255,13 +271,13 @@ void RCSOrphanHandling::performOrphanRecoveryAndCleanupWithExternallyInUseCompos
                       : "the recordings database cannot be read: " +
                             walked.error().localizedDescription());
   } else {
-    std::vector<platform::URL> listing = fileManager.list();
+    std::vector<platform::URL> listing = fileManager.list(*inUse);
     statistics_.listedEntries = listing.size();
     _performOrphanRecoveryAndCleanupOfCompositionsWithInUseComposedAVURLs(*inUse, fileManager,
                                                                           listing);
     _performOrphanRecoveryAndCleanupOfBareAssetsWithInUseComposedAVURLs(*inUse, fileManager,
                                                                         listing);
-    removeStaleTemporaryFiles(fileManager, listing);
+    removeStaleTemporaryFiles(fileManager);
   }
   ORPHAN_LOG("performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs: done.");
 }
@@ -295,7 +311,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfCompositionsWithInUseC
       // An app makes a bundle before it inserts the recording and asks for
       // its capture session: a young bundle waits for the next run, and the
       // database is asked again right before the removal.
-      Entry entry = fileManager.entryFor(bundleURL);
+      Entry entry = fileManager.entryFor(bundleURL.path());
       if (secondsSince(entry.info.st_mtim) < kMinimumBundleAge ||
           databaseNames(composedAVURL, composition->savedRecordingURI())) {
         continue;
@@ -344,64 +360,83 @@ void RCSOrphanHandling::recoverComposition(RCURLSet& inUse, FileManager& fileMan
   } else {
     ++statistics_.recordingsInserted;
   }
-  inUse.addURL(fileManager.canonicalURL(composedAVURL));
+  inUse.addPath(fileManager.canonicalPath(composedAVURL));
 }
 
 void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseComposedAVURLs(
     RCURLSet& inUse, FileManager& fileManager,
     const std::vector<platform::URL>& URLsInSavedRecordingsDirectory) {
-  std::map<platform::URL, RCMD5Digest> digestCache;
+  std::unordered_map<std::string, RCMD5Digest> digestCache;
 
   // In-use files by size (existing regular files only: a member that is not
   // there has size 0, which no candidate reaches the comparison with) and
-  // by identity.
-  std::unordered_multimap<std::uint64_t, platform::URL> inUseBySize;
+  // by identity. Members in the directory are sized from the listing.
+  std::unordered_multimap<std::uint64_t, std::string> inUseBySize;
   std::set<Identity> inUseIdentities;
-  auto noteInUse = [&](const platform::URL& url, const struct stat& info) {
+  auto noteInUse = [&](const std::string& path, const struct stat& info) {
     inUseIdentities.insert(Identity{info.st_dev, info.st_ino});
-    if (S_ISREG(info.st_mode) && info.st_size > 0) inUseBySize.emplace(info.st_size, url);
+    if (S_ISREG(info.st_mode) && info.st_size > 0) inUseBySize.emplace(info.st_size, path);
   };
-  for (const platform::URL& member : inUse.URLs()) {
-    Entry entry = fileManager.entryFor(member);
-    if (entry.exists) noteInUse(member, entry.info);
+  const std::string prefix = fileManager.directory() + "/";
+  for (const auto& [name, entry] : fileManager.entries()) {
+    if (entry.inUse) noteInUse(prefix + name, entry.info);
+  }
+  for (const std::string& path : fileManager.elsewhere()) {
+    if (Entry entry = FileManager::lstatNow(path); entry.exists) noteInUse(path, entry.info);
   }
 
-  std::vector<platform::URL> sorted = URLsInSavedRecordingsDirectory;
-  std::sort(sorted.begin(), sorted.end(), [](const platform::URL& a, const platform::URL& b) {
-    return RCPathOrderLess(a.path(), b.path());
+  // Path order. Every entry lies in the directory, so the names decide.
+  struct Keyed {
+    std::size_t length;
+    std::string name;
+    const platform::URL* url;
+  };
+  std::vector<Keyed> keyed;
+  keyed.reserve(URLsInSavedRecordingsDirectory.size());
+  for (const platform::URL& url : URLsInSavedRecordingsDirectory) {
+    std::string name = url.lastPathComponent();
+    keyed.push_back(Keyed{RCUTF16Length(name), std::move(name), &url});
+  }
+  std::sort(keyed.begin(), keyed.end(), [](const Keyed& a, const Keyed& b) {
+    if (a.length != b.length) return a.length < b.length;
+    if (int order = RCNumericCompare(a.name, b.name); order != 0) return order < 0;
+    return a.name < b.name;
   });
 
-  auto digestOf = [&](const platform::URL& url) -> platform::Result<std::optional<RCMD5Digest>> {
-    if (auto cached = digestCache.find(url); cached != digestCache.end()) return cached->second;
+  auto digestOf = [&](const std::string& path) -> platform::Result<std::optional<RCMD5Digest>> {
+    if (auto cached = digestCache.find(path); cached != digestCache.end()) return cached->second;
     ++statistics_.filesDigested;
-    auto digest = RCMD5DigestOfFile(url.path());
+    auto digest = RCMD5DigestOfFile(path);
     if (!digest) {
-      ORPHAN_LOG("ERROR: -MD5DataForPath was unable load data for {}", url.path());
+      ORPHAN_LOG("ERROR: -MD5DataForPath was unable load data for {}", path);
     } else if (*digest) {
-      digestCache.emplace(url, **digest);
+      digestCache.emplace(path, **digest);
     }
     return digest;
   };
   auto remove = [&](const platform::URL& url) {
     if (fileManager.remove(url)) ++statistics_.itemsDeleted;
   };
+  auto lastComponent = [](std::string_view path) { return path.substr(path.rfind('/') + 1); };
 
-  for (const platform::URL& url : sorted) {
-    if (!RCCaptureFormat::isFileExtensionSupported(url.pathExtension()) || inUse.containsURL(url)) {
+  for (const Keyed& item : keyed) {
+    const platform::URL& url = *item.url;
+    Entry listed = fileManager.entryFor(url.path());
+    if (listed.inUse || !RCCaptureFormat::isFileExtensionSupported(url.pathExtension()) ||
+        inUse.containsPath(url.path())) {
       continue;
     }
-    Entry listed = fileManager.entryFor(url);
     // Only regular files: a link, a directory or a device is not a bare
     // recording, and the very same file as an in-use one is in use.
     if (!listed.exists || !S_ISREG(listed.info.st_mode) ||
         inUseIdentities.contains(Identity{listed.info.st_dev, listed.info.st_ino})) {
       continue;
     }
-    const std::string name = url.lastPathComponent();
+    const std::string& name = item.name;
     ORPHAN_LOG("Found orphaned composed AVURL: '{}'", name);
 
     // The duplicate test, sizes first.
-    Entry now = FileManager::lstatNow(url);
+    Entry now = FileManager::lstatNow(url.path());
     if (!now.exists || !S_ISREG(now.info.st_mode)) {
       ORPHAN_LOG(
           "Orphaned composed AVURL: '{}' changed during the run; leaving it for the next "
@@ -417,7 +452,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
       auto [first, last] = inUseBySize.equal_range(size);
       for (auto member = first; member != last && unique; ++member) {
         if (!digest) {
-          auto own = digestOf(url);
+          auto own = digestOf(url.path());
           if (!own || !*own) {
             unreadable = true;
             break;
@@ -427,7 +462,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
         auto theirs = digestOf(member->second);
         if (theirs && *theirs && **theirs == *digest) {
           ORPHAN_LOG("orphanPath = {} matches existing file = {}", name,
-                     member->second.lastPathComponent());
+                     lastComponent(member->second));
           unique = false;
         }
       }
@@ -444,8 +479,8 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
       remove(url);
       continue;
     }
-    inUse.addURL(url);
-    noteInUse(url, now.info);
+    inUse.addPath(url.path());
+    noteInUse(url.path(), now.info);
     ORPHAN_LOG(
         "Orphaned composed AVURL: '{}' does not have a duplicate in the database or "
         "unsynced assets manifest.  Attempting to insert into the database...",
@@ -500,29 +535,32 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
   }
 }
 
-void RCSOrphanHandling::removeStaleTemporaryFiles(
-    FileManager& fileManager, const std::vector<platform::URL>& URLsInSavedRecordingsDirectory) {
+void RCSOrphanHandling::removeStaleTemporaryFiles(FileManager& fileManager) {
   // A crash in the middle of an atomic replace leaves the new file under its
   // temporary name, beside the file it was to replace: directly in the
   // directory or in a bundle. Anything else of that name pattern, or younger
   // than an hour (a compose may still be writing it), stays.
-  auto removeIfStale = [&](const platform::URL& url, const struct stat& info) {
-    if (!S_ISREG(info.st_mode) || !RCIsAtomicReplaceTempName(url.lastPathComponent()) ||
+  auto removeIfStale = [&](const platform::URL& url, std::string_view name,
+                           const struct stat& info) {
+    if (!S_ISREG(info.st_mode) || !RCIsAtomicReplaceTempName(name) ||
         secondsSince(info.st_mtim) < kMinimumTempFileAge) {
       return;
     }
     ORPHAN_LOG("Removing '{}', left behind by an interrupted write.", url.path());
     if (fileManager.remove(url)) ++statistics_.itemsDeleted;
   };
-  for (const platform::URL& url : URLsInSavedRecordingsDirectory) {
-    Entry entry = fileManager.entryFor(url);
+  const std::string prefix = fileManager.directory() + "/";
+  for (const auto& [name, entry] : fileManager.entries()) {
     if (!entry.exists) continue;
     if (!S_ISDIR(entry.info.st_mode)) {
-      removeIfStale(url, entry.info);
+      if (name.front() == '.') {
+        removeIfStale(platform::URL::fileURLWithPath(prefix + name), name, entry.info);
+      }
       continue;
     }
-    if (url.pathExtension() != RCComposition::kBundleExtension) continue;
-    const int fd = ::open(url.path().c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (!name.ends_with(std::string(".") + RCComposition::kBundleExtension)) continue;
+    const platform::URL bundle = platform::URL::fileURLWithPath(prefix + name);
+    const int fd = ::open(bundle.path().c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
     DIR* stream = fd < 0 ? nullptr : ::fdopendir(fd);
     if (!stream) {
       if (fd >= 0) ::close(fd);
@@ -534,7 +572,7 @@ void RCSOrphanHandling::removeStaleTemporaryFiles(
           ::fstatat(::dirfd(stream), item->d_name, &info, AT_SYMLINK_NOFOLLOW) != 0) {
         continue;
       }
-      removeIfStale(url.URLByAppendingPathComponent(item->d_name), info);
+      removeIfStale(bundle.URLByAppendingPathComponent(item->d_name), item->d_name, info);
     }
     ::closedir(stream);
   }

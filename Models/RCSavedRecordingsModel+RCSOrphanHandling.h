@@ -95,8 +95,7 @@ class RCSOrphanHandling {
       const std::vector<platform::URL>& URLsInSavedRecordingsDirectory);
   void recoverComposition(RCURLSet& inUse, FileManager& fileManager,
                           const std::shared_ptr<class RCComposition>& composition);
-  void removeStaleTemporaryFiles(FileManager& fileManager,
-                                 const std::vector<platform::URL>& URLsInSavedRecordingsDirectory);
+  void removeStaleTemporaryFiles(FileManager& fileManager);
   bool databaseNames(const platform::URL& composedAVURL, const std::string& recordingURI);
 
   RCSavedRecordingsModel& model_;

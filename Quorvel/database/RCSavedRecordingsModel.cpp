@@ -272,6 +272,30 @@ platform::Status RCSavedRecordingsModel::enumerateExistingRecordingsWithBlock(
   return {};
 }
 
+platform::Status RCSavedRecordingsModel::enumerateRecordingFilePathsWithBlock(
+    const std::function<void(const std::string& path)>& block) {
+  checkQueue(__FILE__, __LINE__);
+  auto statement = database_->prepare("SELECT path FROM recordings");
+  if (!statement) return platform::fail(statement.error());
+  std::vector<std::string> stored;
+  for (;;) {
+    auto row = statement->step();
+    if (!row) return platform::fail(row.error());
+    if (!*row) break;
+    if (!statement->isNull(0)) stored.push_back(statement->text(0));
+  }
+  for (const auto& recording : pending_) {
+    if (recording->isNew_) stored.push_back(recording->storedPath_);
+  }
+  std::string path;
+  for (const std::string& storedPath : stored) {
+    if (storedPath.empty()) continue;
+    path = storedPath.front() == '/' ? storedPath : directory_ + "/" + storedPath;
+    block(path);
+  }
+  return {};
+}
+
 void RCSavedRecordingsModel::performWithSavingDisabled(const std::function<void()>& block) {
   checkQueue(__FILE__, __LINE__);
   ++savingDisabledDepth_;

@@ -77,6 +77,14 @@ class RCSavedRecordingsModel : public std::enable_shared_from_this<RCSavedRecord
       std::function<void(const std::shared_ptr<RCSavedRecording>& recording, bool& stop)>;
   platform::Status enumerateExistingRecordingsWithBlock(const RecordingVisitor& block);
 
+  // Calls `block` with the absolute path of the audio file of every
+  // recording that enumerateExistingRecordingsWithBlock would visit (those
+  // without a file are skipped), without making recording objects: for walks
+  // over a whole large database that need only its files. A failed read
+  // calls no block and returns the error.
+  platform::Status enumerateRecordingFilePathsWithBlock(
+      const std::function<void(const std::string& path)>& block);
+
   // Runs `block` synchronously with this model's own saving suspended;
   // changes made meanwhile wait for saveIfNecessary. Nests.
   void performWithSavingDisabled(const std::function<void()>& block);
