@@ -140,6 +140,32 @@ TEST_F(ActivationTest, InstalledFilesPointIntoThePrefix) {
       fs::exists(prefix() / "include/quorvel/Quorvel/service/SavedRecordingServiceClient.h"));
 }
 
+// The installed user unit stays hardened: the offline analysis (as a user
+// manager would run it) rates its exposure 3.0 or less, and the directives
+// the daemon relies on are there.
+TEST_F(ActivationTest, InstalledUnitExposureIsAtMostThree) {
+  const fs::path unit = prefix() / "lib/systemd/user/quorveld.service";
+  const std::string text = readFile(unit);
+  for (const char* directive :
+       {"Type=dbus\n", "BusName=org.quorvel.SavedRecordingService\n",
+        "Environment=SQLITE_AUTO_TRACE=1\n", "ReadWritePaths=%h/.local/share/quorvel\n",
+        "RestrictAddressFamilies=AF_UNIX\n", "SystemCallFilter=@system-service\n"}) {
+    EXPECT_NE(text.find(directive), std::string::npos) << directive;
+  }
+  if (DaemonProcess::run({"sh", "-c", "command -v systemd-analyze"}).status != 0) {
+    GTEST_SKIP() << "systemd-analyze is not installed";
+  }
+  // The offline analysis still wants a runtime directory for the user.
+  const fs::path runtime = *root_ / "runtime";
+  fs::create_directories(runtime);
+  fs::permissions(runtime, fs::perms::owner_all);
+  auto analysed =
+      DaemonProcess::run({"env", "XDG_RUNTIME_DIR=" + runtime.string(), "systemd-analyze",
+                          "security", "--offline=true", "--user", "--threshold=30", unit.string()});
+  EXPECT_EQ(analysed.status, 0) << analysed.output;
+  EXPECT_NE(analysed.output.find("Overall exposure level"), std::string::npos) << analysed.output;
+}
+
 // The first call starts the installed daemon; an export through it composes
 // with the installed worker; once the token is back and the idle time has
 // passed, the daemon leaves the bus by itself.
