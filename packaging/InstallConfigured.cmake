@@ -18,5 +18,14 @@ endfunction()
 
 quorvel_install_configured(org.quorvel.SavedRecordingService.service.in
                            "${QUORVEL_DATADIR}/dbus-1/services")
-quorvel_install_configured(quorveld.service.in lib/systemd/user)
+# The user manager reads units from /usr/lib/systemd/user and
+# /usr/local/lib/systemd/user, and from DATADIR/systemd/user of every data
+# directory ($XDG_DATA_HOME = ~/.local/share, $XDG_DATA_DIRS): the lib path
+# where a distribution puts them, the share path for any other prefix.
+if(prefix STREQUAL "/usr" OR prefix STREQUAL "/usr/local")
+  set(unit_directory lib/systemd/user)
+else()
+  set(unit_directory "${QUORVEL_DATADIR}/systemd/user")
+endif()
+quorvel_install_configured(quorveld.service.in "${unit_directory}")
 quorvel_install_configured(quorvel.pc.in "${QUORVEL_LIBDIR}/pkgconfig")

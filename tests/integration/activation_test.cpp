@@ -128,7 +128,7 @@ TEST_F(ActivationTest, InstalledFilesPointIntoThePrefix) {
             std::string::npos)
       << activation;
   EXPECT_NE(activation.find("SystemdService=quorveld.service"), std::string::npos);
-  const std::string unit = readFile(prefix() / "lib/systemd/user/quorveld.service");
+  const std::string unit = readFile(prefix() / "share/systemd/user/quorveld.service");
   EXPECT_NE(unit.find("ExecStart=" + (prefix() / "bin/quorveld").string() + "\n"),
             std::string::npos)
       << unit;
@@ -144,7 +144,7 @@ TEST_F(ActivationTest, InstalledFilesPointIntoThePrefix) {
 // manager would run it) rates its exposure 3.0 or less, and the directives
 // the daemon relies on are there.
 TEST_F(ActivationTest, InstalledUnitExposureIsAtMostThree) {
-  const fs::path unit = prefix() / "lib/systemd/user/quorveld.service";
+  const fs::path unit = prefix() / "share/systemd/user/quorveld.service";
   const std::string text = readFile(unit);
   for (const char* directive :
        {"Type=dbus\n", "BusName=org.quorvel.SavedRecordingService\n",
