@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cmath>
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
@@ -46,7 +47,7 @@ std::vector<std::uint8_t> renderWaveform(const quorvel::RCWaveform& waveform,
     const double halfHeight = (bandHeight - 1) / 2.0;
     auto rowFor = [&](double value) {
       const double y = centre - std::clamp(value / fullScale, -1.0, 1.0) * halfHeight;
-      return std::clamp(int(y + 0.5), top, bottom - 1);
+      return std::clamp(int(std::lround(y)), top, bottom - 1);
     };
     for (int x = 0; x < width; ++x) paint(pixels, width, x, rowFor(0), kAxis);
     if (length == 0) continue;
