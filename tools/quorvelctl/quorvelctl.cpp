@@ -1,6 +1,6 @@
 // quorvelctl: talks to quorveld from the command line. One subcommand per
 // request of the service, `watch` for the exporting-set signal, and the
-// recording management an app does itself (`new`, `list`, `info`).
+// recording management an app does itself (`new`, `list`, `info`, `waveform`).
 //
 //   quorvelctl capture URL                 prints the token
 //   quorvelctl capture URL -- COMMAND...   holds the session while COMMAND
@@ -33,6 +33,7 @@
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
 #include "tools/quorvelctl/Recordings.h"
+#include "tools/quorvelctl/WaveformPicture.h"
 
 namespace {
 
@@ -215,6 +216,19 @@ int main(int argc, char** argv) {
   std::string infoURL;
   auto* info = app.add_subcommand("info", "show a recording's fragments and composed state");
   info->add_option("url", infoURL, "the recording's composed audio file")->required();
+  std::string waveformURL;
+  std::string pngPath;
+  quorvelctl::WaveformPictureSize pictureSize;
+  auto* waveform =
+      app.add_subcommand("waveform", "draw a recording's waveform file as a PNG picture");
+  waveform->add_option("url", waveformURL, "the recording's composed audio file")->required();
+  waveform->add_option("--png", pngPath, "the picture to write")->required();
+  waveform->add_option("--width", pictureSize.width, "picture width in pixels")
+      ->check(CLI::Range(1, 16384))
+      ->capture_default_str();
+  waveform->add_option("--height", pictureSize.height, "picture height in pixels")
+      ->check(CLI::Range(1, 4096))
+      ->capture_default_str();
 
   try {
     app.parse(argc, argv);
@@ -229,6 +243,7 @@ int main(int argc, char** argv) {
   if (*make) return quorvelctl::newRecording(title, files, globals.json);
   if (*list) return quorvelctl::listRecordings(globals.json);
   if (*info) return quorvelctl::showRecording(infoURL, globals.json);
+  if (*waveform) return quorvelctl::drawWaveform(waveformURL, pngPath, pictureSize);
 
   auto connected = SavedRecordingServiceClient::connect(globals.busAddress);
   if (!connected) {

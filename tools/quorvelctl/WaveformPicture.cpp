@@ -1,0 +1,125 @@
+#include "tools/quorvelctl/WaveformPicture.h"
+
+#include <fmt/format.h>
+#include <png.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cmath>
+#include <cstdio>
+#include <cstring>
+#include <filesystem>
+
+#include "Quorvel/waveform/RCWaveformFile.h"
+
+namespace quorvelctl {
+
+namespace {
+
+constexpr std::uint8_t kBackground[3] = {0xff, 0xff, 0xff};
+constexpr std::uint8_t kAxis[3] = {0xc8, 0xc8, 0xc8};
+constexpr std::uint8_t kWave[3] = {0x1f, 0x5f, 0xbf};
+
+void paint(std::vector<std::uint8_t>& pixels, int width, int x, int y, const std::uint8_t* rgb) {
+  std::memcpy(&pixels[(std::size_t(y) * width + x) * 3], rgb, 3);
+}
+
+}  // namespace
+
+std::vector<std::uint8_t> renderWaveform(const quorvel::RCWaveform& waveform,
+                                         WaveformPictureSize size) {
+  const int width = size.width;
+  const int height = size.height;
+  std::vector<std::uint8_t> pixels(std::size_t(width) * height * 3);
+  for (std::size_t i = 0; i < pixels.size(); i += 3) std::memcpy(&pixels[i], kBackground, 3);
+
+  const int channels = std::max(waveform.channels(), 1);
+  const std::size_t length = waveform.length();
+  // Full scale of the stored values: 8-bit waveforms hold [-128, 127].
+  const double fullScale = waveform.bits() == 8 ? 128.0 : 32768.0;
+  for (int channel = 0; channel < channels; ++channel) {
+    // Band [top, bottom) of this channel; its centre line is silence.
+    const int top = channel * height / channels;
+    const int bottom = (channel + 1) * height / channels;
+    const int bandHeight = bottom - top;
+    if (bandHeight <= 0) continue;
+    const double centre = top + (bandHeight - 1) / 2.0;
+    const double halfHeight = (bandHeight - 1) / 2.0;
+    auto rowFor = [&](double value) {
+      const double y = centre - std::clamp(value / fullScale, -1.0, 1.0) * halfHeight;
+      return std::clamp(int(std::lround(y)), top, bottom - 1);
+    };
+    for (int x = 0; x < width; ++x) paint(pixels, width, x, rowFor(0), kAxis);
+    if (length == 0) continue;
+    for (int x = 0; x < width; ++x) {
+      // The waveform pixels [first, last) this column covers; at least one.
+      std::size_t first = std::size_t(x) * length / width;
+      std::size_t last = std::max(std::size_t(x + 1) * length / width, first + 1);
+      int low = waveform.min(first, channel);
+      int high = waveform.max(first, channel);
+      for (std::size_t p = first + 1; p < last; ++p) {
+        low = std::min<int>(low, waveform.min(p, channel));
+        high = std::max<int>(high, waveform.max(p, channel));
+      }
+      if (low > high) std::swap(low, high);
+      // Image rows grow downwards: the maximum is the upper end.
+      for (int y = rowFor(high); y <= rowFor(low); ++y) paint(pixels, width, x, y, kWave);
+    }
+  }
+  return pixels;
+}
+
+platform::Status writeWaveformPNG(const quorvel::RCWaveform& waveform, WaveformPictureSize size,
+                                  const std::string& path) {
+  const std::vector<std::uint8_t> pixels = renderWaveform(waveform, size);
+  png_image image;
+  std::memset(&image, 0, sizeof image);
+  image.version = PNG_IMAGE_VERSION;
+  image.width = png_uint_32(size.width);
+  image.height = png_uint_32(size.height);
+  image.format = PNG_FORMAT_RGB;
+  // Written beside the destination, then renamed over it: a failed write
+  // never leaves half a picture under the requested name.
+  const std::string temporary = path + ".partial";
+  const bool written = png_image_write_to_file(&image, temporary.c_str(), /*convert_to_8bit=*/0,
+                                               pixels.data(), /*row_stride=*/0,
+                                               /*colormap=*/nullptr) != 0;
+  const std::string message = image.message;
+  png_image_free(&image);
+  if (!written) {
+    std::remove(temporary.c_str());
+    return platform::fail(platform::Error(platform::kPOSIXErrorDomain, EIO,
+                                          fmt::format("cannot write {}: {}", path, message)));
+  }
+  if (std::rename(temporary.c_str(), path.c_str()) != 0) {
+    const int error = errno;
+    std::remove(temporary.c_str());
+    return platform::fail(platform::posixError(error, "cannot write " + path));
+  }
+  return {};
+}
+
+int drawWaveform(const std::string& text, const std::string& png, WaveformPictureSize size) {
+  auto avURL = platform::URL::fromFileURLStringOrPath(text);
+  if (!avURL) avURL = platform::URL::fileURLWithPath(text);  // a relative path
+  const platform::URL url = quorvel::RCWaveform::waveformURLForAVURL(*avURL);
+  std::error_code error;
+  if (!std::filesystem::exists(url.path(), error)) {
+    std::fprintf(stderr, "quorvelctl: the recording has no waveform file: %s\n",
+                 url.path().c_str());
+    return 1;
+  }
+  auto waveform = quorvel::RCReadWaveformFile(url);
+  if (!waveform) {
+    std::fprintf(stderr, "quorvelctl: cannot read the waveform file %s: %s\n", url.path().c_str(),
+                 waveform.error().description().c_str());
+    return 1;
+  }
+  if (auto written = writeWaveformPNG(*waveform, size, png); !written) {
+    std::fprintf(stderr, "quorvelctl: %s\n", written.error().localizedDescription().c_str());
+    return 1;
+  }
+  return 0;
+}
+
+}  // namespace quorvelctl
