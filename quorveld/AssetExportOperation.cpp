@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <memory>
-#include <semaphore>
 
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionController.h"
@@ -86,27 +85,19 @@ bool CompositionExportOperation::run(std::optional<platform::Error>* error) {
   (void)RCRemoveItemInSavedRecordingsDirectory(RCWaveform::waveformURLForAVURL(compositionAVURL()));
   QV_LOG(platform::kLogLevelDebug, "RUNNING asset finalization operation: {}", description());
 
-  struct Outcome {
-    std::binary_semaphore done{0};
-    bool success = true;
-    std::optional<platform::Error> error;
-  };
-  auto outcome = std::make_shared<Outcome>();
-  controller->rcs_composeToFinalDestinationAndDeleteDecomposedFragments(
-      /*deleteFragments=*/false, /*composeWaveform=*/true,
-      /*canGenerateWaveformByProcessingAVURL=*/false, [outcome](bool success) {
-        outcome->success = success;
-        if (!success) {
-          outcome->error =
-              RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorCompositionFailed);
-        }
-        outcome->done.release();
-      });
-  outcome->done.acquire();
-
+  // Composed right here, on the operation's own thread: a compose takes
+  // minutes and must not sit on a thread of the global queue meanwhile.
+  platform::Status composed = controller->composeNow(/*deleteFragments=*/false,
+                                                     /*composeWaveform=*/true);
+  if (!composed) {
+    QV_LOG(platform::kLogLevelError, "ERROR: composing {} failed: {}",
+           compositionAVURL().lastPathComponent(), composed.error().description());
+  }
   QV_LOG(platform::kLogLevelDebug, "FINISHED asset finalization operation: {}", description());
-  if (error) *error = outcome->error;
-  return outcome->success;
+  if (!composed && error) {
+    *error = RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorCompositionFailed);
+  }
+  return composed.has_value();
 }
 
 bool GenerateWaveformOperation::run(std::optional<platform::Error>* /*error*/) {

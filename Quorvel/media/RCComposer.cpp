@@ -67,9 +67,24 @@ PacketPtr makePacket() {
   return PacketPtr(p);
 }
 
+struct ParametersDeleter {
+  void operator()(AVCodecParameters* parameters) const { avcodec_parameters_free(&parameters); }
+};
+
+// One segment's fragment. Its decoder is open only while the segment is
+// composed, so a recording of hundreds of fragments holds one file open at
+// a time; the codec parameters, read when composing starts, stay.
 struct Input {
   RCComposerSegment segment;
+  std::unique_ptr<AVCodecParameters, ParametersDeleter> parameters;
   std::unique_ptr<RCAudioDecoder> decoder;
+
+  platform::Status open() {
+    auto opened = RCAudioDecoder::open(segment.fragmentURL);
+    if (!opened) return platform::fail(opened.error());
+    decoder = std::move(*opened);
+    return {};
+  }
 };
 
 // Reports how much of the segments' total length has been composed.
@@ -115,10 +130,10 @@ bool sameDecoderSetup(const AVCodecParameters* a, const AVCodecParameters* b) {
 
 bool canCopy(const std::string& extension, const std::vector<Input>& inputs) {
   if (extension != "m4a") return false;
-  const AVCodecParameters* first = inputs.front().decoder->codecParameters();
+  const AVCodecParameters* first = inputs.front().parameters.get();
   if (first->codec_id != AV_CODEC_ID_AAC || first->extradata_size <= 0) return false;
   return std::all_of(inputs.begin(), inputs.end(), [first](const Input& input) {
-    return sameDecoderSetup(first, input.decoder->codecParameters());
+    return sameDecoderSetup(first, input.parameters.get());
   });
 }
 
@@ -313,13 +328,15 @@ class StreamCopier {
 platform::Status composeByCopy(std::vector<Input>& inputs, const std::string& path,
                                const std::string& extension, RCWaveformBuilder* waveform,
                                Progress& progress, double* composedSeconds) {
-  const AVCodecParameters* parameters = inputs.front().decoder->codecParameters();
+  const AVCodecParameters* parameters = inputs.front().parameters.get();
   auto output = RCAudioOutput::open(path, extension, parameters);
   if (!output) return platform::fail(output.error());
   StreamCopier copier(**output, parameters, waveform);
   if (auto opened = copier.openWaveformDecoder(parameters); !opened) return opened;
   for (std::size_t i = 0; i < inputs.size(); ++i) {
+    if (auto opened = inputs[i].open(); !opened) return opened;
     if (auto copied = copier.copy(inputs[i], i == 0, progress); !copied) return copied;
+    inputs[i].decoder.reset();
     progress.finished(inputs[i]);
   }
   if (auto finished = copier.finish(); !finished) return finished;
@@ -482,12 +499,14 @@ platform::Status composeByReencoding(std::vector<Input>& inputs, const std::stri
                                      const std::string& extension,
                                      std::unique_ptr<RCWaveformBuilder>* waveform,
                                      Progress& progress, double* composedSeconds) {
-  auto encoder = RCAudioEncoder::open(path, extension, inputs.front().decoder->codecParameters());
+  auto encoder = RCAudioEncoder::open(path, extension, inputs.front().parameters.get());
   if (!encoder) return platform::fail(encoder.error());
   if (*waveform) *waveform = std::make_unique<RCWaveformBuilder>((*encoder)->sampleRate());
   for (Input& input : inputs) {
+    if (auto opened = input.open(); !opened) return opened;
     if (auto done = reencodeSegment(input, **encoder, waveform->get(), progress); !done)
       return done;
+    input.decoder.reset();
     progress.finished(input);
   }
   if (auto finished = (*encoder)->finish(); !finished) return finished;
@@ -526,9 +545,15 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
   std::vector<Input> inputs;
   inputs.reserve(segments.size());
   for (const RCComposerSegment& segment : segments) {
-    auto decoder = RCAudioDecoder::open(segment.fragmentURL);
-    if (!decoder) return platform::fail(decoder.error());
-    inputs.push_back(Input{segment, std::move(*decoder)});
+    Input input{segment, nullptr, nullptr};
+    if (auto opened = input.open(); !opened) return opened;
+    input.parameters.reset(avcodec_parameters_alloc());
+    if (!input.parameters ||
+        avcodec_parameters_copy(input.parameters.get(), input.decoder->codecParameters()) < 0) {
+      throw std::bad_alloc();
+    }
+    input.decoder.reset();
+    inputs.push_back(std::move(input));
   }
 
   auto file = RCReplacementFile::create(destination);
@@ -539,8 +564,7 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
   platform::Status composed;
   if (copying) {
     if (waveformDestination)
-      waveform = std::make_unique<RCWaveformBuilder>(
-          inputs.front().decoder->codecParameters()->sample_rate);
+      waveform = std::make_unique<RCWaveformBuilder>(inputs.front().parameters->sample_rate);
     composed =
         composeByCopy(inputs, file->tempPath(), extension, waveform.get(), progress, &seconds);
   } else {

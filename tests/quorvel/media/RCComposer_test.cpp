@@ -5,6 +5,7 @@
 #include "Quorvel/media/RCComposer.h"
 
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <cmath>
@@ -143,6 +144,22 @@ TEST_F(ComposerTest, CopyTrimsRangesInsideFragments) {
   EXPECT_NEAR(toneAt(*pcm, 0.05, 0.75), 400, 4);
   EXPECT_NEAR(toneAt(*pcm, 0.9, 1.35), 800, 6);
   EXPECT_NEAR(toneAt(*pcm, 1.5, 1.9), 400, 6);
+}
+
+// Fragments are opened one at a time: 300 of them compose under a limit of
+// 64 open files.
+TEST_F(ComposerTest, HundredsOfFragmentsNeedOneOpenFileAtATime) {
+  ASSERT_TRUE(writeTone(path("take.m4a"), 0.5, "m4a", 44100, 1, 440));
+  std::vector<RCComposerSegment> segments(300, RCComposerSegment{url("take.m4a"), 0.0, 0.1});
+  struct rlimit saved {};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &saved), 0);
+  struct rlimit low = saved;
+  low.rlim_cur = 64;
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
+  auto status = RCComposeAudio(segments, url("out.m4a"));
+  ::setrlimit(RLIMIT_NOFILE, &saved);
+  ASSERT_TRUE(status) << status.error();
+  EXPECT_NEAR(containerSeconds(path("out.m4a")), 30.0, 300 * 2 * kAACFrame);
 }
 
 TEST_F(ComposerTest, ReencodesMixedFormatsToTheFirstFragmentsFormat) {
