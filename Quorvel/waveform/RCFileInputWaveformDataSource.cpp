@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <chrono>
 #include <cmath>
 #include <limits>
 
@@ -23,6 +24,7 @@ RCFileInputWaveformDataSource::RCFileInputWaveformDataSource(const platform::URL
                                                              double segmentFlushInterval)
     : avURL_(avURL),
       waveformURL_(RCWaveform::waveformURLForAVURL(avURL)),
+      partialWaveformURL_(platform::URL::fileURLWithPath(waveformURL_.path() + ".partial")),
       saves_(savesGeneratedWaveform),
       flushInterval_(segmentFlushInterval) {}
 
@@ -53,9 +55,7 @@ bool RCFileInputWaveformDataSource::waitUntilFinished() {
 void RCFileInputWaveformDataSource::load() {
   QV_LOG(platform::kLogLevelDebug, "Computing the waveform of {}", avURL_.lastPathComponent());
   auto status = generate();
-  if (!status) {
-    if (wroteFile_) ::unlink(waveformURL_.path().c_str());
-  }
+  if (saves_) ::unlink(partialWaveformURL_.path().c_str());
   if (!status && cancelled_) {
     QV_LOG(platform::kLogLevelDebug, "Stopped computing the waveform of {}",
            avURL_.lastPathComponent());
@@ -74,10 +74,10 @@ void RCFileInputWaveformDataSource::load() {
   finishedCondition_.notify_all();
 }
 
-platform::Status RCFileInputWaveformDataSource::save(const RCWaveform& waveform) {
+platform::Status RCFileInputWaveformDataSource::save(const RCWaveform& waveform,
+                                                     const platform::URL& destination) {
   if (!saves_) return {};
-  wroteFile_ = true;
-  return RCWriteWaveformFile(waveform, waveformURL_);
+  return RCWriteWaveformFile(waveform, destination);
 }
 
 platform::Status RCFileInputWaveformDataSource::generate() {
@@ -85,26 +85,24 @@ platform::Status RCFileInputWaveformDataSource::generate() {
   if (!opened) return platform::fail(opened.error());
   RCAudioDecoder& decoder = **opened;
   std::optional<RCWaveformBuilder> builder;
-  std::int64_t flushEvery = 0;
-  std::int64_t nextFlush = std::numeric_limits<std::int64_t>::max();
+  const bool flushes = saves_ && std::isfinite(flushInterval_) && flushInterval_ >= 0;
+  const auto interval = std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+      std::chrono::duration<double>(flushes ? flushInterval_ : 0));
+  auto nextFlush = std::chrono::steady_clock::now() + interval;
   const std::string name = avURL_.lastPathComponent();
 
   auto handle = [&](AVFrame* frame) -> platform::Status {
     if (!builder) {
       builder.emplace(frame->sample_rate);
-      if (saves_ && std::isfinite(flushInterval_) && flushInterval_ > 0) {
-        flushEvery = std::max<std::int64_t>(1, std::llround(flushInterval_ * frame->sample_rate));
-        nextFlush = flushEvery;
-      }
     } else if (frame->sample_rate != builder->waveform().sampleRate()) {
       return platform::fail(
           RCMediaError(RCMediaErrorCodeDecodeFailed, name + " changes its sample rate midway"));
     }
     builder->append(frame);
-    if (builder->framesAppended() >= nextFlush) {
-      while (nextFlush <= builder->framesAppended()) nextFlush += flushEvery;
-      if (auto saved = save(builder->waveform()); !saved) return saved;
+    if (flushes && std::chrono::steady_clock::now() >= nextFlush) {
+      if (auto saved = save(builder->waveform(), partialWaveformURL_); !saved) return saved;
       if (flushHandler_) flushHandler_(builder->waveform());
+      nextFlush = std::chrono::steady_clock::now() + interval;
     }
     return {};
   };
@@ -143,7 +141,7 @@ platform::Status RCFileInputWaveformDataSource::generate() {
         fmt::format("{} holds {:.3f}s of audio but declares {:.3f}s", name, decoded, declared)));
   builder->finish();
   waveform_ = builder->waveform();
-  return save(waveform_);
+  return save(waveform_, waveformURL_);
 }
 
 }  // namespace quorvel

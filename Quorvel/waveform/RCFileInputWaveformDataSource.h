@@ -1,14 +1,15 @@
 // RCFileInputWaveformDataSource: computes the waveform of an audio file by
-// decoding it on a thread of its own, and (when asked to save) keeps the
-// recording's waveform file (RCWaveform::waveformURLForAVURL) up to date:
-// every `segmentFlushInterval` seconds of decoded audio the pixels computed so
-// far replace the file, and the complete waveform replaces it at the end.
+// decoding it on a thread of its own, and (when asked to save) writes the
+// recording's waveform file (RCWaveform::waveformURLForAVURL) once, whole, at
+// the end. While it decodes, every `segmentFlushInterval` seconds of wall
+// clock the pixels computed so far replace a side file beside it
+// (partialWaveformURL), so a long recording is saved a bounded number of
+// times and a crash never leaves a truncated waveform under the real name.
 // Every replacement is atomic (temporary file, fsync, rename).
 //
 // A file that cannot be opened or decoded, holds no audio, or ends before the
-// duration it declares makes the generation fail; a waveform file written
-// during a failed generation is removed again, so a partial file never
-// outlives the run as if it were complete.
+// duration it declares makes the generation fail. The side file is removed
+// when the generation ends, however it ends.
 //
 // Owned by its creator. beginLoading() and waitUntilFinished() may be called
 // from any thread (typically the same one); waveform() and error() only after
@@ -40,9 +41,12 @@ class RCFileInputWaveformDataSource {
 
   const platform::URL& avURL() const { return avURL_; }
   const platform::URL& waveformURL() const { return waveformURL_; }
+  // "<name>.waveform.partial", beside the waveform file.
+  const platform::URL& partialWaveformURL() const { return partialWaveformURL_; }
 
   // Called on the loading thread right after each intermediate save, with the
-  // waveform just written (the file stays as written until the handler returns).
+  // waveform just written to the side file (which stays as written until the
+  // handler returns).
   // Set it before beginLoading().
   using FlushHandler = std::function<void(const RCWaveform& saved)>;
   void setFlushHandler(FlushHandler handler);
@@ -60,10 +64,11 @@ class RCFileInputWaveformDataSource {
  private:
   void load();
   platform::Status generate();
-  platform::Status save(const RCWaveform& waveform);
+  platform::Status save(const RCWaveform& waveform, const platform::URL& destination);
 
   const platform::URL avURL_;
   const platform::URL waveformURL_;
+  const platform::URL partialWaveformURL_;
   const bool saves_;
   const double flushInterval_;
   FlushHandler flushHandler_;
@@ -75,7 +80,6 @@ class RCFileInputWaveformDataSource {
   bool began_ = false;      // guarded by mutex_
   bool finished_ = false;   // guarded by mutex_
   bool succeeded_ = false;  // guarded by mutex_
-  bool wroteFile_ = false;  // loading thread only
 
   // Written by the loading thread before finished_ is set; read after.
   RCWaveform waveform_;
