@@ -35,6 +35,9 @@ enum RCErrorCode : long {
   // A file operation was refused because the path leaves the recordings directory
   // or passes through a symbolic link.
   RCErrorCodeNotConfined = 30,
+  // A file was replaced by someone else while it was being rewritten; the
+  // rewrite was not applied (read the new file and try again).
+  RCErrorCodeChangedMeanwhile = 31,
   // A composition or fragment cannot be edited as asked (bad index, bad range).
   RCErrorCodeInvalidEdit = 40,
   // An audio file cannot be opened or has no audio.

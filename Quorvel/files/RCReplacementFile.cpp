@@ -1,9 +1,12 @@
 #include "Quorvel/files/RCReplacementFile.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
+#include <optional>
 #include <utility>
 
 #include "Quorvel/errors/RCErrors.h"
@@ -157,6 +160,52 @@ platform::Status RCReplacementFile::commit() {
   pending_ = false;
   file_.reset();
   // The rename is done; a directory that cannot be flushed does not undo it.
+  (void)syncFd(directory_.get(), "directory");
+  directory_.reset();
+  return {};
+}
+
+platform::Status RCReplacementFile::commitReplacing(Identity expected) {
+  if (!pending_) {
+    return platform::fail(
+        RCMediaError(RCMediaErrorCodeFileSystem, "the temporary file is gone or committed"));
+  }
+  RCScopedFd written(
+      ::openat(directory_.get(), tempName_.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  if (!written) return platform::fail(platform::posixError(errno, "cannot open " + tempPath_));
+  if (auto synced = syncFd(written.get(), tempPath_); !synced) return synced;
+  auto exchange = [&] {
+    return ::renameat2(directory_.get(), tempName_.c_str(), directory_.get(),
+                       destinationName_.c_str(), RENAME_EXCHANGE) == 0;
+  };
+  auto changed = [&] {
+    return platform::fail(RCError(RCErrorCodeChangedMeanwhile,
+                                  destinationPath_ + " was replaced while it was being rewritten"));
+  };
+  auto identityOf = [&](const std::string& name) -> std::optional<Identity> {
+    struct stat info {};
+    if (::fstatat(directory_.get(), name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) {
+      return std::nullopt;
+    }
+    return Identity{info.st_dev, info.st_ino};
+  };
+  if (!exchange()) {
+    if (errno == ENOENT) return changed();
+    if (errno != EINVAL) {
+      return platform::fail(
+          platform::posixError(errno, "cannot exchange " + tempPath_ + " and " + destinationPath_));
+    }
+    // A file system without exchange: check, then rename (a narrow window).
+    if (identityOf(destinationName_) != expected) return changed();
+    return commit();
+  }
+  if (identityOf(tempName_) != expected) {
+    exchange();  // put the other writer's file back
+    return changed();
+  }
+  ::unlinkat(directory_.get(), tempName_.c_str(), 0);  // the file it replaced
+  pending_ = false;
+  file_.reset();
   (void)syncFd(directory_.get(), "directory");
   directory_.reset();
   return {};

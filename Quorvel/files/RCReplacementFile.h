@@ -56,6 +56,21 @@ class RCReplacementFile {
   // fsync, rename over the destination, fsync the directory. After a failure
   // the temporary file is gone and the destination is untouched.
   platform::Status commit();
+  // The identity of a file: device and inode.
+  struct Identity {
+    dev_t device = 0;
+    ino_t inode = 0;
+    friend bool operator==(const Identity&, const Identity&) = default;
+  };
+  // commit(), but only over the file `expected` that the new contents were
+  // made from: when someone replaced the destination meanwhile (a compose
+  // and a title write of one recording), nothing changes and the result is
+  // RCErrorCodeChangedMeanwhile; the temporary file stays, so the caller can
+  // bring it up to date and try again. The check and the replacement are
+  // one atomic exchange of the two names, undone when the file taken out is
+  // not `expected`.
+  platform::Status commitReplacing(Identity expected);
+
   // Removes the temporary file now (also done by the destructor).
   void discard();
 

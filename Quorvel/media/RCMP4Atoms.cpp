@@ -652,8 +652,10 @@ platform::Result<std::vector<RCMetadataItem>> RCMP4ReadTitleItems(const std::str
   return RCMP4TitleItemsInMovie(movie->bytes);
 }
 
-platform::Status RCMP4WriteTitle(const std::string& path, std::string_view title,
-                                 std::string_view language) {
+namespace {
+
+platform::Status writeTitleOnce(const std::string& path, std::string_view title,
+                                std::string_view language) {
   RCScopedFd source(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
   if (!source) return platform::fail(ioError(errno, "open " + path));
   struct stat info {};
@@ -672,10 +674,32 @@ platform::Status RCMP4WriteTitle(const std::string& path, std::string_view title
   if (auto s = writeAll(target->fd(), *rewritten); !s) return s;
   const std::uint64_t after = movie->offset + movie->bytes.size();
   if (auto s = copyRange(source.get(), after, movie->fileSize - after, target->fd()); !s) return s;
-  if (auto committed = target->commit(); !committed) {
+  // Only over the file the title was written into: a compose that replaced
+  // it meanwhile keeps its new audio, and the title is written again into it.
+  if (auto committed = target->commitReplacing({info.st_dev, info.st_ino}); !committed) {
+    if (committed.error().domain() == RCErrorDomain &&
+        committed.error().code() == RCErrorCodeChangedMeanwhile) {
+      return committed;
+    }
     return platform::fail(ioErrorFrom(committed.error()));
   }
   return {};
+}
+
+}  // namespace
+
+platform::Status RCMP4WriteTitle(const std::string& path, std::string_view title,
+                                 std::string_view language) {
+  constexpr int kAttempts = 5;
+  platform::Status status;
+  for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    status = writeTitleOnce(path, title, language);
+    if (status || status.error().domain() != RCErrorDomain ||
+        status.error().code() != RCErrorCodeChangedMeanwhile) {
+      break;
+    }
+  }
+  return status;
 }
 
 }  // namespace quorvel

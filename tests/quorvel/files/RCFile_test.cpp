@@ -7,6 +7,7 @@
 #include <pthread.h>
 #include <signal.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -14,6 +15,7 @@
 #include <string>
 #include <thread>
 
+#include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCDurableFile.h"
 #include "Quorvel/files/RCReplacementFile.h"
 #include "tests/support/TempDirectory.h"
@@ -70,6 +72,32 @@ TEST_F(RCFileTest, AFailedReplacementLeavesTheOldFileAndNoTemporaryFile) {
   EXPECT_EQ(temporaryFilesIn(dir_), 0);
   ASSERT_TRUE(RCReplacementFile::replace(url, "new"));
   EXPECT_EQ(testing::readFile(target), "new");
+  EXPECT_EQ(temporaryFilesIn(dir_), 0);
+}
+
+// Two writers of one file (a compose and a title write): the one that
+// rewrote a file that was replaced meanwhile does not undo the other.
+TEST_F(RCFileTest, AGuardedReplacementNeverUndoesAnotherWriter) {
+  const fs::path target = dir_ / "Walk.m4a";
+  testing::writeFile(target, "old audio");
+  const auto url = platform::URL::fileURLWithPath(target.string());
+  auto identity = [&] {
+    struct stat info {};
+    EXPECT_EQ(::stat(target.c_str(), &info), 0);
+    return RCReplacementFile::Identity{info.st_dev, info.st_ino};
+  };
+  const auto readFrom = identity();
+  auto titled = RCReplacementFile::create(url);
+  ASSERT_TRUE(titled && titled->write("old audio, new title"));
+  ASSERT_TRUE(RCReplacementFile::replace(url, "new audio"));  // the other writer
+
+  auto refused = titled->commitReplacing(readFrom);
+  ASSERT_FALSE(refused);
+  EXPECT_EQ(refused.error().code(), RCErrorCodeChangedMeanwhile);
+  EXPECT_EQ(testing::readFile(target), "new audio");
+  ASSERT_TRUE(titled->write("new audio, new title"));
+  ASSERT_TRUE(titled->commitReplacing(identity()));
+  EXPECT_EQ(testing::readFile(target), "new audio, new title");
   EXPECT_EQ(temporaryFilesIn(dir_), 0);
 }
 
