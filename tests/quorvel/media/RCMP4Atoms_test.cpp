@@ -17,6 +17,7 @@ extern "C" {
 
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
+#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/TempDirectory.h"
 
@@ -224,6 +225,22 @@ TEST_F(RCMP4AtomsTest, PermissionsSurviveTheReplacement) {
   ASSERT_TRUE(RCMP4WriteTitle(file, "x", "eng"));
   EXPECT_EQ(fs::status(file).permissions() & fs::perms::all,
             fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read);
+}
+
+TEST_F(RCMP4AtomsTest, ProbeAsksLibavformatWhenTheMovieHoldsNoTitle) {
+  // A title in a top-level meta atom after the audio: libavformat reads it,
+  // the movie atom holds none.
+  const std::string file = path("outside.m4a");
+  ASSERT_TRUE(writeTone(file, 0.3, "m4a"));
+  const std::string hdlr = atom("hdlr", std::string(8, '\0') + "mdirappl" + std::string(9, '\0'));
+  std::ofstream(file, std::ios::app | std::ios::binary)
+      << atom("meta", "\0\0\0\0"s + hdlr + atom("ilst", atom("\xA9nam", dataAtom(1, "Oben"))));
+  auto atoms = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(atoms) << atoms.error();
+  EXPECT_TRUE(atoms->empty());
+  auto probe = RCInProcessMediaEngine().probe(platform::URL::fileURLWithPath(file));
+  ASSERT_TRUE(probe) << probe.error();
+  EXPECT_EQ(probe->titleItems, (std::vector<RCMetadataItem>{{"Oben", ""}}));
 }
 
 TEST(RCMP4AtomsImageTest, TextIsDecodedAsTheContainerSaysAndKeptUnlessReplaced) {
