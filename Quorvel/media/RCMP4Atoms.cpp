@@ -185,8 +185,13 @@ std::string withoutTrailingNuls(std::string text) {
   return text;
 }
 
+// Whether a `©nam` payload holds `data` atoms rather than text entries. The
+// first atom's size must fit: a text entry whose text begins with "data"
+// reads as a size of at least 64 KiB there, more than the entry holds.
 bool isITunesStyle(View payload) {
-  return payload.size() >= 16 && std::memcmp(&payload[4], "data", 4) == 0;
+  if (payload.size() < 16 || std::memcmp(&payload[4], "data", 4) != 0) return false;
+  const std::uint32_t size = be32(&payload[0]);
+  return size == 0 || (size >= 16 && size <= payload.size());
 }
 
 // `©nam` (or any item) holding `data` children: each is type, locale, value.

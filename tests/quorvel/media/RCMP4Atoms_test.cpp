@@ -275,6 +275,23 @@ TEST(RCMP4AtomsImageTest, TextIsDecodedAsTheContainerSaysAndKeptUnlessReplaced) 
   EXPECT_FALSE(RCMP4MovieWithTitle(bytesOf(moov), 0, "Caf\x8E", "deu"));
 }
 
+TEST(RCMP4AtomsImageTest, AnEntryWhoseTextBeginsWithDataStaysText) {
+  // Once the writer gives it an atom of its own, the second entry starts
+  // like an iTunes-style data atom; writing again must neither drop nor change it.
+  const std::string moov =
+      atom("moov", atom("udta", atom("\xA9nam", textEntry(packedISO("eng"), "Hi") +
+                                                    textEntry(packedISO("fra"), "data and more"))));
+  auto once = RCMP4MovieWithTitle(bytesOf(moov), 0, "T", "");
+  ASSERT_TRUE(once) << once.error();
+  auto twice = RCMP4MovieWithTitle(*once, 0, "T", "");
+  ASSERT_TRUE(twice) << twice.error();
+  EXPECT_EQ(*twice, *once);
+  auto items = RCMP4TitleItemsInMovie(*twice);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items,
+            (std::vector<RCMetadataItem>{{"Hi", "eng"}, {"data and more", "fra"}, {"T", ""}}));
+}
+
 TEST(RCMP4AtomsImageTest, ChunkOffsetsMoveOnlyBehindTheMovie) {
   // A hand-built file: ftyp, moov with one stco holding offsets before and
   // after the movie, then mdat.
