@@ -150,12 +150,13 @@ platform::Result<RCMediaProbe> RCInProcessMediaEngine::probe(const platform::URL
   if (isMP4Family(**input)) {
     // libavformat reports each language-tagged title under the plain key as
     // well, so a file without an untagged title would seem to have one; the
-    // atoms say what is really there.
+    // atoms say what is really there. Where they hold no title at all,
+    // libavformat may still have found one elsewhere.
     auto items = RCMP4ReadTitleItems(path);
-    if (items) {
+    if (items && !items->empty()) {
       probe.titleItems = std::move(*items);
       titlesRead = true;
-    } else {
+    } else if (!items) {
       QV_LOG(platform::kLogLevelDebug, "Reading titles from atoms of {} failed: {}", path,
              items.error());
     }

@@ -2,6 +2,8 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <unicode/ucnv.h>
+#include <unicode/unistr.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -21,6 +23,12 @@ using Bytes = std::vector<std::uint8_t>;
 using View = std::span<const std::uint8_t>;
 
 constexpr std::uint16_t kUndeterminedLanguage = 0x55C4;  // "und", packed
+// Language codes below this are Macintosh language codes, above it packed
+// ISO 639-2 codes.
+constexpr std::uint16_t kFirstISOLanguageCode = 0x400;
+// The type field of an iTunes-style `data` atom for text values.
+constexpr std::uint32_t kDataTypeUTF8 = 1;
+constexpr std::uint32_t kDataTypeUTF16 = 2;  // big-endian
 constexpr std::uint64_t kMaxMovieAtomSize = 512ull << 20;
 constexpr std::size_t kMaxTopLevelAtoms = 1u << 20;
 
@@ -138,7 +146,9 @@ constexpr std::array<const char*, 33> kMacLanguages = {
 
 std::string decodeLanguage(std::uint16_t code) {
   if (code == 0x7FFF || code == kUndeterminedLanguage) return {};
-  if (code < 0x400) return code < kMacLanguages.size() ? kMacLanguages[code] : std::string();
+  if (code < kFirstISOLanguageCode) {
+    return code < kMacLanguages.size() ? kMacLanguages[code] : std::string();
+  }
   std::string letters;
   for (int shift = 10; shift >= 0; shift -= 5) {
     const int value = (code >> shift) & 0x1F;
@@ -148,23 +158,59 @@ std::string decodeLanguage(std::uint16_t code) {
   return letters;
 }
 
-std::string textOf(View bytes) {
-  std::string text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+// Longer title texts are not read: no real title comes near it, and it keeps
+// every count below within ICU's 32-bit lengths.
+constexpr std::size_t kMaxTitleTextBytes = 1u << 24;
+
+// `bytes` in the ICU charset `charset`, as UTF-8. Invalid and cut-off
+// sequences become U+FFFD (the converter's default substitution), so the
+// result is always valid UTF-8. Nothing when the text is too long or ICU
+// fails.
+std::optional<std::string> decodeText(View bytes, const char* charset) {
+  if (bytes.size() > kMaxTitleTextBytes) return std::nullopt;
+  UErrorCode status = U_ZERO_ERROR;
+  icu::LocalUConverterPointer converter(ucnv_open(charset, &status));
+  if (U_FAILURE(status)) return std::nullopt;
+  const icu::UnicodeString text(reinterpret_cast<const char*>(bytes.data()),
+                                std::int32_t(bytes.size()), converter.getAlias(), status);
+  if (U_FAILURE(status) || text.isBogus()) return std::nullopt;
+  std::string utf8;
+  text.toUTF8String(utf8);  // anything that is not a whole character becomes U+FFFD
+  return utf8;
+}
+
+// Writers pad some titles with NULs; they are not part of the title.
+std::string withoutTrailingNuls(std::string text) {
   while (!text.empty() && text.back() == '\0') text.pop_back();
   return text;
 }
 
+// Whether a `©nam` payload holds `data` atoms rather than text entries. The
+// first atom's size must fit: a text entry whose text begins with "data"
+// reads as a size of at least 64 KiB there, more than the entry holds.
 bool isITunesStyle(View payload) {
-  return payload.size() >= 16 && std::memcmp(&payload[4], "data", 4) == 0;
+  if (payload.size() < 16 || std::memcmp(&payload[4], "data", 4) != 0) return false;
+  const std::uint32_t size = be32(&payload[0]);
+  return size == 0 || (size >= 16 && size <= payload.size());
 }
 
 // `©nam` (or any item) holding `data` children: each is type, locale, value.
+// The type says how the value is encoded; values of types that are not text
+// (numbers, images) are no titles.
 void collectDataItems(View buffer, const Child& item, std::vector<RCMetadataItem>& out) {
   auto children = parseChildren(buffer, item.offset + item.header, item.offset + item.size, false);
   if (!children) return;
   for (const Child& data : children->atoms) {
     if (data.type != "data" || data.size - data.header < 8) continue;
-    out.push_back(RCMetadataItem{textOf(data.payload(buffer).subspan(8)), {}});
+    View payload = data.payload(buffer);
+    const std::uint32_t type = be32(&payload[0]);
+    const char* charset = type == kDataTypeUTF8    ? "UTF-8"
+                          : type == kDataTypeUTF16 ? "UTF-16BE"
+                                                   : nullptr;
+    if (charset == nullptr) continue;
+    if (auto text = decodeText(payload.subspan(8), charset)) {
+      out.push_back(RCMetadataItem{withoutTrailingNuls(std::move(*text)), {}});
+    }
   }
 }
 
@@ -187,6 +233,21 @@ std::vector<TextEntry> textEntries(View payload) {
     pos += length;
   }
   return entries;
+}
+
+// A text entry's text: under a Macintosh language code it is Mac Roman;
+// under an ISO code it is UTF-16 in the order of a leading byte-order mark
+// (which is not part of the title), else UTF-8.
+std::optional<std::string> entryText(const TextEntry& entry) {
+  View text = entry.text;
+  if (entry.code < kFirstISOLanguageCode) return decodeText(text, "macintosh");
+  if (text.size() >= 2 && text[0] == 0xFE && text[1] == 0xFF) {
+    return decodeText(text.subspan(2), "UTF-16BE");
+  }
+  if (text.size() >= 2 && text[0] == 0xFF && text[1] == 0xFE) {
+    return decodeText(text.subspan(2), "UTF-16LE");
+  }
+  return decodeText(text, "UTF-8");
 }
 
 void collectIlst(View buffer, const Child& ilst, std::vector<RCMetadataItem>& out) {
@@ -216,7 +277,9 @@ void collectUdta(View buffer, const Child& udta, std::vector<RCMetadataItem>& ou
         collectDataItems(buffer, child, out);
       } else {
         for (const TextEntry& entry : textEntries(payload)) {
-          out.push_back(RCMetadataItem{textOf(entry.text), entry.language});
+          if (auto text = entryText(entry)) {
+            out.push_back(RCMetadataItem{withoutTrailingNuls(std::move(*text)), entry.language});
+          }
         }
       }
     } else if (child.type == "meta") {
@@ -399,6 +462,13 @@ platform::Status shiftChunkOffsets(std::span<std::uint8_t> movie, std::uint64_t 
 platform::Result<TitleEdit> normalizeEdit(std::string_view title, std::string_view language) {
   if (title.size() > 0xFFFF) {
     return platform::fail(mp4Error(kRCMP4ErrorBadArgument, "title longer than 65535 bytes"));
+  }
+  // The title is stored as UTF-8 under an ISO code; anything else would not
+  // read back as it was written.
+  auto asRead =
+      decodeText(View(reinterpret_cast<const std::uint8_t*>(title.data()), title.size()), "UTF-8");
+  if (!asRead || *asRead != title) {
+    return platform::fail(mp4Error(kRCMP4ErrorBadArgument, "title is not valid UTF-8"));
   }
   TitleEdit edit{{}, std::string(title)};
   if (!language.empty() && language != "und") {

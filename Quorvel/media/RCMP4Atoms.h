@@ -3,8 +3,13 @@
 // Titles live in the movie atom: QuickTime-style `udta`/`©nam` atoms, each
 // holding text entries with a language code (several atoms side by side give
 // several languages), and iTunes-style `udta`/`meta`/`ilst`/`©nam`/`data`
-// items without a language. The reader reports every one of them as stored;
-// the writer replaces the title of one language (or the untagged title) and
+// items without a language. The reader reports every one of them as stored,
+// decoded to UTF-8 as the container says: a text entry under a Macintosh
+// language code is Mac Roman, one under an ISO code is UTF-16 after a
+// byte-order mark and UTF-8 otherwise; a `data` item's type field says UTF-8
+// or UTF-16 (big-endian), and items of other types are no titles. Invalid
+// sequences read as U+FFFD. The writer stores UTF-8 under an ISO code: it
+// replaces the title of one language (or the untagged title) and
 // keeps the others, fixing the sizes of the enclosing atoms and, when the
 // movie atom comes before the media data, the chunk offsets (`stco`/`co64`)
 // so the audio is untouched.
@@ -52,7 +57,9 @@ platform::Result<std::vector<RCMetadataItem>> RCMP4TitleItemsInMovie(
 // A new `moov` atom with `title` stored for `language` (3-letter ISO 639-2
 // code, or empty for the untagged title): the entry of that language is
 // replaced, other languages stay; writing the untagged title also drops the
-// iTunes-style title so the file holds one untagged title. Chunk offsets at
+// iTunes-style title so the file holds one untagged title. The entries of
+// other languages are kept byte for byte, whatever their encoding; a title
+// that is not valid UTF-8 is refused. Chunk offsets at
 // or beyond the old movie atom's end are moved by the change in size.
 // `movieOffset` is where the atom starts in the file.
 platform::Result<std::vector<std::uint8_t>> RCMP4MovieWithTitle(

@@ -1,6 +1,7 @@
 // Titles written into and read from m4a files: both movie layouts, several
 // languages side by side, interplay with titles written by the ffmpeg CLI,
-// and files that must be refused without being touched.
+// the text encodings a container may declare, and files that must be refused
+// without being touched.
 #include "Quorvel/media/RCMP4Atoms.h"
 
 #include <gtest/gtest.h>
@@ -16,6 +17,7 @@ extern "C" {
 
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
+#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/TempDirectory.h"
 
@@ -28,6 +30,7 @@ void PrintTo(const RCMetadataItem& item, std::ostream* out) {
 namespace {
 
 namespace fs = std::filesystem;
+using namespace std::string_literals;
 using testing::decodeToPCM;
 using testing::M4ALayout;
 using testing::writeTone;
@@ -58,6 +61,37 @@ std::size_t atomPosition(const std::string& bytes, const char* type) {
     if ((*atoms)[i].type == type) return i;
   }
   return std::string::npos;
+}
+
+// Byte images of hand-built atoms.
+void be16(std::string& out, std::uint16_t v) { out += {char(v >> 8), char(v)}; }
+void be32(std::string& out, std::uint32_t v) {
+  for (int s = 24; s >= 0; s -= 8) out.push_back(char(v >> s));
+}
+std::string atom(const char* type, const std::string& payload) {
+  std::string out;
+  be32(out, std::uint32_t(payload.size() + 8));
+  return out + type + payload;
+}
+// A QuickTime text entry: length, language code, text.
+std::string textEntry(std::uint16_t language, const std::string& text) {
+  std::string out;
+  be16(out, std::uint16_t(text.size()));
+  be16(out, language);
+  return out + text;
+}
+std::uint16_t packedISO(const char* code) {
+  return std::uint16_t((code[0] - 0x60) << 10 | (code[1] - 0x60) << 5 | (code[2] - 0x60));
+}
+// An iTunes-style value: type, locale, bytes.
+std::string dataAtom(std::uint32_t type, const std::string& value) {
+  std::string payload;
+  be32(payload, type);
+  be32(payload, 0);
+  return atom("data", payload + value);
+}
+std::span<const std::uint8_t> bytesOf(const std::string& bytes) {
+  return {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()};
 }
 
 using RCMP4AtomsTest = testing::TempDirectoryTest;
@@ -193,18 +227,74 @@ TEST_F(RCMP4AtomsTest, PermissionsSurviveTheReplacement) {
             fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read);
 }
 
+TEST_F(RCMP4AtomsTest, ProbeAsksLibavformatWhenTheMovieHoldsNoTitle) {
+  // A title in a top-level meta atom after the audio: libavformat reads it,
+  // the movie atom holds none.
+  const std::string file = path("outside.m4a");
+  ASSERT_TRUE(writeTone(file, 0.3, "m4a"));
+  const std::string hdlr = atom("hdlr", std::string(8, '\0') + "mdirappl" + std::string(9, '\0'));
+  std::ofstream(file, std::ios::app | std::ios::binary)
+      << atom("meta", "\0\0\0\0"s + hdlr + atom("ilst", atom("\xA9nam", dataAtom(1, "Oben"))));
+  auto atoms = RCMP4ReadTitleItems(file);
+  ASSERT_TRUE(atoms) << atoms.error();
+  EXPECT_TRUE(atoms->empty());
+  auto probe = RCInProcessMediaEngine().probe(platform::URL::fileURLWithPath(file));
+  ASSERT_TRUE(probe) << probe.error();
+  EXPECT_EQ(probe->titleItems, (std::vector<RCMetadataItem>{{"Oben", ""}}));
+}
+
+TEST(RCMP4AtomsImageTest, TextIsDecodedAsTheContainerSaysAndKeptUnlessReplaced) {
+  const std::string mac = atom("\xA9nam", textEntry(2, "Caf\x8E"));  // German, Mac Roman
+  const std::string utf16 = atom("\xA9nam", textEntry(packedISO("eng"), "\xFE\xFF\0H\0i"s));
+  const std::string oddLE = atom("\xA9nam", textEntry(packedISO("fra"), "\xFF\xFE\x41\0B"s));
+  const std::string badUTF8 = atom("\xA9nam", textEntry(packedISO("ita"), "x\xFFy"));
+  // UTF-16 "Ü" and a lone high surrogate; the integer item is no title.
+  const std::string ilst =
+      atom("ilst", atom("\xA9nam", dataAtom(2, "\0\xDC\xD8\0"s) + dataAtom(21, "\0\1"s)));
+  const std::string moov =
+      atom("moov", atom("udta", mac + utf16 + oddLE + badUTF8 + atom("meta", "\0\0\0\0"s + ilst)));
+  auto items = RCMP4TitleItemsInMovie(bytesOf(moov));
+  ASSERT_TRUE(items) << items.error();
+  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Café", "deu"},
+                                                 {"Hi", "eng"},
+                                                 {"A\uFFFD", "fra"},
+                                                 {"x\uFFFDy", "ita"},
+                                                 {"Ü\uFFFD", ""}}));
+
+  // Replacing the Mac entry stores UTF-8 under an ISO code; the others stay
+  // as they were, byte for byte.
+  auto rewritten = RCMP4MovieWithTitle(bytesOf(moov), 0, "Café", "deu");
+  ASSERT_TRUE(rewritten) << rewritten.error();
+  const std::string out(rewritten->begin(), rewritten->end());
+  EXPECT_NE(out.find(atom("\xA9nam", textEntry(packedISO("deu"), "Café"))), std::string::npos);
+  EXPECT_EQ(out.find("Caf\x8E"), std::string::npos);
+  for (const std::string& kept : {utf16, oddLE, badUTF8}) {
+    EXPECT_NE(out.find(kept), std::string::npos);
+  }
+  // Bytes that are not UTF-8 would not read back as written.
+  EXPECT_FALSE(RCMP4MovieWithTitle(bytesOf(moov), 0, "Caf\x8E", "deu"));
+}
+
+TEST(RCMP4AtomsImageTest, AnEntryWhoseTextBeginsWithDataStaysText) {
+  // Once the writer gives it an atom of its own, the second entry starts
+  // like an iTunes-style data atom; writing again must neither drop nor change it.
+  const std::string moov =
+      atom("moov", atom("udta", atom("\xA9nam", textEntry(packedISO("eng"), "Hi") +
+                                                    textEntry(packedISO("fra"), "data and more"))));
+  auto once = RCMP4MovieWithTitle(bytesOf(moov), 0, "T", "");
+  ASSERT_TRUE(once) << once.error();
+  auto twice = RCMP4MovieWithTitle(*once, 0, "T", "");
+  ASSERT_TRUE(twice) << twice.error();
+  EXPECT_EQ(*twice, *once);
+  auto items = RCMP4TitleItemsInMovie(*twice);
+  ASSERT_TRUE(items);
+  EXPECT_EQ(*items,
+            (std::vector<RCMetadataItem>{{"Hi", "eng"}, {"data and more", "fra"}, {"T", ""}}));
+}
+
 TEST(RCMP4AtomsImageTest, ChunkOffsetsMoveOnlyBehindTheMovie) {
   // A hand-built file: ftyp, moov with one stco holding offsets before and
   // after the movie, then mdat.
-  auto be32 = [](std::string& out, std::uint32_t v) {
-    for (int s = 24; s >= 0; s -= 8) out.push_back(char(v >> s));
-  };
-  auto atom = [&](const char* type, const std::string& payload) {
-    std::string out;
-    be32(out, std::uint32_t(payload.size() + 8));
-    out += type;
-    return out + payload;
-  };
   std::string stco;
   be32(stco, 0);
   be32(stco, 3);
@@ -214,8 +304,7 @@ TEST(RCMP4AtomsImageTest, ChunkOffsetsMoveOnlyBehindTheMovie) {
   const std::string moov =
       atom("moov", atom("trak", atom("mdia", atom("minf", atom("stbl", atom("stco", stco))))));
   const std::string file = atom("ftyp", "M4A ") + moov + atom("mdat", std::string(600, '\0'));
-  auto image = RCMP4FileImageWithTitle(
-      std::span(reinterpret_cast<const std::uint8_t*>(file.data()), file.size()), "T", "eng");
+  auto image = RCMP4FileImageWithTitle(bytesOf(file), "T", "eng");
   ASSERT_TRUE(image) << image.error();
   const std::int64_t delta = std::int64_t(image->size()) - std::int64_t(file.size());
   EXPECT_EQ(delta, 8 + 8 + 4 + 1);  // udta + ©nam headers, length and language, "T"
