@@ -49,6 +49,9 @@ class RCAudioEncoder {
   // Frames written so far.
   std::int64_t framesWritten() const { return framesIn_; }
 
+  // The file it writes into (for its metadata, before the first frame).
+  RCAudioOutput& output() { return *output_; }
+
  private:
   RCAudioEncoder() = default;
   platform::Status encodeFromFifo(bool final);

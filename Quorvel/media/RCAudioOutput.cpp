@@ -81,6 +81,10 @@ platform::Result<std::unique_ptr<RCAudioOutput>> RCAudioOutput::open(
 
 AVCodecParameters* RCAudioOutput::mutableCodecParameters() { return stream_->codecpar; }
 
+void RCAudioOutput::setMetadata(const std::string& key, const std::string& value) {
+  av_dict_set(&format_->metadata, key.c_str(), value.c_str(), 0);
+}
+
 platform::Status RCAudioOutput::writeHeaderOnce() {
   if (headerWritten_) return {};
   AVDictionary* options = nullptr;

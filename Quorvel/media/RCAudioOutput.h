@@ -36,6 +36,9 @@ class RCAudioOutput {
   RCAudioOutput& operator=(const RCAudioOutput&) = delete;
 
   AVStream* stream() const { return stream_; }
+  // Sets a container metadata entry ("creation_time", "title"); before the
+  // header is written.
+  void setMetadata(const std::string& key, const std::string& value);
   // Lets the caller adjust the stream's parameters before the header is written.
   AVCodecParameters* mutableCodecParameters();
 

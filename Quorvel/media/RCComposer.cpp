@@ -31,12 +31,15 @@
 // a player decoding the composed file hears (edit list included).
 #include "Quorvel/media/RCComposer.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
 #include <cmath>
 #include <cstring>
 #include <limits>
 #include <memory>
 #include <new>
+#include <optional>
 
 extern "C" {
 #include <libavcodec/avcodec.h>
@@ -50,6 +53,8 @@ extern "C" {
 #include "Quorvel/media/RCAudioEncoder.h"
 #include "Quorvel/media/RCAudioOutput.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
+#include "Quorvel/media/RCMP4Atoms.h"
+#include "Quorvel/media/RCMediaInput.h"
 #include "Quorvel/waveform/RCWaveformBuilder.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
 #include "platform/Log.h"
@@ -325,12 +330,81 @@ class StreamCopier {
   std::int64_t decodedUntil_ = 0;
 };
 
+// What a recording's composed file keeps across composes: its capture date
+// (the old composed file's, else the first fragment's) and its titles. An
+// m4a keeps every language-tagged title through the atom writer; other
+// containers keep the untagged title through the muxer.
+struct KeptMetadata {
+  std::optional<std::string> creationTime;
+  std::optional<std::string> title;
+
+  void applyTo(RCAudioOutput& output) const {
+    if (creationTime) output.setMetadata("creation_time", *creationTime);
+    if (title) output.setMetadata("title", *title);
+  }
+};
+
+KeptMetadata readKeptMetadata(const std::string& path) {
+  KeptMetadata kept;
+  AVFormatContext* input = nullptr;
+  if (RCOpenMediaInput(&input, path.c_str()) < 0) return kept;
+  if (const AVDictionaryEntry* entry = av_dict_get(input->metadata, "creation_time", nullptr, 0))
+    kept.creationTime = entry->value;
+  if (const AVDictionaryEntry* entry = av_dict_get(input->metadata, "title", nullptr, 0))
+    kept.title = entry->value;
+  avformat_close_input(&input);
+  return kept;
+}
+
+KeptMetadata keptMetadataFor(const platform::URL& destination,
+                             const std::vector<RCComposerSegment>& segments) {
+  struct stat info {};
+  KeptMetadata kept;
+  if (::stat(destination.path().c_str(), &info) == 0 && S_ISREG(info.st_mode))
+    kept = readKeptMetadata(destination.path());
+  if (!kept.creationTime)
+    kept.creationTime = readKeptMetadata(segments.front().fragmentURL.path()).creationTime;
+  // An m4a's titles travel through the atoms after muxing, every language.
+  if (lowercase(destination.pathExtension()) == "m4a") kept.title.reset();
+  return kept;
+}
+
+// Commits the composed file, carrying the titles of the file it replaces
+// into it first (m4a). A title written meanwhile replaces the file under
+// us; the commit then fails as changed, and the titles are read again.
+platform::Status commitKeepingTitles(RCReplacementFile& file, const platform::URL& destination,
+                                     const std::string& extension) {
+  constexpr int kAttempts = 5;
+  for (int attempt = 0;; ++attempt) {
+    struct stat info {};
+    if (::lstat(destination.path().c_str(), &info) != 0 || !S_ISREG(info.st_mode))
+      return file.commit();
+    if (extension == "m4a") {
+      auto titles = RCMP4ReadTitleItems(destination.path());
+      for (const RCMetadataItem& item : titles ? *titles : std::vector<RCMetadataItem>()) {
+        if (auto written = RCMP4WriteTitle(file.tempPath(), item.stringValue, item.language);
+            !written) {
+          QV_LOG(platform::kLogLevelError, "WARNING: cannot keep a title of {}: {}",
+                 destination.lastPathComponent(), written.error());
+        }
+      }
+    }
+    auto committed = file.commitReplacing({info.st_dev, info.st_ino});
+    if (committed || attempt + 1 == kAttempts || committed.error().domain() != RCErrorDomain ||
+        committed.error().code() != RCErrorCodeChangedMeanwhile) {
+      return committed;
+    }
+  }
+}
+
 platform::Status composeByCopy(std::vector<Input>& inputs, const std::string& path,
-                               const std::string& extension, RCWaveformBuilder* waveform,
-                               Progress& progress, double* composedSeconds) {
+                               const std::string& extension, const KeptMetadata& kept,
+                               RCWaveformBuilder* waveform, Progress& progress,
+                               double* composedSeconds) {
   const AVCodecParameters* parameters = inputs.front().parameters.get();
   auto output = RCAudioOutput::open(path, extension, parameters);
   if (!output) return platform::fail(output.error());
+  kept.applyTo(**output);
   StreamCopier copier(**output, parameters, waveform);
   if (auto opened = copier.openWaveformDecoder(parameters); !opened) return opened;
   for (std::size_t i = 0; i < inputs.size(); ++i) {
@@ -496,11 +570,12 @@ platform::Status reencodeSegment(Input& input, RCAudioEncoder& encoder, RCWavefo
 }
 
 platform::Status composeByReencoding(std::vector<Input>& inputs, const std::string& path,
-                                     const std::string& extension,
+                                     const std::string& extension, const KeptMetadata& kept,
                                      std::unique_ptr<RCWaveformBuilder>* waveform,
                                      Progress& progress, double* composedSeconds) {
   auto encoder = RCAudioEncoder::open(path, extension, inputs.front().parameters.get());
   if (!encoder) return platform::fail(encoder.error());
+  kept.applyTo((*encoder)->output());
   if (*waveform) *waveform = std::make_unique<RCWaveformBuilder>((*encoder)->sampleRate());
   for (Input& input : inputs) {
     if (auto opened = input.open(); !opened) return opened;
@@ -556,6 +631,7 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
     inputs.push_back(std::move(input));
   }
 
+  const KeptMetadata kept = keptMetadataFor(destination, segments);
   auto file = RCReplacementFile::create(destination);
   if (!file) return platform::fail(file.error());
   const bool copying = canCopy(extension, inputs);
@@ -565,13 +641,13 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
   if (copying) {
     if (waveformDestination)
       waveform = std::make_unique<RCWaveformBuilder>(inputs.front().parameters->sample_rate);
-    composed =
-        composeByCopy(inputs, file->tempPath(), extension, waveform.get(), progress, &seconds);
+    composed = composeByCopy(inputs, file->tempPath(), extension, kept, waveform.get(), progress,
+                             &seconds);
   } else {
     // The builder is created once the output's rate is known.
     if (waveformDestination) waveform = std::make_unique<RCWaveformBuilder>(1);
-    composed =
-        composeByReencoding(inputs, file->tempPath(), extension, &waveform, progress, &seconds);
+    composed = composeByReencoding(inputs, file->tempPath(), extension, kept, &waveform, progress,
+                                   &seconds);
   }
   if (!composed) return composed;
 
@@ -584,7 +660,8 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
     if (auto written = waveformFile->write(RCEncodeWaveformFile(waveform->waveform())); !written)
       return written;
   }
-  if (auto committed = file->commit(); !committed) return committed;
+  if (auto committed = commitKeepingTitles(*file, destination, extension); !committed)
+    return committed;
   if (waveformFile) {
     if (auto committed = waveformFile->commit(); !committed) return committed;
   }

@@ -136,6 +136,14 @@ TEST_F(MediaWorkerClientTest, EveryJobGivesWhatTheInProcessEngineGives) {
                       RCMetadataItem{"Spaziergang", "deu"}),
             retitled->titleItems.end());
 
+  // Composing over it keeps its titles and capture date.
+  ASSERT_TRUE(engine.compose({{titled, 0.0, 0.5}}, titled, std::nullopt, {}));
+  auto recomposed = inProcess_.probe(titled);
+  ASSERT_TRUE(recomposed);
+  EXPECT_NEAR(recomposed->duration, 0.5, 0.05);
+  EXPECT_EQ(recomposed->titleItems, retitled->titleItems);
+  EXPECT_EQ(recomposed->creationDate, retitled->creationDate);
+
   // One job at a time from one thread needs one worker, reused throughout.
   EXPECT_EQ(worker.client().workerPids().size(), 1u);
 }
