@@ -17,6 +17,7 @@
 #include "Quorvel/locale/RCLocalizedRecordingDate.h"
 #include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/DelegatingMediaEngine.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
 
 namespace quorvel {
@@ -24,32 +25,14 @@ namespace {
 
 namespace fs = std::filesystem;
 
-// The in-process engine, except that probing a file whose name contains
-// "Flaky" fails as an I/O error does.
-class FlakyDiskEngine : public RCMediaEngine {
+// Probing a file whose name contains "Flaky" fails as an I/O error does.
+class FlakyDiskEngine : public testing::DelegatingMediaEngine {
  public:
   platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
     if (url.lastPathComponent().find("Flaky") != std::string::npos)
       return platform::fail(platform::posixError(EIO, "read " + url.path()));
-    return disk_.probe(url);
+    return DelegatingMediaEngine::probe(url);
   }
-  platform::Status compose(const std::vector<RCComposerSegment>& segments,
-                           const platform::URL& destination,
-                           const std::optional<platform::URL>& waveform,
-                           const RCMediaProgress& progress) override {
-    return disk_.compose(segments, destination, waveform, progress);
-  }
-  platform::Status buildWaveform(const platform::URL& audio, const platform::URL& destination,
-                                 const RCMediaProgress& progress) override {
-    return disk_.buildWaveform(audio, destination, progress);
-  }
-  platform::Status writeTitle(const platform::URL& file, const std::string& title,
-                              const std::string& language) override {
-    return disk_.writeTitle(file, title, language);
-  }
-
- private:
-  RCInProcessMediaEngine disk_;
 };
 
 class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
