@@ -233,14 +233,5 @@ TEST_F(ServiceTest, LaunchEventsArePostedInProcessOnTheMainQueue) {
   center.removeObserver(token);
 }
 
-TEST_F(ServiceTest, TheDebugSignalDumpsTheRegistryOnTheMainQueue) {
-  ::testing::internal::CaptureStderr();
-  service_->_handleDebugSignal();
-  main_.runUntilIdle();
-  std::string dump = ::testing::internal::GetCapturedStderr();
-  EXPECT_EQ(dump, fmt::format("[{}] *** No Active Sessions ***\n",
-                              service_->assetSessionController().description()));
-}
-
 }  // namespace
 }  // namespace quorvel
