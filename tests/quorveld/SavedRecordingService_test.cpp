@@ -7,7 +7,6 @@
 #include <latch>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
@@ -196,26 +195,6 @@ TEST_F(ServiceTest, OtherRequestsFollowTheirParameterRules) {
   call(":1.4", "FetchExportingCompositionAVURLs", {}, /*noReply=*/true);
   drainServiceQueue();
   EXPECT_EQ(lines().size(), before);
-}
-
-TEST_F(ServiceTest, BlocksRunInQueueOrderAndKeepTheRootOneSecondPastTheLast) {
-  std::vector<int> order;
-  std::latch first(1);
-  std::thread a([&] {
-    service_->_performOnServiceQueue([&order] { order.push_back(1); });
-    first.count_down();
-  });
-  first.wait();
-  std::thread b([&] { service_->_performOnServiceQueue([&order] { order.push_back(2); }); });
-  a.join();
-  b.join();
-  drainServiceQueue();
-  EXPECT_EQ(order, (std::vector<int>{1, 2}));
-  EXPECT_TRUE(controller().isInTransaction());
-  advance(999ms);
-  EXPECT_TRUE(controller().isInTransaction());
-  advance(1ms);
-  EXPECT_FALSE(controller().isInTransaction());
 }
 
 TEST_F(ServiceTest, LaunchEventsArePostedInProcessOnTheMainQueue) {
