@@ -57,21 +57,18 @@ TEST(CompositionManifestTest, RefusesEveryMalformedShapeWithAReason) {
     std::string json;
     std::string reason;
   };
+  // Which names are plain is the confinement test's; here, that both keys are checked.
   for (const Case& c : std::vector<Case>{
            {"", "not JSON"},
-           {"{\"formatVersion\":1", "not JSON"},
            {"[]", "not a JSON object"},
            {manifestWith(fragment, "\"W.m4a\"", "2"), "formatVersion 2"},
            {manifestWith(fragment, "\"W.m4a\"", "1.0"), "not an integer"},
            {manifestWith(fragment, "\"../W.m4a\""), "not a plain file name"},
-           {manifestWith(fragment, "\"/abs/W.m4a\""), "not a plain file name"},
            {manifestWith(fragment, "\"W.mp3\""), "capture format"},
            {manifestWith(fragment, "7"), "not a string"},
            {R"({"formatVersion":1,"composedAVURL":"W.m4a","composedDuration":1,"fragments":[]})",
             "savedRecordingURI is missing"},
            {replaced("\"a.m4a\"", "\"..\""), "not a plain file name"},
-           {replaced("\"a.m4a\"", "\"sub/a.m4a\""), "not a plain file name"},
-           {replaced("\"a.m4a\"", "\"/etc/a.m4a\""), "not a plain file name"},
            {replaced("\"a.m4a\"", "\"a.M4A\""), "capture format"},
            {replaced("\"start\":0,\"duration\":1},\"c", "\"start\":-1,\"duration\":1},\"c"),
             "non-negative"},
