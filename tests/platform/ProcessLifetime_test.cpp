@@ -33,11 +33,18 @@ class ProcessLifetimeTest : public ::testing::Test {
   int idleExits_ = 0;
 };
 
-TEST_F(ProcessLifetimeTest, NothingHappensUntilTransactionsAreEnabled) {
+TEST_F(ProcessLifetimeTest, NeverExitsBeforeEnablingOrWithAZeroPeriod) {
   lifetime_.beginTransaction();
   lifetime_.endTransaction();
   advance(seconds(3600));
   EXPECT_EQ(idleExits_, 0);
+  lifetime_.setIdleExitAfter(Duration::zero());
+  lifetime_.enableTransactions();
+  lifetime_.beginTransaction();
+  lifetime_.endTransaction();
+  advance(seconds(86400));
+  EXPECT_EQ(idleExits_, 0);
+  EXPECT_EQ(queue_.pendingCount(), 0u);
 }
 
 TEST_F(ProcessLifetimeTest, IdleForTheDefaultThirtySecondsAfterEnablingRunsTheHandlerOnce) {
@@ -80,16 +87,6 @@ TEST_F(ProcessLifetimeTest, ABeginAndEndInsideThePeriodRestartsIt) {
   EXPECT_EQ(idleExits_, 0);
   advance(seconds(4));
   EXPECT_EQ(idleExits_, 1);
-}
-
-TEST_F(ProcessLifetimeTest, ZeroIdlePeriodNeverExits) {
-  lifetime_.setIdleExitAfter(Duration::zero());
-  lifetime_.enableTransactions();
-  lifetime_.beginTransaction();
-  lifetime_.endTransaction();
-  advance(seconds(86400));
-  EXPECT_EQ(idleExits_, 0);
-  EXPECT_EQ(queue_.pendingCount(), 0u);
 }
 
 TEST_F(ProcessLifetimeTest, ChangingThePeriodWhileIdleRestartsTheCountdown) {

@@ -42,6 +42,8 @@ TEST_F(SessionRegistryTest, ARefusalLeavesTheTableAndClosingAllFreesTheRecording
   ASSERT_TRUE(error);
   EXPECT_EQ(*error, RCSSavedRecordingServiceError(RCSSavedRecordingServiceErrorConflictingSession));
   EXPECT_EQ(registry_.activeSessions().size(), 2u);
+  // Sessions without a client (the daemon's own) belong to no connection.
+  EXPECT_TRUE(registry_.activeSessionsWithXPCConnection(nullptr).empty());
 
   // Closing one shared session leaves the other; closing all frees the
   // recording for an exclusive session even though its (empty) list stays.
@@ -51,23 +53,6 @@ TEST_F(SessionRegistryTest, ARefusalLeavesTheTableAndClosingAllFreesTheRecording
   EXPECT_FALSE(open(walk_, true));
   registry_.closeSession(second);
   EXPECT_TRUE(open(walk_, true));
-}
-
-TEST_F(SessionRegistryTest, SessionsAreFoundByEqualTokenRecordingAndConnection) {
-  auto connection = platform::Connection::createForListener(":1.9");
-  auto withClient = open(walk_, false, connection);
-  auto daemonOwn = open(walk_, false);  // like the daemon's own finalize session
-
-  auto tuple = withClient->accessToken().toTuple();
-  auto copy = RCSSavedRecordingAccessToken::fromTuple(tuple);  // as it comes back from a client
-  ASSERT_TRUE(copy);
-  EXPECT_EQ(registry_.activeSessionWithAccessToken(*copy), withClient);
-  EXPECT_EQ(registry_.activeSessionWithAccessToken(daemonOwn->accessToken()), daemonOwn);
-  EXPECT_FALSE(registry_.activeSessionWithAccessToken(
-      RCSSavedRecordingAccessToken::tokenWithName("preview", 1, walk_)));
-  EXPECT_EQ(registry_.activeSessionsWithXPCConnection(connection),
-            AssetAccessSessionList{withClient});
-  EXPECT_TRUE(registry_.activeSessionsWithXPCConnection(nullptr).empty());
 }
 
 TEST_F(SessionRegistryTest, EachSessionKeepsTheProcessAliveUntilClosed) {

@@ -7,7 +7,6 @@
 #include <latch>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
@@ -198,26 +197,6 @@ TEST_F(ServiceTest, OtherRequestsFollowTheirParameterRules) {
   EXPECT_EQ(lines().size(), before);
 }
 
-TEST_F(ServiceTest, BlocksRunInQueueOrderAndKeepTheRootOneSecondPastTheLast) {
-  std::vector<int> order;
-  std::latch first(1);
-  std::thread a([&] {
-    service_->_performOnServiceQueue([&order] { order.push_back(1); });
-    first.count_down();
-  });
-  first.wait();
-  std::thread b([&] { service_->_performOnServiceQueue([&order] { order.push_back(2); }); });
-  a.join();
-  b.join();
-  drainServiceQueue();
-  EXPECT_EQ(order, (std::vector<int>{1, 2}));
-  EXPECT_TRUE(controller().isInTransaction());
-  advance(999ms);
-  EXPECT_TRUE(controller().isInTransaction());
-  advance(1ms);
-  EXPECT_FALSE(controller().isInTransaction());
-}
-
 TEST_F(ServiceTest, LaunchEventsArePostedInProcessOnTheMainQueue) {
   ASSERT_TRUE(service_->start());
   std::vector<std::string> posted;
@@ -231,15 +210,6 @@ TEST_F(ServiceTest, LaunchEventsArePostedInProcessOnTheMainQueue) {
   main_.runUntilIdle();
   EXPECT_EQ(posted, (std::vector<std::string>{"com.example.RecordingsChanged"}));
   center.removeObserver(token);
-}
-
-TEST_F(ServiceTest, TheDebugSignalDumpsTheRegistryOnTheMainQueue) {
-  ::testing::internal::CaptureStderr();
-  service_->_handleDebugSignal();
-  main_.runUntilIdle();
-  std::string dump = ::testing::internal::GetCapturedStderr();
-  EXPECT_EQ(dump, fmt::format("[{}] *** No Active Sessions ***\n",
-                              service_->assetSessionController().description()));
 }
 
 }  // namespace

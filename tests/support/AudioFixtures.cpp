@@ -270,16 +270,6 @@ std::pair<std::size_t, std::size_t> frameRange(const DecodedPCM& pcm, std::size_
 }
 }  // namespace
 
-double rms(const DecodedPCM& pcm, std::size_t beginFrame, std::size_t endFrame) {
-  auto [begin, end] = frameRange(pcm, beginFrame, endFrame);
-  if (end <= begin) return 0.0;
-  double sum = 0.0;
-  for (std::size_t i = begin * pcm.channels; i < end * pcm.channels; ++i) {
-    sum += double(pcm.samples[i]) * pcm.samples[i];
-  }
-  return std::sqrt(sum / double((end - begin) * pcm.channels));
-}
-
 double estimatedFrequencyHz(const DecodedPCM& pcm, std::size_t beginFrame, std::size_t endFrame) {
   auto [begin, end] = frameRange(pcm, beginFrame, endFrame);
   if (end <= begin + 1 || pcm.sampleRate <= 0) return 0.0;

@@ -58,8 +58,6 @@ platform::Status writeDamagedAudio(const std::string& dir);
 platform::Result<DecodedPCM> decodeToPCM(const std::string& path);
 
 // Measurements for comparing decoded audio.
-// Root mean square over all samples of frames [begin, end) (all when end is 0).
-double rms(const DecodedPCM& pcm, std::size_t beginFrame = 0, std::size_t endFrame = 0);
 // Frequency of channel 0 estimated from its rising zero crossings.
 double estimatedFrequencyHz(const DecodedPCM& pcm, std::size_t beginFrame = 0,
                             std::size_t endFrame = 0);

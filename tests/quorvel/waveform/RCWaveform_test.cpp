@@ -7,7 +7,6 @@
 
 #include <atomic>
 #include <cmath>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <memory>
@@ -305,21 +304,6 @@ TEST_F(WaveformDataSourceTest, ComputesEveryFormatAndKeepsItInMemoryWhenNotSavin
     const std::size_t middle = source.waveform().length() / 2;
     EXPECT_NEAR(source.waveform().max(middle, 0), 8192, 1300);
   }
-}
-
-TEST_F(WaveformDataSourceTest, ReadsFilesMadeByTheFFmpegTool) {
-  const std::string command =
-      "ffmpeg -v error -y -f lavfi -i 'sine=f=1000:d=2:r=48000' -ac 2 "
-      "-c:a aac -b:a 96k '" +
-      path("cli.m4a") + "'";
-  ASSERT_EQ(std::system(command.c_str()), 0);
-  RCFileInputWaveformDataSource source(url("cli.m4a"), true, 30.0);
-  source.beginLoading();
-  ASSERT_TRUE(source.waitUntilFinished());
-  auto saved = RCReadWaveformFile(source.waveformURL());
-  ASSERT_TRUE(saved);
-  EXPECT_EQ(saved->sampleRate(), 48000);
-  EXPECT_NEAR(saved->durationSeconds(), 2.0, 0.03);
 }
 
 TEST_F(WaveformDataSourceTest, DamagedOrMissingAudioFailsCleanly) {
