@@ -37,6 +37,7 @@
 #include <unordered_map>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
+#include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
@@ -139,6 +140,26 @@ void removeLeftoverTemporaryFiles(const platform::URL& destination) {
     if (auto removed = RCRemoveItemInSavedRecordingsDirectory(url); removed) {
       QV_LOG(platform::kLogLevelNotice, "NOTE: removed {}, left by an interrupted compose", name);
     }
+  }
+}
+
+// The database's duration of a recording follows its composed audio. The
+// caller's model (if any) belongs to its own queue, so this writes through a
+// connection of its own; a failure is logged and changes nothing else.
+void recordComposedDuration(const RCComposition& composition) {
+  if (composition.savedRecordingURI().empty()) return;
+  auto model = RCSavedRecordingsModel::modelWithDirectory(RCSavedRecordingsDirectory());
+  auto recording =
+      model ? (*model)->recordingWithURIRepresentation(composition.savedRecordingURI())
+            : platform::Result<std::shared_ptr<RCSavedRecording>>(platform::fail(model.error()));
+  if (!recording) {
+    QV_LOG(platform::kLogLevelError, "WARNING: cannot record the duration of {}: {}",
+           composition.composedAVURL().lastPathComponent(), recording.error());
+    return;
+  }
+  if (*recording &&
+      std::abs((*recording)->duration() - composition.composedDuration()) > kDurationTolerance) {
+    (*recording)->setDuration(composition.composedDuration());
   }
 }
 
@@ -317,6 +338,7 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
   }
   auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(manifest));
   if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) return saved;
+  recordComposedDuration(*replacement);
   {
     std::lock_guard lock(state_->mutex);
     state_->composition = replacement;

@@ -8,6 +8,7 @@
 #include <fstream>
 #include <string>
 
+#include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
@@ -187,6 +188,12 @@ TEST_F(DaemonTest, AnExportComposesTheFragmentsAndCachesTheWaveform) {
   ASSERT_TRUE(waveform) << waveform.error();
   EXPECT_NEAR(double(waveform->length() * waveform->samplesPerPixel()) / waveform->sampleRate(),
               pcm->seconds(), 0.05);
+  // The database's duration follows the composed audio.
+  auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+  ASSERT_TRUE(model);
+  auto recording = (*model)->recordingWithURL(platform::URL::fileURLWithPath(audio.string()));
+  ASSERT_TRUE(recording && *recording);
+  EXPECT_NEAR((*recording)->duration(), 3.25, 0.1);
   auto info = quorvelctl({"info", "--recordings-dir", recordings_.string(), audio.string()});
   EXPECT_EQ(info.output.find("not composed"), std::string::npos) << info.output;
 }
