@@ -35,6 +35,7 @@
 #include <map>
 #include <semaphore>
 #include <set>
+#include <tuple>
 #include <unordered_map>
 
 #include "Models/RCPathOrder.h"
@@ -61,7 +62,9 @@ constexpr int kTitleDate = kRCRecordingDateOptionDate;                          
 struct Identity {
   dev_t device = 0;
   ino_t inode = 0;
-  friend auto operator<=>(const Identity&, const Identity&) = default;
+  friend bool operator<(const Identity& a, const Identity& b) {
+    return std::tie(a.device, a.inode) < std::tie(b.device, b.inode);
+  }
 };
 
 double secondsSince(const struct timespec& time) {
@@ -229,7 +232,6 @@ bool RCSApplyAssetMetadataToRecording(RCSavedRecording& recording) {
 // ---- the run ----
 
 RCSOrphanHandling::RCSOrphanHandling(RCSavedRecordingsModel& model) : model_(model) {}
-RCSOrphanHandling::~RCSOrphanHandling() = default;
 
 std::optional<RCMD5Digest> RCSOrphanHandling::_MD5DataForPath(const std::string& path) {
   auto digest = RCMD5DigestOfFile(path);

@@ -64,7 +64,6 @@ class RCSOrphanHandling {
   static constexpr double kMinimumTempFileAge = 3600;
 
   explicit RCSOrphanHandling(RCSavedRecordingsModel& model);
-  ~RCSOrphanHandling();
   RCSOrphanHandling(const RCSOrphanHandling&) = delete;
   RCSOrphanHandling& operator=(const RCSOrphanHandling&) = delete;
 
