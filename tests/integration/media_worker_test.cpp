@@ -165,7 +165,7 @@ void waitForCreation(int watch, const std::string& prefix) {
   }
 }
 
-TEST_F(MediaWorkerDaemonTest, AWorkerKilledMidExportFailsThatExportAndTheNextOneSucceeds) {
+TEST_F(MediaWorkerDaemonTest, AWorkerOrTheDaemonKilledMidExportLeavesNothingTheNextExportTrips) {
   RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
   auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
   ASSERT_TRUE(model);
@@ -197,10 +197,30 @@ TEST_F(MediaWorkerDaemonTest, AWorkerKilledMidExportFailsThatExportAndTheNextOne
   EXPECT_TRUE(daemon->waitForLine("died with SIGKILL")) << daemon->output();
   EXPECT_FALSE(fs::exists(audio.path()));  // no half-written composed file
 
+  // The daemon itself killed mid-compose (its worker dies with it): the
+  // next daemon's export composes over what was left, and only the
+  // recording's files remain.
+  watch = inotify_init1(IN_CLOEXEC);
+  ASSERT_GE(inotify_add_watch(watch, recordings_.c_str(), IN_CREATE), 0);
+  std::thread abandoned([&] { (void)(*client)->prepareToExport(audio, false); });
+  waitForCreation(watch, ".Long.m4a");
+  ::close(watch);
+  daemon->sendSignal(SIGKILL);
+  ASSERT_TRUE(daemon->waitForExit());
+  abandoned.join();
+  EXPECT_FALSE(fs::exists(audio.path()));
+  daemon = startDaemon();
+  client = SavedRecordingServiceClient::connect(bus_.address());
+  ASSERT_TRUE(client);
   auto second = (*client)->prepareToExport(audio, false);
   ASSERT_TRUE(second) << second.error() << daemon->output();
   (*client)->endAccessSessionWithToken(*second);
   EXPECT_TRUE(fs::exists(audio.path()));
+  ASSERT_TRUE(
+      RCComposition::load(*bundle_ = RCComposition::compositionBundleURLForComposedAVURL(audio)));
+  for (const auto& entry : fs::directory_iterator(recordings_)) {
+    EXPECT_NE(entry.path().filename().string().front(), '.') << entry.path();
+  }
 }
 
 }  // namespace
