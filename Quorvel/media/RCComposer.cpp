@@ -76,15 +76,20 @@ struct ParametersDeleter {
   void operator()(AVCodecParameters* parameters) const { avcodec_parameters_free(&parameters); }
 };
 
-// One segment's fragment. Its decoder is open only while the segment is
-// composed, so a recording of hundreds of fragments holds one file open at
-// a time; the codec parameters, read when composing starts, stay.
+// One segment's fragment. The first kOpenFragments stay open from the start
+// (opening a long fragment parses its whole index, so most recordings are
+// opened once); the others are opened only while they are composed, so a
+// recording of hundreds of fragments holds a bounded number of files open.
+// The codec parameters, read when composing starts, stay.
+constexpr std::size_t kOpenFragments = 16;
+
 struct Input {
   RCComposerSegment segment;
   std::unique_ptr<AVCodecParameters, ParametersDeleter> parameters;
   std::unique_ptr<RCAudioDecoder> decoder;
 
   platform::Status open() {
+    if (decoder) return {};
     auto opened = RCAudioDecoder::open(segment.fragmentURL);
     if (!opened) return platform::fail(opened.error());
     decoder = std::move(*opened);
@@ -627,7 +632,7 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
         avcodec_parameters_copy(input.parameters.get(), input.decoder->codecParameters()) < 0) {
       throw std::bad_alloc();
     }
-    input.decoder.reset();
+    if (inputs.size() >= kOpenFragments) input.decoder.reset();
     inputs.push_back(std::move(input));
   }
 
