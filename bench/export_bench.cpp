@@ -5,12 +5,14 @@
 //      composing it with its waveform in-process (best of two each).
 //      Target: at most 1.3 x.
 //   2. Ten recordings of three 2-minute fragments: exported all at once (ten
-//      clients) against one after another. Target: at most 0.6 x.
+//      clients) against one after another, with both media workers started
+//      (best of two rounds each). Target: at most 0.6 x.
 //
 // Usage: export_bench
 #include <sdbus-c++/sdbus-c++.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -129,22 +131,33 @@ int main() {
       "(target <= 1.3)\n",
       throughBus, inProcess, throughBus / inProcess);
 
-  // 2. Ten recordings, at once and one after another.
-  std::vector<std::string> sequential, parallel;
-  for (int i = 0; i < 10; ++i) {
-    sequential.push_back(makeRecording(**model, cache, "One " + std::to_string(i), 120));
-    parallel.push_back(makeRecording(**model, cache, "All " + std::to_string(i), 120));
-  }
-  double oneByOne = seconds([&] {
-    for (const auto& path : sequential) exportThroughTheBus(bus.address(), path);
-  });
-  double atOnce = seconds([&] {
+  // 2. Ten recordings, at once and one after another, best of two rounds
+  //    each. Both media workers are started first (by two exports at once),
+  //    as on a daemon that has been working: otherwise the at-once round
+  //    alone pays for starting the second one.
+  auto exportAll = [&](const std::vector<std::string>& paths) {
     std::vector<std::thread> clients;
-    for (const auto& path : parallel) {
+    for (const auto& path : paths) {
       clients.emplace_back([&, path] { exportThroughTheBus(bus.address(), path); });
     }
     for (auto& client : clients) client.join();
-  });
+  };
+  exportAll(
+      {makeRecording(**model, cache, "Warm 0", 120), makeRecording(**model, cache, "Warm 1", 120)});
+  double oneByOne = 1e9, atOnce = 1e9;
+  for (int round = 0; round < 2; ++round) {
+    std::vector<std::string> sequential, parallel;
+    for (int i = 0; i < 10; ++i) {
+      const std::string suffix = std::to_string(round) + "-" + std::to_string(i);
+      sequential.push_back(makeRecording(**model, cache, "One " + suffix, 120));
+      parallel.push_back(makeRecording(**model, cache, "All " + suffix, 120));
+    }
+    oneByOne = std::min(oneByOne, seconds([&] {
+                          for (const auto& path : sequential)
+                            exportThroughTheBus(bus.address(), path);
+                        }));
+    atOnce = std::min(atOnce, seconds([&] { exportAll(parallel); }));
+  }
   std::printf(
       "10 recordings: at once %.2f s, one after another %.2f s; ratio %.2f "
       "(target <= 0.6)\n",
