@@ -216,8 +216,7 @@ TEST_F(MediaWorkerDaemonTest, AWorkerOrTheDaemonKilledMidExportLeavesNothingTheN
   ASSERT_TRUE(second) << second.error() << daemon->output();
   (*client)->endAccessSessionWithToken(*second);
   EXPECT_TRUE(fs::exists(audio.path()));
-  ASSERT_TRUE(
-      RCComposition::load(*bundle_ = RCComposition::compositionBundleURLForComposedAVURL(audio)));
+  ASSERT_TRUE(RCComposition::load(RCComposition::compositionBundleURLForComposedAVURL(audio)));
   for (const auto& entry : fs::directory_iterator(recordings_)) {
     EXPECT_NE(entry.path().filename().string().front(), '.') << entry.path();
   }
