@@ -233,13 +233,16 @@ bool RCSApplyAssetMetadataToRecording(RCSavedRecording& recording) {
 
 RCSOrphanHandling::RCSOrphanHandling(RCSavedRecordingsModel& model) : model_(model) {}
 
-std::optional<RCMD5Digest> RCSOrphanHandling::_MD5DataForPath(const std::string& path) {
+platform::Result<std::optional<RCMD5Digest>> RCSOrphanHandling::digestLoggingFailure(
+    const std::string& path) {
   auto digest = RCMD5DigestOfFile(path);
-  if (!digest) {
-    ORPHAN_LOG("ERROR: -MD5DataForPath was unable load data for {}", path);
-    return std::nullopt;
-  }
-  return *digest;
+  if (!digest) ORPHAN_LOG("ERROR: -MD5DataForPath was unable load data for {}", path);
+  return digest;
+}
+
+std::optional<RCMD5Digest> RCSOrphanHandling::_MD5DataForPath(const std::string& path) {
+  auto digest = digestLoggingFailure(path);
+  return digest ? *digest : std::nullopt;
 }
 
 void RCSOrphanHandling::performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs(
@@ -408,12 +411,8 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
   auto digestOf = [&](const std::string& path) -> platform::Result<std::optional<RCMD5Digest>> {
     if (auto cached = digestCache.find(path); cached != digestCache.end()) return cached->second;
     ++statistics_.filesDigested;
-    auto digest = RCMD5DigestOfFile(path);
-    if (!digest) {
-      ORPHAN_LOG("ERROR: -MD5DataForPath was unable load data for {}", path);
-    } else if (*digest) {
-      digestCache.emplace(path, **digest);
-    }
+    auto digest = digestLoggingFailure(path);
+    if (digest && *digest) digestCache.emplace(path, **digest);
     return digest;
   };
   auto remove = [&](const platform::URL& url) {
@@ -496,13 +495,17 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
       continue;
     }
     std::shared_ptr<RCAudioAsset> asset = *examined;
-    if (!asset) {
-      ORPHAN_LOG("Orphaned composed AVURL: '{}' unable to load AVURLAsset", name);
+    // Read, and found without playable audio or without length: deleted.
+    auto deleteUnplayable = [&] {
       ORPHAN_LOG(
           "Orphaned composed AVURL: '{}' unable to insert orphaned asset into database.  "
           "Deleting!",
           name);
       remove(url);
+    };
+    if (!asset) {
+      ORPHAN_LOG("Orphaned composed AVURL: '{}' unable to load AVURLAsset", name);
+      deleteUnplayable();
       continue;
     }
     const double duration = asset->duration();
@@ -511,11 +514,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
           "Orphaned composed AVURL: unable to insert '{}' into the database because it's "
           "duration is 0",
           name);
-      ORPHAN_LOG(
-          "Orphaned composed AVURL: '{}' unable to insert orphaned asset into database.  "
-          "Deleting!",
-          name);
-      remove(url);
+      deleteUnplayable();
       continue;
     }
     ORPHAN_LOG(

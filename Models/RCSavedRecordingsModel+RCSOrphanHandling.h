@@ -86,6 +86,10 @@ class RCSOrphanHandling {
   class FileManager;
 
  private:
+  // The digest, an empty value for an empty or missing file, or the read
+  // error (logged as _MD5DataForPath logs it): the run tells an unreadable
+  // file from one that holds nothing.
+  static platform::Result<std::optional<RCMD5Digest>> digestLoggingFailure(const std::string& path);
   void _performOrphanRecoveryAndCleanupOfCompositionsWithInUseComposedAVURLs(
       RCURLSet& inUse, FileManager& fileManager,
       const std::vector<platform::URL>& URLsInSavedRecordingsDirectory);
