@@ -14,25 +14,44 @@
 // holds across async and sync, the caller's thread-local state (the current
 // connection, the queue chain) stays visible inside the task, and an idle
 // sync costs no thread hop.
+//
+// Adoption (AdoptionScope) lets an event loop's thread stand in for the
+// worker: an async() from inside the scope onto an idle queue marks the
+// queue owned, as a running worker task would, and records it in the
+// thread's list. Ownership is what keeps the worker and every other thread
+// off the queue, so nothing else changes: other threads' async() calls queue
+// behind it, sync() callers queue a gate, and when the scope ends the
+// adopting thread drains the queue with the worker's own loop (less the
+// waiting), then gives ownership back. The worker is woken only when someone
+// else has to go on: work left after the time budget, or a stop.
+//
+// Wake-ups: async() signals the worker only when the queue is not owned. An
+// owner always looks at the FIFO before it lets go (the worker's loop, a sync
+// caller's release, the end of an adopted run), so a signal to a worker that
+// cannot take the queue yet would only wake it to sleep again.
 #include "platform/SerialQueue.h"
 #include "platform/Misuse.h"
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
+#include <exception>
 #include <mutex>
 #include <thread>
 #include <utility>
+#include <vector>
 
 namespace platform {
 namespace {
 
-// About a few microseconds of pause instructions.
-constexpr int kSpinsBeforeSleeping = 100;
+// How long a sync caller waits for a busy queue before it sleeps.
+constexpr auto kSpinBeforeSleeping = std::chrono::microseconds(5);
 
 inline void cpuRelax() {
 #if defined(__x86_64__) || defined(__i386__)
@@ -40,15 +59,45 @@ inline void cpuRelax() {
 #endif
 }
 
+// Spins until `owned` reads false or kSpinBeforeSleeping has passed.
+void spinWhileOwned(const std::atomic<bool>& owned) {
+  const auto until = std::chrono::steady_clock::now() + kSpinBeforeSleeping;
+  while (owned.load(std::memory_order_relaxed)) {
+    for (int i = 0; i < 16; ++i) cpuRelax();
+    if (std::chrono::steady_clock::now() >= until) return;
+  }
+}
+
 struct SyncGate {
-  std::condition_variable granted_cv;
-  bool granted = false;
+  enum class Signal {
+    None,
+    Granted,  // the queue is the waiter's: the worker or an adopted run handed it over
+    Retry,    // a sync caller let go of the queue: the waiter takes it, first in line
+  };
+  std::condition_variable signalled;
+  Signal signal = Signal::None;
 };
 
 struct Item {
   Task task;
   SyncGate* gate = nullptr;  // set for a sync caller waiting for its turn
 };
+
+// The calling thread's adoption scope: whether one is open, and the queues
+// it has adopted so far, in order.
+struct Adoption {
+  bool open = false;
+  std::vector<SerialQueue*> queues;
+};
+thread_local Adoption tAdoption;
+
+// Takes `queue` off the thread's adopted list; whether it was there.
+bool takeAdopted(SerialQueue* queue) {
+  auto found = std::find(tAdoption.queues.begin(), tAdoption.queues.end(), queue);
+  if (found == tAdoption.queues.end()) return false;
+  tAdoption.queues.erase(found);
+  return true;
+}
 
 }  // namespace
 
@@ -81,8 +130,8 @@ SerialQueue::SerialQueue(std::string label) : state_(std::make_unique<State>()) 
       state.owned = true;
       if (item.gate != nullptr) {
         // Hand the queue to the waiting sync caller; it clears `owned`.
-        item.gate->granted = true;
-        item.gate->granted_cv.notify_one();
+        item.gate->signal = SyncGate::Signal::Granted;
+        item.gate->signalled.notify_one();
         continue;
       }
       lock.unlock();
@@ -101,6 +150,8 @@ SerialQueue::SerialQueue(std::string label) : state_(std::make_unique<State>()) 
 SerialQueue::~SerialQueue() {
   QV_MISUSE(std::this_thread::get_id() == state_->workerId || detail::isRunningOnQueue(*this),
             "SerialQueue '{}' destroyed from its own queue", state_->label);
+  // Adopted by this thread: its tasks run now, as the worker would run them.
+  if (takeAdopted(this)) runAdopted(*this);
   {
     std::lock_guard lock(state_->mutex);
     state_->stopping = true;
@@ -110,39 +161,59 @@ SerialQueue::~SerialQueue() {
 }
 
 void SerialQueue::async(Task task) {
+  bool wake;
   {
     std::lock_guard lock(state_->mutex);
+    // An owned queue is passed on by its owner, who looks at the FIFO first.
+    wake = !state_->owned;
+    if (wake && tAdoption.open && state_->items.empty()) {
+      state_->owned = true;
+      tAdoption.queues.push_back(this);
+      wake = false;
+    }
     state_->items.push_back(Item{std::move(task), nullptr});
   }
-  state_->wake.notify_one();
+  if (wake) state_->wake.notify_one();
 }
 
 void SerialQueue::sync(Task task) {
   QV_MISUSE(detail::isRunningOnQueue(*this),
             "SerialQueue::sync called from the '{}' queue onto itself: it would deadlock",
             state_->label);
+  // Adopted by this thread: what it queued comes first, and runs here now.
+  if (takeAdopted(this)) runAdopted(*this);
   State& state = *state_;
   {
     std::unique_lock lock(state.mutex);
-    if (state.owned && state.items.empty()) {
-      // Another thread holds the queue and nothing waits behind it. The
-      // queues that are synced onto hold it for a few microseconds (a table
-      // update), far less than going to sleep and being woken again, so spin
-      // a little before queueing a gate.
-      lock.unlock();
-      for (int i = 0; i < kSpinsBeforeSleeping && state.owned.load(std::memory_order_relaxed);
-           ++i) {
-        cpuRelax();
+    bool atHead = false;  // woken by a release: first in line, ahead of the FIFO
+    bool spun = false;
+    for (;;) {
+      if (!state.owned && (atHead || state.items.empty())) {
+        state.owned = true;
+        break;
       }
-      lock.lock();
-    }
-    if (state.owned || !state.items.empty()) {
+      if (state.owned && (atHead || state.items.empty()) && !spun) {
+        // Another thread holds the queue and nothing waits behind it. The
+        // queues that are synced onto hold it for a microsecond or two (a
+        // table update), far less than going to sleep and being woken
+        // again, so wait a little for it before queueing a gate.
+        lock.unlock();
+        spinWhileOwned(state.owned);
+        lock.lock();
+        spun = true;
+        continue;
+      }
       SyncGate gate;
       // No wake-up: whoever owns the queue passes it on when done.
-      state.items.push_back(Item{nullptr, &gate});
-      gate.granted_cv.wait(lock, [&] { return gate.granted; });
-    } else {
-      state.owned = true;
+      if (atHead) {
+        state.items.push_front(Item{nullptr, &gate});
+      } else {
+        state.items.push_back(Item{nullptr, &gate});
+      }
+      gate.signalled.wait(lock, [&] { return gate.signal != SyncGate::Signal::None; });
+      if (gate.signal == SyncGate::Signal::Granted) break;  // handed over: owned stays set
+      atHead = true;
+      spun = false;
     }
   }
   struct Release {
@@ -151,16 +222,20 @@ void SerialQueue::sync(Task task) {
       bool work;
       {
         std::lock_guard lock(state.mutex);
+        state.owned = false;
         if (!state.items.empty() && state.items.front().gate != nullptr) {
-          // The next in line is another sync caller: hand the queue straight
-          // to it, without a round trip through the worker.
+          // The next in line is another sync caller: wake it to take the
+          // queue, first in line, without a round trip through the worker.
+          // The queue is not handed to it while it sleeps: a caller that
+          // comes back at once (a loop of table updates) would otherwise
+          // find the queue owned by a thread that is not running yet, and
+          // go to sleep in turn, and the two would take turns sleeping.
           SyncGate* next = state.items.front().gate;
           state.items.pop_front();
-          next->granted = true;
-          next->granted_cv.notify_one();
+          next->signal = SyncGate::Signal::Retry;
+          next->signalled.notify_one();
           return;
         }
-        state.owned = false;
         work = !state.items.empty() || state.stopping;
       }
       // An idle queue's worker has nothing to do: leave it asleep.
@@ -169,6 +244,63 @@ void SerialQueue::sync(Task task) {
   } release{state};
   detail::ScopedCurrentQueue scope(*this);
   task();
+}
+
+void SerialQueue::runAdopted(SerialQueue& queue) {
+  State& state = *queue.state_;
+  const auto start = std::chrono::steady_clock::now();
+  std::unique_lock lock(state.mutex);
+  for (bool first = true;; first = false) {
+    if (state.items.empty() ||
+        (!first && std::chrono::steady_clock::now() - start > kAdoptedRunBudget)) {
+      state.owned = false;
+      // Signalled with the lock held: a stopping queue may be freed as soon
+      // as its worker, woken by this, has left.
+      if (!state.items.empty() || state.stopping) state.wake.notify_one();
+      return;
+    }
+    Item item = std::move(state.items.front());
+    state.items.pop_front();
+    if (item.gate != nullptr) {
+      // A sync caller's turn: the queue is its now; its release passes the
+      // queue on to the worker if work remains.
+      item.gate->signal = SyncGate::Signal::Granted;
+      item.gate->signalled.notify_one();
+      return;
+    }
+    lock.unlock();
+    {
+      detail::ScopedCurrentQueue scope(queue);
+      item.task();
+      item.task = nullptr;
+    }
+    lock.lock();
+  }
+}
+
+SerialQueue::AdoptionScope::AdoptionScope() {
+  QV_MISUSE(tAdoption.open, "SerialQueue::AdoptionScope opened inside another one");
+  tAdoption.open = true;
+}
+
+SerialQueue::AdoptionScope::~AdoptionScope() {
+  // What the adopted tasks queue elsewhere goes to those queues' workers.
+  tAdoption.open = false;
+  const bool unwinding = std::uncaught_exceptions() > 0;
+  while (!tAdoption.queues.empty()) {
+    SerialQueue* queue = tAdoption.queues.front();
+    tAdoption.queues.erase(tAdoption.queues.begin());
+    if (!unwinding) {
+      runAdopted(*queue);
+      continue;
+    }
+    // Leaving through an exception: hand the work to the worker instead of
+    // running tasks in the middle of unwinding.
+    State& state = *queue->state_;
+    std::lock_guard lock(state.mutex);
+    state.owned = false;
+    state.wake.notify_one();
+  }
 }
 
 bool SerialQueue::isCurrent() const { return detail::isRunningOnQueue(*this); }

@@ -7,6 +7,9 @@
 // on this queue (and still on any queue it was already running on). A sync
 // onto a queue the caller is running on aborts: it could never get its turn.
 // Every member may be called from any thread.
+//
+// An event loop may run the work its deliveries queue itself (see
+// AdoptionScope), which spares a busy daemon two thread switches per request.
 #pragma once
 
 #include <memory>
@@ -28,8 +31,34 @@ class SerialQueue final : public DispatchQueue {
   bool isCurrent() const override;
   const std::string& label() const override;
 
+  // While an AdoptionScope exists on a thread, an async() from that thread
+  // onto an idle serial queue (no task running, nothing queued) leaves the
+  // queue's worker asleep: the thread adopts the queue, and when the scope
+  // ends it runs the queue's tasks itself, as the worker would, one at a time
+  // in FIFO order, until the queue is empty, a sync() caller's turn comes, or
+  // kAdoptedRunBudget has passed (the rest then goes to the worker). Tasks
+  // queued meanwhile by other threads wait for it as they would for the
+  // worker's current task. A sync() onto an adopted queue from the adopting
+  // thread first runs what the queue holds.
+  //
+  // Meant for an event loop around each delivery: the work a delivered
+  // message queues then runs right after it on the loop's thread, which
+  // keeps the loop from reading the next message meanwhile, so only loops
+  // whose queued work is short should use it. Scopes do not nest; create it
+  // on the stack, outside every task.
+  class AdoptionScope {
+   public:
+    AdoptionScope();
+    ~AdoptionScope();
+    AdoptionScope(const AdoptionScope&) = delete;
+    AdoptionScope& operator=(const AdoptionScope&) = delete;
+  };
+  static constexpr Duration kAdoptedRunBudget = std::chrono::milliseconds(2);
+
  private:
   struct State;
+  // Runs an adopted queue's tasks on the calling thread (see AdoptionScope).
+  static void runAdopted(SerialQueue& queue);
   std::unique_ptr<State> state_;
 };
 

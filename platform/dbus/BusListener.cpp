@@ -17,6 +17,15 @@
 //    thread avoids that.
 // Tasks are queued under a mutex and an eventfd wakes the poll().
 //
+// Each message is delivered inside a SerialQueue::AdoptionScope: the work a
+// request queues onto an idle serial queue (the service's) runs on this
+// thread right after the delivery, replies included, instead of waking that
+// queue's worker and then having the worker's replies wait for the sd-bus
+// lock this thread holds while it reads. On a busy daemon that spares each
+// request two thread switches and the lock hand-overs. Work queued while the
+// queue is busy still goes to its worker, and a run here stops after a short
+// budget, so a flood of queued work never keeps this thread from reading.
+//
 // Lifetimes: every sdbus::Message refers to the sdbus connection that read
 // it, so the connection (Core) is shared by the listener and every
 // outstanding call's responder, and outlives both. The object's method
@@ -39,6 +48,7 @@
 #include <thread>
 
 #include "platform/Log.h"
+#include "platform/SerialQueue.h"
 #include "platform/dbus/SdBusCodec.h"
 
 namespace platform {
@@ -251,7 +261,12 @@ void BusListener::run() {
         runTasks(lock);
         if (loop_->stopRequested) break;
       }
-      if (bus.processPendingRequest()) continue;
+      bool processed;
+      {
+        SerialQueue::AdoptionScope adoption;
+        processed = bus.processPendingRequest();
+      }
+      if (processed) continue;
       auto pollData = bus.getEventLoopPollData();
       struct pollfd fds[] = {{pollData.fd, pollData.events, 0}, {loop_->wakeFd, POLLIN, 0}};
       int result = ::poll(fds, 2, pollData.getPollTimeout());

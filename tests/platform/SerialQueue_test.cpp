@@ -9,6 +9,7 @@
 #include <future>
 #include <latch>
 #include <memory>
+#include <optional>
 #include <thread>
 #include <vector>
 
@@ -106,8 +107,12 @@ TEST(SerialQueueTest, TasksNeverOverlapUnderConcurrentAsyncAndSync) {
   constexpr int kPerThread = 2000;
   std::vector<std::thread> threads;
   for (int t = 0; t < kThreads; ++t) {
+    // Odd threads queue from inside adoption scopes, as an event loop does,
+    // so adopted runs race the worker and the other threads' sync calls.
     threads.emplace_back([&, t] {
       for (int i = 0; i < kPerThread; ++i) {
+        std::optional<SerialQueue::AdoptionScope> adoption;
+        if (t % 2 == 1) adoption.emplace();
         if ((i + t) % 3 == 0) {
           queue.sync(body);
         } else {
@@ -141,7 +146,12 @@ TEST(SerialQueueStressTest, HundredThousandTasksAcrossQueuesRunInOrder) {
     producers.emplace_back([&, p] {
       start.arrive_and_wait();
       std::vector<int> sequence(kQueues, 0);
+      std::optional<SerialQueue::AdoptionScope> adoption;
       for (int i = 0; i < kTasksPerProducer; ++i) {
+        if (p % 2 == 1 && i % 4 == 0) {
+          adoption.reset();
+          adoption.emplace();
+        }
         const int q = (i * 7 + p) % kQueues;
         const int n = sequence[q]++;
         queues[q]->async([&, q, p, n] {
@@ -160,6 +170,60 @@ TEST(SerialQueueStressTest, HundredThousandTasksAcrossQueuesRunInOrder) {
     });
   }
   EXPECT_EQ(total, kProducers * kTasksPerProducer);
+}
+
+TEST(SerialQueueTest, AnAdoptingThreadRunsWhatItQueuedOnAnIdleQueueWhenTheScopeEnds) {
+  SerialQueue idle("test.idle");
+  SerialQueue busy("test.busy");
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  busy.async([released] { released.wait(); });
+  std::vector<std::string> log;
+  std::vector<std::thread::id> ranOn;
+  std::promise<std::thread::id> busyRanOn;
+  {
+    SerialQueue::AdoptionScope adoption;
+    idle.async([&] {
+      log.push_back("a");
+      ranOn.push_back(std::this_thread::get_id());
+      EXPECT_TRUE(idle.isCurrent());
+      idle.async([&] { log.push_back("queued by a"); });
+    });
+    idle.async([&] { log.push_back("b"); });
+    // A queue already at work keeps its worker.
+    busy.async([&] { busyRanOn.set_value(std::this_thread::get_id()); });
+    EXPECT_TRUE(log.empty());
+    // A sync from the adopting thread runs what it queued first.
+    idle.sync([&] { log.push_back("sync"); });
+    idle.async([&] {
+      log.push_back("c");
+      ranOn.push_back(std::this_thread::get_id());
+    });
+    EXPECT_EQ(log.size(), 4u);
+  }
+  EXPECT_EQ(log, (std::vector<std::string>{"a", "b", "queued by a", "sync", "c"}));
+  EXPECT_EQ(ranOn, (std::vector<std::thread::id>(2, std::this_thread::get_id())));
+  release.set_value();
+  EXPECT_NE(busyRanOn.get_future().get(), std::this_thread::get_id());
+}
+
+TEST(SerialQueueTest, AnAdoptedRunHandsWhatIsLeftToTheWorkerAfterItsBudget) {
+  SerialQueue queue("test.budget");
+  std::promise<std::thread::id> secondRanOn;
+  std::thread::id firstRanOn;
+  {
+    SerialQueue::AdoptionScope adoption;
+    queue.async([&] {
+      firstRanOn = std::this_thread::get_id();
+      // Busy, not asleep: the budget counts the time the task takes.
+      const auto until = std::chrono::steady_clock::now() + 2 * SerialQueue::kAdoptedRunBudget;
+      while (std::chrono::steady_clock::now() < until) {
+      }
+    });
+    queue.async([&] { secondRanOn.set_value(std::this_thread::get_id()); });
+  }
+  EXPECT_EQ(firstRanOn, std::this_thread::get_id());
+  EXPECT_NE(secondRanOn.get_future().get(), std::this_thread::get_id());
 }
 
 TEST(GlobalQueueTest, RunsTasksConcurrentlyOnAtLeastTwoThreads) {
