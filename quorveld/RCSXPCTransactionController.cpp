@@ -31,7 +31,7 @@ RCSXPCTransactionController::RCSXPCTransactionController()
 void RCSXPCTransactionController::addActiveTransaction(RCSXPCTransaction& transaction) {
   _serialQueue.sync([&] {
     QV_LOG(platform::kLogLevelDebug, "Activating XPC transaction: {}", transaction.description());
-    _openTransactions.insert_or_assign(transaction._identifier(), transaction.weak_from_this());
+    _openTransactions.insertOrAssign(transaction._identifier(), transaction.weak_from_this());
     transaction._listed.store(true, std::memory_order_release);
     _onQueueUpdateInternalTransactionState();
   });
@@ -57,11 +57,9 @@ void RCSXPCTransactionController::_onQueueRemove(const platform::UUID& identifie
                                                  const RCSXPCTransaction* transaction,
                                                  std::string_view description) {
   QV_DCHECK_ON_QUEUE(_serialQueue);
-  auto entry = _openTransactions.find(identifier);
-  if (entry == _openTransactions.end()) return;
+  if (!_openTransactions.erase(identifier)) return;
   QV_LOG(platform::kLogLevelDebug, "Deactivating XPC transaction: {}",
          transaction ? transaction->description() : std::string(description));
-  _openTransactions.erase(entry);
   if (transaction) transaction->_listed.store(false, std::memory_order_release);
   _onQueueUpdateInternalTransactionState();
 }
@@ -75,9 +73,9 @@ bool RCSXPCTransactionController::isTransactionActive(const RCSXPCTransaction& t
 std::vector<std::shared_ptr<RCSXPCTransaction>> RCSXPCTransactionController::activeTransactions() {
   std::vector<std::shared_ptr<RCSXPCTransaction>> transactions;
   _serialQueue.sync([&] {
-    for (const auto& [identifier, weak] : _openTransactions) {
+    _openTransactions.forEach([&](const platform::UUID&, const auto& weak) {
       if (auto transaction = weak.lock()) transactions.push_back(std::move(transaction));
-    }
+    });
   });
   return transactions;
 }

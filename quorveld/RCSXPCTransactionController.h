@@ -13,11 +13,11 @@
 #include <memory>
 #include <string>
 #include <string_view>
-#include <unordered_map>
 #include <vector>
 
 #include "platform/SerialQueue.h"
 #include "platform/UUID.h"
+#include "platform/UUIDTable.h"
 
 namespace quorvel {
 
@@ -54,8 +54,10 @@ class RCSXPCTransactionController {
   platform::SerialQueue _serialQueue;
 
   // Controller queue only:
-  // Identifier -> transaction, never owning it.
-  std::unordered_map<platform::UUID, std::weak_ptr<RCSXPCTransaction>> _openTransactions;
+  // Identifier -> transaction, never owning it. A busy daemon keeps tens of
+  // thousands here (every queued request's keep-alive lives a second after
+  // its work), so the table is a flat one.
+  platform::UUIDTable<std::weak_ptr<RCSXPCTransaction>> _openTransactions;
 
   // Written on the controller queue, read from any thread.
   std::atomic<bool> _inTransaction{false};

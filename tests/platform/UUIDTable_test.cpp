@@ -1,0 +1,62 @@
+// The flat UUID table against std::unordered_map, through random inserts,
+// overwrites and removals, with a hash that piles keys into a few home
+// slots so that runs wrap around the end of the array and removals shift.
+#include "platform/UUIDTable.h"
+
+#include <gtest/gtest.h>
+
+#include <map>
+#include <random>
+
+namespace platform {
+namespace {
+
+struct FewHomes {
+  std::size_t operator()(const UUID& uuid) const { return uuid.bytes()[0] % 3 + 13; }
+};
+
+template <class Hash>
+void matchesAMapThroughRandomChanges(int operations, int keys) {
+  std::mt19937 random(42);
+  std::vector<UUID> pool;
+  for (int i = 0; i < keys; ++i) pool.push_back(UUID::random());
+  UUIDTable<int, Hash> table;
+  std::map<UUID, int> expected;
+  for (int step = 0; step < operations; ++step) {
+    const UUID& key = pool[random() % pool.size()];
+    if (random() % 3 == 0) {
+      EXPECT_EQ(table.erase(key), expected.erase(key) == 1);
+    } else {
+      table.insertOrAssign(key, step);
+      expected[key] = step;
+    }
+    ASSERT_EQ(table.size(), expected.size());
+  }
+  for (const UUID& key : pool) {
+    auto found = expected.find(key);
+    int* value = table.find(key);
+    ASSERT_EQ(value != nullptr, found != expected.end());
+    if (value) {
+      EXPECT_EQ(*value, found->second);
+    }
+  }
+  std::map<UUID, int> visited;
+  table.forEach([&](const UUID& key, int value) { visited[key] = value; });
+  EXPECT_EQ(visited, expected);
+  // Emptied, it shrinks back and still works.
+  for (const UUID& key : pool) table.erase(key);
+  EXPECT_TRUE(table.empty());
+  table.insertOrAssign(pool[0], 1);
+  EXPECT_EQ(*table.find(pool[0]), 1);
+}
+
+TEST(UUIDTableTest, AgreesWithAMapUnderCollidingKeys) {
+  matchesAMapThroughRandomChanges<FewHomes>(20000, 40);
+}
+
+TEST(UUIDTableTest, AgreesWithAMapThroughGrowthAndShrinking) {
+  matchesAMapThroughRandomChanges<std::hash<UUID>>(200000, 5000);
+}
+
+}  // namespace
+}  // namespace platform
