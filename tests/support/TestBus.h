@@ -35,6 +35,8 @@ class TestBus {
 
   // The address to connect to, e.g. "unix:path=/tmp/qv-bus-XXXX/dbus-abc,guid=...".
   const std::string& address() const { return address_; }
+  // The dbus-daemon's process, for benchmarks that read its CPU time.
+  pid_t pid() const { return pid_; }
   // Ends the daemon now and waits for it (to test a lost bus). Idempotent.
   void kill();
 
