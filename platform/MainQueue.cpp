@@ -16,6 +16,9 @@
 // within that window run in one turn instead of one wake-up each. The leeway
 // only delays waking on the real clock; what is due is always decided by the
 // queue's clock, so a manual clock's jump runs exactly the timers it passes.
+// Timers scheduled in deadline order (nearly all: every keep-alive waits the
+// same second) go to the tail of a FIFO instead of into the ordered map, and
+// the two are merged by (deadline, order of scheduling) when they fall due.
 #include "platform/MainQueue.h"
 #include "platform/Misuse.h"
 
@@ -29,6 +32,7 @@
 #include <iterator>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <semaphore>
 #include <utility>
 
@@ -56,7 +60,9 @@ struct MainQueue::State {
   mutable std::mutex mutex;
   std::condition_variable wake;
   std::deque<Task> ready;
-  std::map<std::pair<TimePoint, std::uint64_t>, Task> timers;
+  using TimerKey = std::pair<TimePoint, std::uint64_t>;  // (deadline, order of scheduling)
+  std::map<TimerKey, Task> timers;
+  std::deque<std::pair<TimerKey, Task>> timersInOrder;  // deadlines never decrease
   std::uint64_t nextTimerOrder = 0;
   std::atomic<bool> stopRequested{false};  // written under `mutex`
   int servicers = 0;                       // threads inside run() / runUntilIdle()
@@ -103,14 +109,33 @@ const std::string& MainQueue::label() const { return state_->label; }
 
 Clock& MainQueue::clock() const { return state_->clock; }
 
+namespace {
+
+// With the state's mutex held: the first deadline of either timer list.
+template <class StateT>
+std::optional<typename StateT::TimerKey> firstTimer(const StateT& state) {
+  std::optional<typename StateT::TimerKey> first;
+  if (!state.timers.empty()) first = state.timers.begin()->first;
+  if (!state.timersInOrder.empty() && (!first || state.timersInOrder.front().first < *first)) {
+    first = state.timersInOrder.front().first;
+  }
+  return first;
+}
+
+}  // namespace
+
 void MainQueue::after(Duration delay, Task task) {
   bool earliest;
   {
     std::lock_guard lock(state_->mutex);
-    const TimePoint deadline = deadlineAfter(state_->clock.now(), delay);
-    auto timer =
-        state_->timers.emplace(std::pair(deadline, state_->nextTimerOrder++), std::move(task));
-    earliest = timer.first == state_->timers.begin();
+    const State::TimerKey key(deadlineAfter(state_->clock.now(), delay), state_->nextTimerOrder++);
+    const auto first = firstTimer(*state_);
+    earliest = !first || key < *first;
+    if (state_->timersInOrder.empty() || state_->timersInOrder.back().first.first <= key.first) {
+      state_->timersInOrder.emplace_back(key, std::move(task));
+    } else {
+      state_->timers.emplace(key, std::move(task));
+    }
   }
   // A later deadline than the first changes nothing for a sleeping loop.
   if (earliest) state_->wake.notify_all();
@@ -129,9 +154,14 @@ template <class StateT>
 std::size_t runReady(MainQueue& queue, StateT& state, std::unique_lock<std::mutex>& lock,
                      bool honourStop) {
   const TimePoint now = state.clock.now();
-  while (!state.timers.empty() && state.timers.begin()->first.first <= now) {
-    auto node = state.timers.extract(state.timers.begin());
-    state.ready.push_back(std::move(node.mapped()));
+  for (auto first = firstTimer(state); first && first->first <= now; first = firstTimer(state)) {
+    if (!state.timersInOrder.empty() && state.timersInOrder.front().first == *first) {
+      state.ready.push_back(std::move(state.timersInOrder.front().second));
+      state.timersInOrder.pop_front();
+    } else {
+      auto node = state.timers.extract(state.timers.begin());
+      state.ready.push_back(std::move(node.mapped()));
+    }
   }
   if (state.ready.empty()) return 0;
   std::deque<Task> batch;
@@ -179,11 +209,11 @@ void MainQueue::run() {
       return;
     }
     if (runReady(*this, state, lock, true) > 0) continue;
-    if (state.timers.empty()) {
-      state.wake.wait(lock);
-    } else {
-      const Duration left = state.timers.begin()->first.first - state.clock.now();
+    if (const auto first = firstTimer(state)) {
+      const Duration left = first->first - state.clock.now();
       state.wake.wait_for(lock, std::min(left, kMaxWait) + kTimerLeeway);
+    } else {
+      state.wake.wait(lock);
     }
   }
 }
@@ -207,7 +237,7 @@ std::size_t MainQueue::runUntilIdle() {
 
 std::size_t MainQueue::pendingCount() const {
   std::lock_guard lock(state_->mutex);
-  return state_->ready.size() + state_->timers.size();
+  return state_->ready.size() + state_->timers.size() + state_->timersInOrder.size();
 }
 
 namespace {
