@@ -29,7 +29,7 @@ void fillFromKernel(std::uint8_t* data, std::size_t size) {
 // kernel's random bytes a block at a time and hands them out 16 at a time.
 // The bytes are the kernel's, used once each; a forked child drops what its
 // parent had buffered, so the two never hand out the same identifier.
-constexpr std::size_t kBlock = std::size_t{16} * 32;  // 32 identifiers
+constexpr std::size_t kBlock = std::size_t{16} * 128;  // 128 identifiers
 std::atomic<std::uint64_t> forkGeneration{0};
 
 struct RandomBuffer {

@@ -22,7 +22,13 @@ class UUID {
   std::string string() const;
   const std::array<std::uint8_t, 16>& bytes() const { return bytes_; }
 
-  friend bool operator==(const UUID&, const UUID&) = default;
+  // Two word compares: tables of keep-alives compare identifiers all day.
+  friend bool operator==(const UUID& a, const UUID& b) {
+    std::uint64_t words[4];
+    std::memcpy(&words[0], a.bytes_.data(), 16);
+    std::memcpy(&words[2], b.bytes_.data(), 16);
+    return words[0] == words[2] && words[1] == words[3];
+  }
   friend auto operator<=>(const UUID&, const UUID&) = default;
 
  private:
