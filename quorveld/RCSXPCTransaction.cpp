@@ -17,7 +17,12 @@
 namespace quorvel {
 
 std::shared_ptr<RCSXPCTransaction> RCSXPCTransaction::initWithName(std::string name) {
-  return std::shared_ptr<RCSXPCTransaction>(new RCSXPCTransaction(std::move(name)));
+  // One allocation for the transaction and its count: every queued request
+  // makes one.
+  struct Constructible : RCSXPCTransaction {
+    explicit Constructible(std::string name) : RCSXPCTransaction(std::move(name)) {}
+  };
+  return std::make_shared<Constructible>(std::move(name));
 }
 
 RCSXPCTransaction::RCSXPCTransaction(std::string name)
