@@ -103,11 +103,12 @@ std::optional<std::string> percentDecode(std::string_view text) {
   return out;
 }
 
-URL::URL(std::string path, bool directory) : path_(std::move(path)) {
-  while (path_.size() > 1 && path_.back() == '/') path_.pop_back();
-  if (path_.empty()) path_ = "/";
-  absolute_ = std::string(kScheme) + percentEncodePath(path_);
-  if (directory && path_ != "/") absolute_ += '/';
+URL::URL(std::string path, bool directory) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  if (path.empty()) path = "/";
+  std::string absolute = std::string(kScheme) + percentEncodePath(path);
+  if (directory && path != "/") absolute += '/';
+  storage_ = std::make_shared<const Storage>(Storage{std::move(path), std::move(absolute)});
 }
 
 URL URL::fileURLWithPath(std::string_view path) {
@@ -145,11 +146,11 @@ std::optional<URL> URL::fromFileURLStringOrPath(std::string_view text) {
   return fileURLFromString(text);
 }
 
-bool URL::hasDirectoryPath() const { return absolute_.back() == '/'; }
+bool URL::hasDirectoryPath() const { return absoluteString().back() == '/'; }
 
 std::string URL::lastPathComponent() const {
-  if (path_ == "/") return "/";
-  return path_.substr(path_.rfind('/') + 1);
+  if (path() == "/") return "/";
+  return path().substr(path().rfind('/') + 1);
 }
 
 std::string URL::pathExtension() const {
@@ -160,7 +161,7 @@ std::string URL::pathExtension() const {
 }
 
 URL URL::URLByAppendingPathComponent(std::string_view component) const {
-  std::string path = path_;
+  std::string path = this->path();
   if (path.back() != '/') path += '/';
   while (!component.empty() && component.front() == '/') component.remove_prefix(1);
   path += component;
@@ -168,20 +169,20 @@ URL URL::URLByAppendingPathComponent(std::string_view component) const {
 }
 
 URL URL::URLByDeletingLastPathComponent() const {
-  if (path_ == "/") return *this;
-  std::size_t slash = path_.rfind('/');
-  return URL(slash == 0 ? std::string("/") : path_.substr(0, slash), true);
+  if (path() == "/") return *this;
+  std::size_t slash = path().rfind('/');
+  return URL(slash == 0 ? std::string("/") : path().substr(0, slash), true);
 }
 
 URL URL::URLByAppendingPathExtension(std::string_view extension) const {
-  if (extension.empty() || path_ == "/") return *this;
-  return URL(path_ + "." + std::string(extension), hasDirectoryPath());
+  if (extension.empty() || path() == "/") return *this;
+  return URL(path() + "." + std::string(extension), hasDirectoryPath());
 }
 
 URL URL::URLByDeletingPathExtension() const {
   std::string extension = pathExtension();
   if (extension.empty()) return *this;
-  return URL(path_.substr(0, path_.size() - extension.size() - 1), hasDirectoryPath());
+  return URL(path().substr(0, path().size() - extension.size() - 1), hasDirectoryPath());
 }
 
 URL URL::URLByReplacingPathExtension(std::string_view extension) const {
@@ -190,7 +191,7 @@ URL URL::URLByReplacingPathExtension(std::string_view extension) const {
 
 URL URL::URLByStandardizingPath() const {
   std::vector<std::string_view> segments;
-  std::string_view rest = path_;
+  std::string_view rest = path();
   while (!rest.empty()) {
     std::size_t slash = rest.find('/');
     std::string_view segment = rest.substr(0, slash);

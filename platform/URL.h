@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <functional>
 #include <iosfwd>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -30,9 +31,9 @@ class URL {
   static std::optional<URL> fromFileURLStringOrPath(std::string_view text);
 
   // The canonical percent-encoded string, "file:///…".
-  const std::string& absoluteString() const { return absolute_; }
+  const std::string& absoluteString() const { return storage_->absolute; }
   // The decoded path, without a trailing '/' (except for "/").
-  const std::string& path() const { return path_; }
+  const std::string& path() const { return storage_->path; }
   bool hasDirectoryPath() const;
 
   std::string lastPathComponent() const;
@@ -48,13 +49,26 @@ class URL {
   // file system (symbolic links are not resolved).
   URL URLByStandardizingPath() const;
 
-  friend bool operator==(const URL& a, const URL& b) { return a.absolute_ == b.absolute_; }
-  friend auto operator<=>(const URL& a, const URL& b) { return a.absolute_ <=> b.absolute_; }
+  friend bool operator==(const URL& a, const URL& b) {
+    return a.storage_ == b.storage_ || a.absoluteString() == b.absoluteString();
+  }
+  friend auto operator<=>(const URL& a, const URL& b) {
+    return a.absoluteString() <=> b.absoluteString();
+  }
+
+  // Copies share the strings, which never change: a request's URL is copied
+  // into every step and table it passes through. Moving copies too, so a
+  // moved-from URL is still the same URL.
+  URL(const URL&) = default;
+  URL& operator=(const URL&) = default;
 
  private:
+  struct Storage {
+    std::string path;
+    std::string absolute;
+  };
   URL(std::string path, bool directory);
-  std::string path_;
-  std::string absolute_;
+  std::shared_ptr<const Storage> storage_;
 };
 
 // Percent-encodes a decoded path for use in a file URL.
