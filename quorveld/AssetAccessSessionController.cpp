@@ -100,17 +100,23 @@ AssetAccessSessionList AssetAccessSessionController::_sessionsMatchingPredicate(
 std::shared_ptr<AssetAccessSession> AssetAccessSessionController::activeSessionWithAccessToken(
     const RCSSavedRecordingAccessToken& token) const {
   QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
-  auto matches = _sessionsMatchingPredicate(
-      [&](const AssetAccessSession& session) { return session.accessToken() == token; });
-  return matches.empty() ? nullptr : matches.front();
+  // A token names its session's recording, so only that recording's list
+  // can hold it.
+  const std::optional<platform::URL>& url = token.compositionAVURL();
+  if (!url) return nullptr;
+  for (const auto& session : activeSessionsWithWithCompositionAVURL(*url)) {
+    if (session->accessToken() == token) return session;
+  }
+  return nullptr;
 }
 
 AssetAccessSessionList AssetAccessSessionController::activeSessionsWithWithCompositionAVURL(
     const platform::URL& compositionAVURL) const {
   QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
-  return _sessionsMatchingPredicate([&](const AssetAccessSession& session) {
-    return session.accessToken().compositionAVURL() == compositionAVURL;
-  });
+  // Every session is listed under the URL its token names, in the order of
+  // the walk.
+  auto list = _clientSessionsByCompositionAVURL.find(compositionAVURL);
+  return list == _clientSessionsByCompositionAVURL.end() ? AssetAccessSessionList{} : list->second;
 }
 
 AssetAccessSessionList AssetAccessSessionController::activeSessionsWithXPCConnection(
