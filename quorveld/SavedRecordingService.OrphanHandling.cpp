@@ -141,6 +141,10 @@ void SavedRecordingService::disableOrphanHandlingWithCompletionBlock(
 
 void SavedRecordingService::enableOrphanHandlingWithCompletionBlock(
     CompletionHandler completionBlock) {
+  // On a quiet daemon the bus thread runs this block itself (it runs what a
+  // call queues onto the idle service queue), so other calls are read only
+  // once the recovery run has ended. They would wait for the service queue
+  // anyway; only pings and refusals at the door are later.
   _performOnServiceQueue(
       [this, self = shared_from_this(), completion = std::move(completionBlock)]() mutable {
         _isOrphanHandlingEnabled = true;

@@ -10,7 +10,9 @@
 // invalidates every connection. Calls with a wrong argument signature are
 // answered with org.freedesktop.DBus.Error.InvalidArgs and unknown methods
 // with org.freedesktop.DBus.Error.UnknownMethod, without reaching a handler.
-// Replies and signals may be sent from any thread.
+// Replies and signals may be sent from any thread. The work a handler queues
+// onto an idle serial queue runs on the bus thread right after the handler
+// (SerialQueue::AdoptionScope), before the next message is read.
 //
 // Owner: the service, which destroys it (destruction stops it). Never
 // destroy it on its own bus thread.

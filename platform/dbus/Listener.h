@@ -11,7 +11,9 @@
 // Delivery: calls run one at a time on the listener's delivery thread (the
 // bus thread for BusListener), so handlers must return quickly and never
 // block it: check arguments, note Connection::current(), queue the work,
-// and answer the IncomingCall later from whichever queue finishes it.
+// and answer the IncomingCall later from whichever queue finishes it. A
+// listener may run that queued work on its delivery thread once the handler
+// has returned (see SerialQueue::AdoptionScope).
 //
 // Threads: setDelegate() before resume(); the other members may be called
 // from any thread. The delegate's calls run on the delivery thread.
