@@ -16,7 +16,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   if (platform::isSupportedSignature(signature) != types.has_value()) std::abort();
   if (!types) return 0;
   std::string joined;
-  for (const std::string& type : *types) {
+  for (std::string_view type : *types) {
     if (type.empty()) std::abort();
     auto again = platform::splitSignature(type);
     if (!again || again->size() != 1 || (*again)[0] != type) std::abort();

@@ -163,10 +163,10 @@ bool isSupportedSignature(std::string_view signature) {
   return splitSignature(signature).has_value();
 }
 
-std::optional<std::vector<std::string>> splitSignature(std::string_view signature) {
+std::optional<std::vector<std::string_view>> splitSignature(std::string_view signature) {
   // D-Bus limits a signature to 255 bytes.
   if (signature.size() > 255) return std::nullopt;
-  std::vector<std::string> types;
+  std::vector<std::string_view> types;
   std::size_t pos = 0;
   while (pos < signature.size()) {
     std::size_t start = pos;

@@ -80,7 +80,8 @@ std::string signatureOf(const BusValues& values);
 bool isSupportedSignature(std::string_view signature);
 
 // Splits a valid signature into its complete types: "s(siss)b" ->
-// {"s", "(siss)", "b"}. Nothing when the signature is not supported.
-std::optional<std::vector<std::string>> splitSignature(std::string_view signature);
+// {"s", "(siss)", "b"}, views into `signature`. Nothing when the signature
+// is not supported.
+std::optional<std::vector<std::string_view>> splitSignature(std::string_view signature);
 
 }  // namespace platform

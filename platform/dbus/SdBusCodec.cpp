@@ -54,7 +54,7 @@ bool readOne(sdbus::Message& message, std::string_view type, BusValues& out) {
       auto types = splitSignature(contents);
       if (!types) return false;
       BusValues fields;
-      for (const std::string& field : *types) {
+      for (std::string_view field : *types) {
         if (!readOne(message, field, fields)) return false;
       }
       message.exitStruct();
@@ -113,7 +113,7 @@ Result<BusValues> readValues(sdbus::Message& message, std::string_view signature
   if (!types) return fail(malformed(signature));
   BusValues values;
   try {
-    for (const std::string& type : *types) {
+    for (std::string_view type : *types) {
       if (!readOne(message, type, values)) return fail(malformed(signature));
     }
   } catch (const sdbus::Error& error) {

@@ -27,7 +27,7 @@ TEST(BusValueTest, SupportedSignatures) {
     EXPECT_FALSE(isSupportedSignature(bad)) << bad;
   EXPECT_FALSE(isSupportedSignature(std::string(40, '(') + "s" + std::string(40, ')')));
   EXPECT_FALSE(isSupportedSignature(std::string(256, 's')));
-  EXPECT_EQ(splitSignature("s(siss)b"), (std::vector<std::string>{"s", "(siss)", "b"}));
+  EXPECT_EQ(splitSignature("s(siss)b"), (std::vector<std::string_view>{"s", "(siss)", "b"}));
 }
 
 }  // namespace
