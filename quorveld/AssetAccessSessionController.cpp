@@ -110,13 +110,14 @@ std::shared_ptr<AssetAccessSession> AssetAccessSessionController::activeSessionW
   return nullptr;
 }
 
-AssetAccessSessionList AssetAccessSessionController::activeSessionsWithWithCompositionAVURL(
+const AssetAccessSessionList& AssetAccessSessionController::activeSessionsWithWithCompositionAVURL(
     const platform::URL& compositionAVURL) const {
   QV_DCHECK_CALLED_ON_VALID_SEQUENCE(_serviceSequenceChecker);
   // Every session is listed under the URL its token names, in the order of
   // the walk.
+  static const AssetAccessSessionList kNone;
   auto list = _clientSessionsByCompositionAVURL.find(compositionAVURL);
-  return list == _clientSessionsByCompositionAVURL.end() ? AssetAccessSessionList{} : list->second;
+  return list == _clientSessionsByCompositionAVURL.end() ? kNone : list->second;
 }
 
 AssetAccessSessionList AssetAccessSessionController::activeSessionsWithXPCConnection(

@@ -52,8 +52,9 @@ class AssetAccessSessionController {
   // The first session whose token equals `token`, or nullptr.
   std::shared_ptr<AssetAccessSession> activeSessionWithAccessToken(
       const RCSSavedRecordingAccessToken& token) const;
-  // The sessions whose token names `compositionAVURL`.
-  AssetAccessSessionList activeSessionsWithWithCompositionAVURL(
+  // The sessions whose token names `compositionAVURL`: the registry's own
+  // list, valid until the next open or close.
+  const AssetAccessSessionList& activeSessionsWithWithCompositionAVURL(
       const platform::URL& compositionAVURL) const;
   AssetAccessSessionList activeSessionsWithXPCConnection(
       const std::shared_ptr<platform::Connection>& xpcConnection) const;
