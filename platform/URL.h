@@ -58,9 +58,15 @@ class URL {
 
   // Copies share the strings, which never change: a request's URL is copied
   // into every step and table it passes through. Moving copies too, so a
-  // moved-from URL is still the same URL.
+  // moved-from URL is still the same URL and never an empty one.
   URL(const URL&) = default;
   URL& operator=(const URL&) = default;
+  URL(URL&& other) noexcept : storage_(other.storage_) {}
+  URL& operator=(URL&& other) noexcept {
+    storage_ = other.storage_;
+    return *this;
+  }
+  ~URL() = default;
 
  private:
   struct Storage {
