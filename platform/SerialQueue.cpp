@@ -25,6 +25,9 @@
 // waiting), then gives ownership back. The worker is woken only when someone
 // else has to go on: work left after the time budget, or a stop.
 //
+// asyncOnWorker() tasks are never adopted: an adopted run that reaches one
+// stops there and hands the queue to the worker, as after its time budget.
+//
 // Wake-ups: async() signals the worker only when the queue is not owned. An
 // owner always looks at the FIFO before it lets go (the worker's loop, a sync
 // caller's release, the end of an adopted run), so a signal to a worker that
@@ -81,6 +84,7 @@ struct SyncGate {
 struct Item {
   Task task;
   SyncGate* gate = nullptr;  // set for a sync caller waiting for its turn
+  bool workerOnly = false;   // never run by an adopting thread
 };
 
 // The calling thread's adoption scope: whether one is open, and the queues
@@ -160,18 +164,22 @@ SerialQueue::~SerialQueue() {
   state_->worker.join();
 }
 
-void SerialQueue::async(Task task) {
+void SerialQueue::async(Task task) { enqueue(std::move(task), false); }
+
+void SerialQueue::asyncOnWorker(Task task) { enqueue(std::move(task), true); }
+
+void SerialQueue::enqueue(Task task, bool workerOnly) {
   bool wake;
   {
     std::lock_guard lock(state_->mutex);
     // An owned queue is passed on by its owner, who looks at the FIFO first.
     wake = !state_->owned;
-    if (wake && tAdoption.open && state_->items.empty()) {
+    if (wake && !workerOnly && tAdoption.open && state_->items.empty()) {
       state_->owned = true;
       tAdoption.queues.push_back(this);
       wake = false;
     }
-    state_->items.push_back(Item{std::move(task), nullptr});
+    state_->items.push_back(Item{std::move(task), nullptr, workerOnly});
   }
   if (wake) state_->wake.notify_one();
 }
@@ -251,7 +259,7 @@ void SerialQueue::runAdopted(SerialQueue& queue) {
   const auto start = std::chrono::steady_clock::now();
   std::unique_lock lock(state.mutex);
   for (bool first = true;; first = false) {
-    if (state.items.empty() ||
+    if (state.items.empty() || state.items.front().workerOnly ||
         (!first && std::chrono::steady_clock::now() - start > kAdoptedRunBudget)) {
       state.owned = false;
       // Signalled with the lock held: a stopping queue may be freed as soon

@@ -27,6 +27,11 @@ class SerialQueue final : public DispatchQueue {
   SerialQueue& operator=(const SerialQueue&) = delete;
 
   void async(Task task) override;
+  // Like async(), but the task runs on the queue's own worker thread, never
+  // on a thread that adopted the queue: for work that may take long, which
+  // would hold up an adopting event loop. FIFO order with the other tasks
+  // holds; an adopted run that reaches the task hands the queue to the worker.
+  void asyncOnWorker(Task task);
   void sync(Task task) override;
   bool isCurrent() const override;
   const std::string& label() const override;
@@ -44,8 +49,9 @@ class SerialQueue final : public DispatchQueue {
   // Meant for an event loop around each delivery: the work a delivered
   // message queues then runs right after it on the loop's thread, which
   // keeps the loop from reading the next message meanwhile, so only loops
-  // whose queued work is short should use it. Scopes do not nest; create it
-  // on the stack, outside every task.
+  // whose queued work is short should use it (queue long work with
+  // asyncOnWorker()). Scopes do not nest; create it on the stack, outside
+  // every task.
   class AdoptionScope {
    public:
     AdoptionScope();
@@ -57,6 +63,7 @@ class SerialQueue final : public DispatchQueue {
 
  private:
   struct State;
+  void enqueue(Task task, bool workerOnly);
   // Runs an adopted queue's tasks on the calling thread (see AdoptionScope).
   static void runAdopted(SerialQueue& queue);
   std::unique_ptr<State> state_;

@@ -52,15 +52,20 @@ void SavedRecordingService::listenerDidLoseBus(platform::Listener&) {
   QV_LOG(platform::kLogLevelError, "Lost the connection to the bus");
 }
 
-void SavedRecordingService::_performOnServiceQueue(WorkBlock block) {
+void SavedRecordingService::_performOnServiceQueue(WorkBlock block, WorkLength length) {
   auto transaction = RCSXPCTransaction::initWithName("Dispatch to service queue");
   transaction->beginTransaction();
-  _serviceSerialQueue.async([block = std::move(block), transaction]() mutable {
+  auto task = [block = std::move(block), transaction]() mutable {
     block();
     // Owns the transaction until the end runs, one second after the block.
     platform::mainQueue().after(kDispatchTransactionLinger,
                                 [transaction] { transaction->endTransaction(); });
-  });
+  };
+  if (length == WorkLength::MayTakeLong) {
+    _serviceSerialQueue.asyncOnWorker(std::move(task));
+  } else {
+    _serviceSerialQueue.async(std::move(task));
+  }
 }
 
 }  // namespace quorvel

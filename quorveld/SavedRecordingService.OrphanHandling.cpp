@@ -141,17 +141,16 @@ void SavedRecordingService::disableOrphanHandlingWithCompletionBlock(
 
 void SavedRecordingService::enableOrphanHandlingWithCompletionBlock(
     CompletionHandler completionBlock) {
-  // On a quiet daemon the bus thread runs this block itself (it runs what a
-  // call queues onto the idle service queue), so other calls are read only
-  // once the recovery run has ended. They would wait for the service queue
-  // anyway; only pings and refusals at the door are later.
+  // The recovery run can take seconds on a large directory: it runs on the
+  // service queue's own thread, so the bus keeps being read meanwhile.
   _performOnServiceQueue(
       [this, self = shared_from_this(), completion = std::move(completionBlock)]() mutable {
         _isOrphanHandlingEnabled = true;
         // Every enable runs the recovery now, even when it was already on.
         _onQueuePerformOrphanHandlingIfEnabled();
         if (completion) completion(std::nullopt);
-      });
+      },
+      WorkLength::MayTakeLong);
 }
 
 }  // namespace quorvel

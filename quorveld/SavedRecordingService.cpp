@@ -108,10 +108,12 @@ platform::Status SavedRecordingService::start() {
   auto orphanKeepAlive = RCSXPCTransaction::initWithName("Keep-alive for orphan handling");
   orphanKeepAlive->beginTransaction();
   platform::mainQueue().after(kOneSecond, [self = shared_from_this(), orphanKeepAlive] {
-    self->_performOnServiceQueue([self, orphanKeepAlive] {
-      self->_onQueuePerformOrphanHandlingIfEnabled();
-      orphanKeepAlive->endTransaction();
-    });
+    self->_performOnServiceQueue(
+        [self, orphanKeepAlive] {
+          self->_onQueuePerformOrphanHandlingIfEnabled();
+          orphanKeepAlive->endTransaction();
+        },
+        WorkLength::MayTakeLong);
   });
 
   if (_xpcListener) return {};

@@ -132,8 +132,11 @@ class SavedRecordingService final : public platform::ListenerDelegate,
 
   // Runs `block` later on the service serial queue, under the keep-alive
   // "Dispatch to service queue" that ends one second after the block ran.
-  // Returns at once. Any thread.
-  void _performOnServiceQueue(WorkBlock block);
+  // Returns at once. Any thread. Work a bus call queues may run on the bus
+  // thread right after the call; a block that may take long (an orphan
+  // recovery run) says so, and then always runs on the queue's own thread.
+  enum class WorkLength { Short, MayTakeLong };
+  void _performOnServiceQueue(WorkBlock block, WorkLength length = WorkLength::Short);
   // The connection has ended: on the service serial queue, mark it invalid
   // and release what the daemon held for it. Returns at once. Any thread.
   void _handleXPCDisconnect(const std::shared_ptr<platform::Connection>& connection);

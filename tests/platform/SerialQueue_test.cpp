@@ -226,6 +226,35 @@ TEST(SerialQueueTest, AnAdoptedRunHandsWhatIsLeftToTheWorkerAfterItsBudget) {
   EXPECT_NE(secondRanOn.get_future().get(), std::this_thread::get_id());
 }
 
+// Long work queued with asyncOnWorker() must not hold up the adopting loop:
+// the scope ends while that task still waits for the loop's thread, which
+// would deadlock if the scope ran it. Order across the hand-over holds.
+TEST(SerialQueueTest, WorkerOnlyTasksLeaveTheAdoptingThreadFreeAndKeepTheirPlace) {
+  SerialQueue queue("test.worker-only");
+  std::promise<void> scopeEnded;
+  std::shared_future<void> ended = scopeEnded.get_future().share();
+  std::vector<std::string> log;  // touched only on the queue
+  std::thread::id firstRanOn;
+  std::promise<std::thread::id> longRanOn;
+  {
+    SerialQueue::AdoptionScope adoption;
+    queue.async([&] {
+      log.push_back("short");
+      firstRanOn = std::this_thread::get_id();
+    });
+    queue.asyncOnWorker([&] {
+      ended.wait();
+      log.push_back("long");
+      longRanOn.set_value(std::this_thread::get_id());
+    });
+    queue.async([&] { log.push_back("after"); });
+  }
+  scopeEnded.set_value();
+  EXPECT_EQ(firstRanOn, std::this_thread::get_id());
+  EXPECT_NE(longRanOn.get_future().get(), std::this_thread::get_id());
+  queue.sync([&] { EXPECT_EQ(log, (std::vector<std::string>{"short", "long", "after"})); });
+}
+
 TEST(GlobalQueueTest, RunsTasksConcurrentlyOnAtLeastTwoThreads) {
   // Two tasks that each wait for the other can only finish when they run at
   // the same time.
