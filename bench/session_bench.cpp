@@ -13,7 +13,10 @@
 //      its own, so that nothing the earlier parts allocated hides growth.
 // Also prints the CPU time per ping and per grant (prepare + end) of the
 // daemon, the bus and the clients, which machine load does not skew the way
-// it skews rates.
+// it skews rates, and, as a floor for part 2, the grant rate of a bare
+// listener on the daemon's transport that answers the same two calls at once
+// with no session behind them: what the bus, the clients and the transport
+// cost a grant by themselves.
 //
 // Usage: session_bench [N]   (prepares per path in part 1; default 5000)
 #include <sdbus-c++/sdbus-c++.h>
@@ -33,7 +36,9 @@
 #include "Quorvel/composition/RCCompositionEditor.h"
 #include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
+#include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "bench/BenchDaemon.h"
+#include "platform/dbus/BusListener.h"
 #include "tests/support/TestBus.h"
 
 namespace {
@@ -79,6 +84,63 @@ bool waitUntilIdle(sdbus::IProxy& proxy) {
   }
   std::this_thread::sleep_for(std::chrono::milliseconds(2500));
   return true;
+}
+
+// The bare listener of the floor: the daemon's transport and the daemon's
+// signatures, and for each PrepareToPreview a fresh token, made and sent on
+// the bus thread; EndAccessSession reads its token and does nothing else.
+constexpr const char* kBareService = "org.quorvel.bench.BareSessions";
+
+class AcceptAll : public platform::ListenerDelegate {
+ public:
+  bool shouldAcceptNewConnection(platform::Listener&,
+                                 std::shared_ptr<platform::Connection> connection) override {
+    connection->setValid(true);
+    connection->resume();
+    return true;
+  }
+};
+
+std::unique_ptr<platform::BusListener> startBareListener(const std::string& address,
+                                                         platform::ListenerDelegate& delegate) {
+  platform::InterfaceDescription interface {
+    kInterface, {}, {}, {}
+  };
+  interface.methods.push_back(
+      {"PrepareToPreview",
+       "s",
+       {"compositionAVURL"},
+       "(siss)",
+       {"accessToken"},
+       false,
+       [](platform::IncomingCall call) {
+         auto url = platform::URL::fromFileURLStringOrPath(call.arguments().at(0).asString());
+         if (!url) return call.replyError("org.quorvel.bench.Error", "not a file URL");
+         auto [name, type, text, identifier] =
+             quorvel::RCSSavedRecordingAccessToken::tokenWithName("preview", 0, *url).toTuple();
+         call.reply({platform::BusValue::structure({name, type, text, identifier})});
+       }});
+  interface.methods.push_back({"EndAccessSession",
+                               "(siss)",
+                               {"accessToken"},
+                               "",
+                               {},
+                               true,
+                               [](platform::IncomingCall call) {
+                                 const auto& fields = call.arguments().at(0).fields();
+                                 (void)quorvel::RCSSavedRecordingAccessToken::fromTuple(
+                                     {fields.at(0).asString(), fields.at(1).asInt32(),
+                                      fields.at(2).asString(), fields.at(3).asString()});
+                               }});
+  auto listener = std::make_unique<platform::BusListener>(
+      platform::BusListenerOptions{address, kBareService, kPath}, interface);
+  listener->setDelegate(&delegate);
+  if (auto started = listener->resume(); !started) {
+    std::fprintf(stderr, "cannot start the bare listener: %s\n",
+                 started.error().description().c_str());
+    return nullptr;
+  }
+  return listener;
 }
 
 double micros(Clock::duration duration) {
@@ -156,25 +218,30 @@ int main(int argc, char** argv) {
   constexpr int kClients = 8;
   constexpr int kRounds = 8;
   constexpr auto kWindow = std::chrono::milliseconds(500);
+  AcceptAll acceptAll;
+  auto bare = startBareListener(bus.address(), acceptAll);
+  if (!bare) return 1;
   std::vector<std::unique_ptr<sdbus::IConnection>> connections;
-  std::vector<std::unique_ptr<sdbus::IProxy>> proxies;
+  std::vector<std::unique_ptr<sdbus::IProxy>> proxies, bareProxies;
   for (int c = 0; c < kClients; ++c) {
     connections.push_back(sdbus::createSessionBusConnectionWithAddress(bus.address()));
     proxies.push_back(sdbus::createProxy(*connections.back(), kService, kPath));
+    bareProxies.push_back(sdbus::createProxy(*connections.back(), kBareService, kPath));
   }
-  auto rate = [&](bool sessions) {
+  enum class Calls { Pings, Grants, BareGrants };
+  auto rate = [&](Calls calls) {
     std::atomic<long> done{0};
     std::vector<std::thread> threads;
     for (int c = 0; c < kClients; ++c) {
       threads.emplace_back([&, c] {
-        sdbus::IProxy& own = *proxies[c];
+        sdbus::IProxy& own = calls == Calls::BareGrants ? *bareProxies[c] : *proxies[c];
         auto until = Clock::now() + kWindow;
         long count = 0;
         while (Clock::now() < until) {
-          if (sessions) {
-            end(own, prepare(own, url));
-          } else {
+          if (calls == Calls::Pings) {
             ping(own);
+          } else {
+            end(own, prepare(own, url));
           }
           ++count;
         }
@@ -189,16 +256,20 @@ int main(int argc, char** argv) {
                       quorvel::bench::cpuMicroseconds(bus.pid()),
                       quorvel::bench::cpuMicroseconds(getpid())};
   };
-  rate(false);  // every connection has said hello and been seen by the daemon
-  double pingCount = 0, grantCount = 0;
+  // Every connection has said hello and been seen by the daemon and the
+  // bare listener.
+  rate(Calls::Pings);
+  rate(Calls::BareGrants);
+  double pingCount = 0, grantCount = 0, bareCount = 0;
   std::array<double, 3> pingCpu{}, grantCpu{};
   std::vector<double> ratios;
   for (int round = 0; round < kRounds; ++round) {
     auto before = cpu();
-    double roundPings = rate(false);
+    double roundPings = rate(Calls::Pings);
     auto between = cpu();
-    double roundGrants = rate(true);
+    double roundGrants = rate(Calls::Grants);
     auto after = cpu();
+    bareCount += rate(Calls::BareGrants);
     for (std::size_t i = 0; i < 3; ++i) {
       pingCpu[i] += between[i] - before[i];
       grantCpu[i] += after[i] - between[i];
@@ -214,13 +285,19 @@ int main(int argc, char** argv) {
       grantCount / seconds, pingCount / seconds, grantCount / pingCount,
       *std::min_element(ratios.begin(), ratios.end()),
       *std::max_element(ratios.begin(), ratios.end()));
+  std::printf(
+      "floor: the same calls answered at once by a bare listener on the same transport: %.0f "
+      "grants/s, ratio %.2f to pings; the daemon reaches %.2f of it\n",
+      bareCount / seconds, bareCount / pingCount, grantCount / bareCount);
   const char* names[] = {"quorveld", "dbus-daemon", "clients"};
   for (std::size_t i = 0; i < 3; ++i) {
     std::printf("%s CPU time: %.1f us per ping, %.1f us per grant\n", names[i],
                 pingCpu[i] / pingCount, grantCpu[i] / grantCount);
   }
   proxies.clear();
+  bareProxies.clear();
   connections.clear();
+  bare.reset();
 
   // 3. Memory with 1,000 open sessions, on a fresh daemon.
   daemon.reset();
