@@ -37,6 +37,7 @@
 #include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
+#include "bench/AcceptAll.h"
 #include "bench/BenchDaemon.h"
 #include "platform/dbus/BusListener.h"
 #include "tests/support/TestBus.h"
@@ -90,16 +91,6 @@ bool waitUntilIdle(sdbus::IProxy& proxy) {
 // signatures, and for each PrepareToPreview a fresh token, made and sent on
 // the bus thread; EndAccessSession reads its token and does nothing else.
 constexpr const char* kBareService = "org.quorvel.bench.BareSessions";
-
-class AcceptAll : public platform::ListenerDelegate {
- public:
-  bool shouldAcceptNewConnection(platform::Listener&,
-                                 std::shared_ptr<platform::Connection> connection) override {
-    connection->setValid(true);
-    connection->resume();
-    return true;
-  }
-};
 
 std::unique_ptr<platform::BusListener> startBareListener(const std::string& address,
                                                          platform::ListenerDelegate& delegate) {
@@ -222,7 +213,7 @@ int main(int argc, char** argv) {
   constexpr int kClients = 8;
   constexpr int kRounds = 8;
   constexpr auto kWindow = std::chrono::milliseconds(500);
-  AcceptAll acceptAll;
+  quorvel::bench::AcceptAll acceptAll;
   auto bare = startBareListener(bus.address(), acceptAll);
   if (!bare) return 1;
   std::vector<std::unique_ptr<sdbus::IConnection>> connections;

@@ -15,6 +15,7 @@
 #include <cstdlib>
 #include <string>
 
+#include "bench/AcceptAll.h"
 #include "platform/dbus/BusListener.h"
 // The test suite's private bus.
 #include "tests/support/TestBus.h"
@@ -24,16 +25,6 @@ namespace {
 constexpr const char* kName = "org.quorvel.bench.Transport";
 constexpr const char* kPath = "/org/quorvel/bench/Transport";
 constexpr const char* kInterface = "org.quorvel.bench.Transport1";
-
-class AcceptAll : public platform::ListenerDelegate {
- public:
-  bool shouldAcceptNewConnection(platform::Listener&,
-                                 std::shared_ptr<platform::Connection> connection) override {
-    connection->setValid(true);
-    connection->resume();
-    return true;
-  }
-};
 
 using Clock = std::chrono::steady_clock;
 
@@ -60,7 +51,7 @@ int main(int argc, char** argv) {
   };
   interface.methods.push_back(
       {"Nop", "", {}, "", {}, false, [](platform::IncomingCall call) { call.reply(); }});
-  AcceptAll delegate;
+  quorvel::bench::AcceptAll delegate;
   platform::BusListener listener({bus.address(), kName, kPath}, interface);
   listener.setDelegate(&delegate);
   if (auto started = listener.resume(); !started) {
