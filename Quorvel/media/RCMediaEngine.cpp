@@ -46,6 +46,14 @@ Current& current() {
 
 }  // namespace
 
+std::vector<platform::Result<RCMediaProbe>> RCMediaEngine::probeMany(
+    const std::vector<platform::URL>& urls) {
+  std::vector<platform::Result<RCMediaProbe>> probes;
+  probes.reserve(urls.size());
+  for (const platform::URL& url : urls) probes.push_back(probe(url));
+  return probes;
+}
+
 std::shared_ptr<RCMediaEngine> RCMediaEngine::current() {
   Current& state = quorvel::current();
   std::lock_guard lock(state.mutex);

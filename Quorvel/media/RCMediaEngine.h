@@ -60,6 +60,12 @@ class RCMediaEngine {
   // media file); a media file without audio is a probe that is not playable.
   virtual platform::Result<RCMediaProbe> probe(const platform::URL& url) = 0;
 
+  // Probes every file of `urls`, one result per file in the same order, as
+  // probe() would. Callers with many files use it so an engine can answer
+  // them in one round trip; the default probes them one by one.
+  virtual std::vector<platform::Result<RCMediaProbe>> probeMany(
+      const std::vector<platform::URL>& urls);
+
   // Concatenates the segments' used ranges, in order, into `destination`
   // (replaced atomically), and writes the composed waveform to
   // `waveformDestination` when given.
