@@ -98,6 +98,13 @@ std::shared_ptr<RCComposition> RCComposition::compositionLoadedFromCompositionBu
     const platform::URL& bundleURL) {
   auto loaded = load(bundleURL);
   if (loaded) return *loaded;
+  // A recording without a bundle (made from a file, or never captured into)
+  // simply has no composition; only a bundle that is there and fails to load
+  // is worth a line.
+  struct stat info {};
+  if (::lstat(bundleURL.URLByStandardizingPath().path().c_str(), &info) != 0 && errno == ENOENT) {
+    return nullptr;
+  }
   QV_LOG(platform::kLogLevelError, "ERROR: cannot load the composition '{}': {}",
          bundleURL.lastPathComponent(), loaded.error().localizedDescription());
   return nullptr;

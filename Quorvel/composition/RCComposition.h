@@ -32,8 +32,9 @@ class RCComposition {
   static constexpr const char* kBundleExtension = "composition";
 
   // The composition stored in `bundleURL`, a bundle directly inside the
-  // saved-recordings directory; nullptr (with the reason logged at level 4)
-  // when it cannot be loaded. Reads the file system.
+  // saved-recordings directory; nullptr when there is no such bundle, or
+  // (with the reason logged at level 4) when it is there and cannot be
+  // loaded. Reads the file system.
   static std::shared_ptr<RCComposition> compositionLoadedFromCompositionBundleURL(
       const platform::URL& bundleURL);
   // The same, reporting the reason instead of logging it.

@@ -31,9 +31,11 @@
 
 #include <cerrno>
 #include <cmath>
+#include <condition_variable>
 #include <cstdint>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <unordered_map>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
@@ -104,21 +106,112 @@ DurationCache& durationCache() {
   return *cache;
 }
 
+std::optional<DurationCache::Identity> identityOf(const platform::URL& url) {
+  struct stat info {};
+  if (::stat(url.path().c_str(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
+  return DurationCache::Identity{
+      info.st_dev, info.st_ino, info.st_size,
+      std::int64_t{info.st_mtim.tv_sec} * 1'000'000'000 + info.st_mtim.tv_nsec};
+}
+
+// The file's duration when it was read before and the file has not changed.
+std::optional<double> cachedFileDuration(const platform::URL& url) {
+  auto identity = identityOf(url);
+  return identity ? durationCache().find(url.path(), *identity) : std::nullopt;
+}
+
+void rememberDuration(const platform::URL& url, const platform::Result<RCMediaProbe>& probe) {
+  // Only what was read is kept: a failure may be passing (a worker that died).
+  if (!probe || !probe->playable || !std::isfinite(probe->duration)) return;
+  if (auto identity = identityOf(url))
+    durationCache().insert(url.path(), *identity, probe->duration);
+}
+
+double durationOf(const platform::Result<RCMediaProbe>& probe) {
+  return probe && probe->playable ? probe->duration : std::nan("");
+}
+
 // The file's duration in seconds; NaN when it cannot be read.
 double fileDuration(const platform::URL& url) {
-  struct stat info {};
-  std::optional<DurationCache::Identity> identity;
-  if (::stat(url.path().c_str(), &info) == 0 && S_ISREG(info.st_mode)) {
-    identity = DurationCache::Identity{
-        info.st_dev, info.st_ino, info.st_size,
-        std::int64_t{info.st_mtim.tv_sec} * 1'000'000'000 + info.st_mtim.tv_nsec};
-    if (auto known = durationCache().find(url.path(), *identity)) return *known;
+  if (auto known = cachedFileDuration(url)) return *known;
+  auto probe = RCMediaEngine::current()->probe(url);
+  rememberDuration(url, probe);
+  return durationOf(probe);
+}
+
+// The durations of the files not read before, by path, read in one batch so
+// a recording of many fragments costs one round trip to the media worker.
+std::unordered_map<std::string, double> readDurations(const std::vector<platform::URL>& files) {
+  std::vector<platform::URL> unknown;
+  for (const platform::URL& url : files) {
+    // Gone or empty files are dropped by the repair without being read.
+    if (fileState(url) == FileState::Present && !cachedFileDuration(url)) unknown.push_back(url);
   }
-  auto asset = RCAudioAsset::assetWithURL(url);
-  double duration = asset ? asset->duration() : std::nan("");
-  // Only what was read is kept: a failure may be passing (a worker that died).
-  if (identity && std::isfinite(duration)) durationCache().insert(url.path(), *identity, duration);
-  return duration;
+  std::unordered_map<std::string, double> read;
+  if (unknown.empty()) return read;
+  auto probes = RCMediaEngine::current()->probeMany(unknown);
+  for (std::size_t i = 0; i < unknown.size() && i < probes.size(); ++i) {
+    rememberDuration(unknown[i], probes[i]);
+    read.emplace(unknown[i].path(), durationOf(probes[i]));
+  }
+  return read;
+}
+
+// Composing is serialized per bundle, by the bundle directory's identity
+// (device and inode) rather than its URL, which has many spellings.
+class BundleLocks {
+ public:
+  struct Key {
+    dev_t device;
+    ino_t inode;
+    auto operator<=>(const Key&) const = default;
+  };
+  // Held while one compose of the bundle runs; waited() tells whether
+  // another compose of it ran first.
+  class Lock {
+   public:
+    Lock(BundleLocks& table, Key key, bool waited) : table_(table), key_(key), waited_(waited) {}
+    ~Lock() { table_.release(key_); }
+    Lock(const Lock&) = delete;
+    Lock& operator=(const Lock&) = delete;
+    bool waited() const { return waited_; }
+
+   private:
+    BundleLocks& table_;
+    Key key_;
+    bool waited_;
+  };
+
+  std::unique_ptr<Lock> acquire(Key key) {
+    std::unique_lock lock(mutex_);
+    bool waited = false;
+    while (busy_.contains(key)) {
+      waited = true;
+      released_.wait(lock);
+    }
+    busy_.insert(key);
+    return std::make_unique<Lock>(*this, key, waited);
+  }
+
+ private:
+  void release(Key key) {
+    std::lock_guard lock(mutex_);
+    busy_.erase(key);
+    released_.notify_all();
+  }
+
+  std::mutex mutex_;
+  std::condition_variable released_;
+  std::set<Key> busy_;
+};
+
+platform::Result<std::unique_ptr<BundleLocks::Lock>> lockBundle(const platform::URL& bundle) {
+  static BundleLocks* locks = new BundleLocks();  // used until the process ends
+  struct stat info {};
+  if (::stat(bundle.path().c_str(), &info) != 0) {
+    return platform::fail(platform::posixError(errno, "the bundle"));
+  }
+  return locks->acquire({info.st_dev, info.st_ino});
 }
 
 // Removes temporary files an interrupted replacement of `destination` left.
@@ -163,7 +256,9 @@ void recordComposedDuration(const RCComposition& composition) {
   }
 }
 
-RCCompositionManifest repairedManifest(const RCComposition& composition) {
+// `duration` gives a file's duration in seconds, NaN when it cannot be read.
+template <typename Duration>
+RCCompositionManifest repairedManifest(const RCComposition& composition, Duration&& duration) {
   RCCompositionManifest manifest = composition.manifest();
   std::vector<RCCompositionManifestFragment> kept;
   bool lostComposedAudio = false;
@@ -177,9 +272,9 @@ RCCompositionManifest repairedManifest(const RCComposition& composition) {
       lostComposedAudio = lostComposedAudio || entry.composed;
       continue;
     }
-    double duration = fileDuration(url);
-    if (std::isfinite(duration)) {
-      double available = std::max(0.0, duration - entry.contentStart);
+    double seconds = duration(url);
+    if (std::isfinite(seconds)) {
+      double available = std::max(0.0, seconds - entry.contentStart);
       if (!entry.contentDuration || *entry.contentDuration > available + kDurationTolerance) {
         entry.contentDuration = available;
         entry.composed = false;
@@ -201,8 +296,8 @@ RCCompositionManifest repairedManifest(const RCComposition& composition) {
     platform::URL composed = composition.composedAVURL();
     if (fileState(composed) == FileState::Missing) {
       manifest.composedDuration = 0;
-    } else if (double duration = fileDuration(composed); std::isfinite(duration)) {
-      manifest.composedDuration = duration;
+    } else if (double seconds = duration(composed); std::isfinite(seconds)) {
+      manifest.composedDuration = seconds;
     }
   }
   return manifest;
@@ -250,7 +345,15 @@ std::shared_ptr<RCComposition> RCCompositionController::composition() const {
 void RCCompositionController::rcs_repairDecomposedFragmentMetadataIfNecessary() {
   std::shared_ptr<RCComposition> current = composition();
   if (!current) return;
-  RCCompositionManifest repaired = repairedManifest(*current);
+  std::vector<platform::URL> files;
+  for (const auto& entry : current->manifest().fragments) {
+    files.push_back(current->URLForFragmentFile(entry.file));
+  }
+  const auto read = readDurations(files);
+  RCCompositionManifest repaired = repairedManifest(*current, [&](const platform::URL& url) {
+    auto found = read.find(url.path());
+    return found != read.end() ? found->second : fileDuration(url);
+  });
   if (repaired == current->manifest()) return;
   auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(repaired));
   if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) {
@@ -264,6 +367,22 @@ void RCCompositionController::rcs_repairDecomposedFragmentMetadataIfNecessary() 
   if (state_->composition == current) state_->composition = std::move(replacement);
 }
 
+bool RCCompositionController::hasNothingToRepairOrCleanUp() const {
+  std::shared_ptr<RCComposition> current = composition();
+  if (!current) return false;
+  bool known = true;
+  RCCompositionManifest repaired = repairedManifest(*current, [&](const platform::URL& url) {
+    std::optional<double> seconds = cachedFileDuration(url);
+    known = known && seconds.has_value();
+    return seconds.value_or(std::nan(""));
+  });
+  if (!known || repaired != current->manifest()) return false;
+  bool orphans = false;
+  current->enumerateOrphanedFragmentsWithBlock(
+      [&](const RCCompositionFragment&, bool& stop) { orphans = stop = true; });
+  return !orphans;
+}
+
 platform::Status RCCompositionController::composeNow(bool deleteFragments, bool composeWaveform) {
   std::shared_ptr<RCComposition> current = composition();
   if (!current) {
@@ -271,6 +390,23 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
         RCError(RCErrorCodeInvalidManifest, "there is no composition to compose"));
   }
   if (current->decomposedFragments().empty()) return {};
+
+  // One bundle is composed by one job at a time, whatever URL spelling or
+  // controller asked: two composes of the same files would each take the
+  // other's temporary file for a leftover. The one that waited works from
+  // the manifest as the first left it, usually with nothing left to do.
+  auto bundleLock = lockBundle(current->bundleURL());
+  if (!bundleLock) return platform::fail(bundleLock.error());
+  if ((*bundleLock)->waited()) {
+    auto onDisk = RCComposition::load(current->bundleURL());
+    if (!onDisk) return platform::fail(onDisk.error());
+    current = *onDisk;
+    {
+      std::lock_guard lock(state_->mutex);
+      state_->composition = current;
+    }
+    if (current->decomposedFragments().empty()) return {};
+  }
 
   RCCompositionManifest manifest = current->manifest();
   std::vector<RCComposerSegment> segments;

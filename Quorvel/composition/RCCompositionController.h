@@ -45,8 +45,16 @@ class RCCompositionController {
   // the file's end; one longer than its file is cut to it); the fragments are
   // laid end to end and the composed duration recomputed. A fragment whose
   // file exists but cannot be read stays, so composing it fails instead of
-  // silently dropping audio. Blocks on the file system.
+  // silently dropping audio. Blocks on the file system, and reads the
+  // durations it does not know yet in one media job.
   void rcs_repairDecomposedFragmentMetadataIfNecessary();
+
+  // True when the repair above would change nothing and no orphaned
+  // fragment lies in the bundle, told from durations already read: never
+  // starts a media job and writes nothing, so it may run where blocking is
+  // not allowed. False when the composition did not load, or when telling
+  // would need a file's audio read.
+  bool hasNothingToRepairOrCleanUp() const;
 
   // Composes every fragment's used range, in order, into the composed audio
   // file (and, with composeWaveform, its waveform file beside it), on the
@@ -62,6 +70,9 @@ class RCCompositionController {
       CompletionBlock completionBlock);
 
   // The composing itself, on the calling thread (blocks for the whole job).
+  // Composes of one bundle run one at a time, however its URL is spelled:
+  // a compose that waited for another starts from the manifest that one
+  // left, and finds nothing to do when it composed everything.
   platform::Status composeNow(bool deleteFragments, bool composeWaveform);
 
  private:
