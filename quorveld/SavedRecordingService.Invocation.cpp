@@ -38,11 +38,10 @@ std::optional<platform::URL> urlArgument(const platform::IncomingCall& call) {
   return platform::URL::fromFileURLStringOrPath(call.arguments().at(0).asString());
 }
 
-std::optional<RCSSavedRecordingAccessToken> tokenArgument(const platform::IncomingCall& call) {
+RCSSavedRecordingAccessToken::Tuple tokenArgument(const platform::IncomingCall& call) {
   const auto& fields = call.arguments().at(0).fields();
-  return RCSSavedRecordingAccessToken::fromTuple({fields.at(0).asString(), fields.at(1).asInt32(),
-                                                  fields.at(2).asString(),
-                                                  fields.at(3).asString()});
+  return {fields.at(0).asString(), fields.at(1).asInt32(), fields.at(2).asString(),
+          fields.at(3).asString()};
 }
 
 platform::BusValue tokenValue(const RCSSavedRecordingAccessToken::Tuple& tuple) {
@@ -134,7 +133,18 @@ void SavedRecordingService::connectionHandleInvocation(
     auto url = urlArgument(invocation);
     prepareToTrimCompositionAVURL(std::move(url), accessRequestHandlerFor(std::move(invocation)));
   } else if (member == RCSMethodEndAccessSession) {
-    endAccessSessionWithToken(tokenArgument(invocation));
+    // "No token" is a missing token; a tuple that names no possible token
+    // (an identifier that is not a UUID) is an unknown one, like a token
+    // whose session has ended.
+    auto tuple = tokenArgument(invocation);
+    if (tuple == RCSSavedRecordingAccessToken::noTokenTuple()) {
+      endAccessSessionWithToken(std::nullopt);
+    } else if (auto token = RCSSavedRecordingAccessToken::fromTuple(tuple)) {
+      endAccessSessionWithToken(std::move(token));
+    } else {
+      QV_LOG(platform::kLogLevelDebug, "Ending access session: {}.",
+             RCSSavedRecordingAccessToken::debugDescriptionOfTuple(tuple));
+    }
   } else if (member == RCSMethodDisableOrphanedFragmentCleanup) {
     auto url = urlArgument(invocation);
     disableOrphanedFragmentCleanupForCompositionAVURL(std::move(url),

@@ -37,15 +37,30 @@ RCSSavedRecordingAccessToken::Tuple RCSSavedRecordingAccessToken::toTuple() cons
                identifier_.string()};
 }
 
-std::string RCSSavedRecordingAccessToken::debugDescription() const {
-  const char* kind = accessType_ == RCSSavedRecordingAccessTypeShared      ? " (shared)"
-                     : accessType_ == RCSSavedRecordingAccessTypeExclusive ? " (exclusive)"
-                                                                           : "";
+namespace {
+
+std::string describe(std::string_view name, std::int32_t type, std::string_view url,
+                     std::string_view identifier) {
+  const char* kind = type == RCSSavedRecordingAccessTypeShared      ? " (shared)"
+                     : type == RCSSavedRecordingAccessTypeExclusive ? " (exclusive)"
+                                                                    : "";
   return fmt::format(
       "<RCSSavedRecordingAccessToken name={} type={}{} compositionAVURL={} "
       "identifier={}>",
-      accessName_, accessType_, kind,
-      compositionAVURL_ ? compositionAVURL_->absoluteString() : "(null)", identifier_.string());
+      name, type, kind, url, identifier);
+}
+
+}  // namespace
+
+std::string RCSSavedRecordingAccessToken::debugDescription() const {
+  return describe(accessName_, accessType_,
+                  compositionAVURL_ ? compositionAVURL_->absoluteString() : "(null)",
+                  identifier_.string());
+}
+
+std::string RCSSavedRecordingAccessToken::debugDescriptionOfTuple(const Tuple& tuple) {
+  const auto& [name, type, url, identifier] = tuple;
+  return describe(name, type, url.empty() ? "(null)" : url, identifier);
 }
 
 }  // namespace quorvel

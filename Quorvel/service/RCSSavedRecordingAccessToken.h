@@ -54,6 +54,9 @@ class RCSSavedRecordingAccessToken {
   // "<RCSSavedRecordingAccessToken name=capture type=2 (exclusive) compositionAVURL=file:///…
   // identifier=E621E1F8-…>"
   std::string debugDescription() const;
+  // The same for a tuple that may name no token at all (an identifier that
+  // is not a UUID, say), as a client sent it.
+  static std::string debugDescriptionOfTuple(const Tuple& tuple);
 
   friend bool operator==(const RCSSavedRecordingAccessToken&,
                          const RCSSavedRecordingAccessToken&) = default;
