@@ -61,10 +61,10 @@ void SavedRecordingService::_performOnServiceQueue(WorkBlock block, WorkLength l
     platform::mainQueue().after(kDispatchTransactionLinger,
                                 [transaction] { transaction->endTransaction(); });
   };
-  if (length == WorkLength::MayTakeLong) {
-    _serviceSerialQueue.asyncOnWorker(std::move(task));
-  } else {
+  if (length == WorkLength::Short) {
     _serviceSerialQueue.async(std::move(task));
+  } else {
+    _serviceSerialQueue.asyncOnWorker(std::move(task));
   }
 }
 

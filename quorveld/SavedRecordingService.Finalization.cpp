@@ -49,7 +49,7 @@ void SavedRecordingService::_attemptFinalizationOfCompositionAVURL(
           if (completion) completion(success);
           _postExportingCompositionAVURLsChanged();
         });
-  });
+  });  // may block: it reads the manifest and enters the export controller
 }
 
 void SavedRecordingService::_attemptToRunDeferredFinalizationOfCompositionAVURL(
@@ -61,23 +61,26 @@ void SavedRecordingService::_attemptToRunDeferredFinalizationOfCompositionAVURL(
                          "_attemptToRunDeferredFinalizationOfCompositionAVURL:");
     return;
   }
-  _performOnServiceQueue([this, self = shared_from_this(), url = std::move(*compositionAVURL)] {
-    _onServiceQueueOpenAccessSessionNamed(
-        kFinalizeSessionName, url, /*exclusive=*/false, /*xpcConnection=*/nullptr,
-        [this, self, url](std::shared_ptr<AssetAccessSession> session,
-                          std::optional<platform::Error> /*error*/) {
-          if (!session) {
-            // Waits for a later close of a session on the recording.
-            _compositionAVURLsToFinalize.push_back(url);
-            return;
-          }
-          _attemptFinalizationOfCompositionAVURL(
-              url, /*cacheWaveform=*/true, session, [this, self, session](bool /*success*/) {
-                _performOnServiceQueue(
-                    [this, self, session] { _onQueueCloseAccessSession(session, true); });
-              });
-        });
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), url = std::move(*compositionAVURL)] {
+        _onServiceQueueOpenAccessSessionNamed(
+            kFinalizeSessionName, url, /*exclusive=*/false, /*xpcConnection=*/nullptr,
+            [this, self, url](std::shared_ptr<AssetAccessSession> session,
+                              std::optional<platform::Error> /*error*/) {
+              if (!session) {
+                // Waits for a later close of a session on the recording.
+                _compositionAVURLsToFinalize.push_back(url);
+                return;
+              }
+              _attemptFinalizationOfCompositionAVURL(
+                  url, /*cacheWaveform=*/true, session, [this, self, session](bool /*success*/) {
+                    _performOnServiceQueue(
+                        [this, self, session] { _onQueueCloseAccessSession(session, true); },
+                        WorkLength::Short);
+                  });
+            });
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::_onQueueScheduleFinalizationAfterEditing(
@@ -106,46 +109,50 @@ void SavedRecordingService::prepareToExportCompositionAVURL(
                             "export", compositionAVURL, accessRequestHandler)) {
     return;
   }
-  _performOnServiceQueue([this, self = shared_from_this(), url = std::move(*compositionAVURL),
-                          cacheWaveform, connection = rcs_currentConnection(),
-                          reply = std::move(accessRequestHandler)]() mutable {
-    _onServiceQueueOpenAccessSessionNamed(
-        "export", url, /*exclusive=*/false, std::move(connection),
-        [this, self, url, cacheWaveform, reply = std::move(reply)](
-            std::shared_ptr<AssetAccessSession> session,
-            std::optional<platform::Error> error) mutable {
-          if (!session) {
-            reply(std::nullopt, std::move(error));
-            return;
-          }
-          _attemptFinalizationOfCompositionAVURL(
-              url, cacheWaveform, session,
-              [this, self, session, reply = std::move(reply)](bool finalized) mutable {
-                _performOnServiceQueue(
-                    [this, self, session, finalized, reply = std::move(reply)]() mutable {
-                      if (finalized) {
-                        reply(session->accessToken(), std::nullopt);
-                        return;
-                      }
-                      _onQueueCloseAccessSession(session, true);
-                      reply(std::nullopt, std::nullopt);
-                    });
-              });
-        });
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), url = std::move(*compositionAVURL), cacheWaveform,
+       connection = rcs_currentConnection(), reply = std::move(accessRequestHandler)]() mutable {
+        _onServiceQueueOpenAccessSessionNamed(
+            "export", url, /*exclusive=*/false, std::move(connection),
+            [this, self, url, cacheWaveform, reply = std::move(reply)](
+                std::shared_ptr<AssetAccessSession> session,
+                std::optional<platform::Error> error) mutable {
+              if (!session) {
+                reply(std::nullopt, std::move(error));
+                return;
+              }
+              _attemptFinalizationOfCompositionAVURL(
+                  url, cacheWaveform, session,
+                  [this, self, session, reply = std::move(reply)](bool finalized) mutable {
+                    _performOnServiceQueue(
+                        [this, self, session, finalized, reply = std::move(reply)]() mutable {
+                          if (finalized) {
+                            reply(session->accessToken(), std::nullopt);
+                            return;
+                          }
+                          _onQueueCloseAccessSession(session, true);
+                          reply(std::nullopt, std::nullopt);
+                        },
+                        WorkLength::Short);
+                  });
+            });
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::fetchExportingCompositionAVURLs(URLSetHandler reply) {
   // Without a reply the request is ignored altogether.
   if (!reply) return;
-  _performOnServiceQueue([this, self = shared_from_this(), reply = std::move(reply)]() mutable {
-    std::set<platform::URL> snapshot;
-    _serialQueue.sync([&] {
-      snapshot.insert(_compositionAVURLsBeingExported.begin(),
-                      _compositionAVURLsBeingExported.end());
-    });
-    reply(std::move(snapshot));
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), reply = std::move(reply)]() mutable {
+        std::set<platform::URL> snapshot;
+        _serialQueue.sync([&] {
+          snapshot.insert(_compositionAVURLsBeingExported.begin(),
+                          _compositionAVURLsBeingExported.end());
+        });
+        reply(std::move(snapshot));
+      },
+      WorkLength::Short);  // the instance queue only ever runs blocks like this one
 }
 
 }  // namespace quorvel

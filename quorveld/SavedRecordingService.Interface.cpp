@@ -44,16 +44,18 @@ void SavedRecordingService::_prepareAccessSession(const char* selector, const ch
                                                   std::optional<platform::URL> compositionAVURL,
                                                   AccessRequestHandler accessRequestHandler) {
   if (!_checkPrepareRequest(selector, kind, compositionAVURL, accessRequestHandler)) return;
-  _performOnServiceQueue([this, self = shared_from_this(), sessionName, exclusive,
-                          url = std::move(*compositionAVURL), connection = rcs_currentConnection(),
-                          reply = std::move(accessRequestHandler)]() mutable {
-    _onServiceQueueOpenAccessSessionNamed(
-        sessionName, url, exclusive, std::move(connection),
-        [reply = std::move(reply)](std::shared_ptr<AssetAccessSession> session,
-                                   std::optional<platform::Error> error) mutable {
-          reply(session ? std::optional(session->accessToken()) : std::nullopt, std::move(error));
-        });
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), sessionName, exclusive, url = std::move(*compositionAVURL),
+       connection = rcs_currentConnection(), reply = std::move(accessRequestHandler)]() mutable {
+        _onServiceQueueOpenAccessSessionNamed(
+            sessionName, url, exclusive, std::move(connection),
+            [reply = std::move(reply)](std::shared_ptr<AssetAccessSession> session,
+                                       std::optional<platform::Error> error) mutable {
+              reply(session ? std::optional(session->accessToken()) : std::nullopt,
+                    std::move(error));
+            });
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::prepareToCaptureToCompositionAVURL(
@@ -86,9 +88,12 @@ void SavedRecordingService::endAccessSessionWithToken(
     return;
   }
   // Any holder of an equal token ends the session: tokens are capabilities.
-  _performOnServiceQueue([this, self = shared_from_this(), token = std::move(*accessToken)] {
-    _onQueueCloseAccessSession(_assetSesionController->activeSessionWithAccessToken(token), true);
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), token = std::move(*accessToken)] {
+        _onQueueCloseAccessSession(_assetSesionController->activeSessionWithAccessToken(token),
+                                   true);
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::disableOrphanedFragmentCleanupForCompositionAVURL(

@@ -10,6 +10,15 @@
 // the service serial queue, queued behind the closes of the client's
 // sessions, whose cleanups therefore still see the holds. Files go only
 // through the framework's confined removal.
+//
+// The decision is the service queue's; the work is not. Repairing a
+// recording may read every fragment's audio in the media worker and saves
+// the manifest with an fsync, so a cleanup with something to do runs on an
+// operation queue of its own, and the service queue answers everyone else
+// meanwhile. Cleanups of one recording (by bundle path) run one at a time;
+// the next decides afresh once the running one is done. A hold's reply also
+// waits for a running cleanup, so a client that hears its hold stands knows
+// nothing is deleting in the bundle any more.
 #include <fmt/format.h>
 
 #include <set>
@@ -17,6 +26,7 @@
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionController.h"
 #include "platform/Log.h"
+#include "platform/OperationQueue.h"
 #include "quorveld/RCSAdditions.h"
 #include "quorveld/SavedRecordingService.h"
 
@@ -48,20 +58,36 @@ std::size_t SavedRecordingService::orphanedFragmentCleanupHoldCount(
 void SavedRecordingService::_attemptOrphanedFragmentsCleanupForCompositionAVURL(
     const platform::URL& compositionAVURL, std::shared_ptr<AssetAccessSession> ignoredAccessSession,
     WorkBlock completionBlock) {
-  _performOnServiceQueue([this, self = shared_from_this(), compositionAVURL,
-                          ignored = std::move(ignoredAccessSession),
-                          completion = std::move(completionBlock)]() mutable {
-    _onQueueCleanUpOrphanedFragments(compositionAVURL, ignored);
-    if (completion) completion();
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), compositionAVURL, ignored = std::move(ignoredAccessSession),
+       completion = std::move(completionBlock)]() mutable {
+        _onQueueCleanUpOrphanedFragments(compositionAVURL, std::move(ignored),
+                                         std::move(completion));
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
-    const platform::URL& compositionAVURL, const std::shared_ptr<AssetAccessSession>& ignored) {
+    const platform::URL& compositionAVURL, std::shared_ptr<AssetAccessSession> ignored,
+    WorkBlock completion) {
   QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
+  auto finish = [&completion] {
+    if (completion) completion();
+  };
+  const std::string bundle = compositionAVURL.URLByStandardizingPath().path();
+  if (auto running = _fragmentCleanupsInProgress.find(bundle);
+      running != _fragmentCleanupsInProgress.end()) {
+    // Decided afresh once the running one has finished: holds and sessions
+    // may have changed by then.
+    running->second.waiting.push_back([this, compositionAVURL, ignored = std::move(ignored),
+                                       completion = std::move(completion)]() mutable {
+      _onQueueCleanUpOrphanedFragments(compositionAVURL, std::move(ignored), std::move(completion));
+    });
+    return;
+  }
   if (orphanedFragmentCleanupHoldCount(compositionAVURL) > 0 ||
       _onServiceQueueHasActiveSessionsForCompositionAVURL(compositionAVURL, ignored)) {
-    return;
+    return finish();
   }
   auto controller =
       RCCompositionController::compositionControllerForComposedAVURL(compositionAVURL);
@@ -70,54 +96,109 @@ void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
            "WARNING: attempt to delete orphaned fragments for {} failed because the composition "
            "failed to load",
            compositionAVURL.absoluteString());
-    return;
+    return finish();
   }
-  controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
-  auto repaired = controller->composition();
-  if (!repaired) return;
-  repaired->enumerateOrphanedFragmentsWithBlock([](const RCCompositionFragment& fragment, bool&) {
-    QV_LOG(platform::kLogLevelNotice,
-           "NOTE: cleaning (deleting) orphaned fragment '{}' no longer in use.",
-           fragment.AVOutputURL().path());
-    // What the removal refuses or fails to do is left for the next cleanup.
-    (void)fragment.deleteFromFilesystem();
+  // The common case, a recording whose fragments were read before and
+  // that has nothing to tidy, is decided here at once.
+  if (controller->hasNothingToRepairOrCleanUp()) return finish();
+
+  // Reading fragments' audio, saving the manifest and deleting files may
+  // take long: that runs off the service queue, which goes on answering.
+  // The recording's next cleanup waits for this one, and the session that
+  // asked gets its token only when it is done, so nothing can start writing
+  // into the bundle while it is tidied.
+  _fragmentCleanupsInProgress.emplace(bundle,
+                                      FragmentCleanup{.compositionAVURL = compositionAVURL});
+  auto tidy = std::make_shared<platform::BlockOperation>([controller] {
+    controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+    auto repaired = controller->composition();
+    if (!repaired) return;
+    repaired->enumerateOrphanedFragmentsWithBlock([](const RCCompositionFragment& fragment, bool&) {
+      QV_LOG(platform::kLogLevelNotice,
+             "NOTE: cleaning (deleting) orphaned fragment '{}' no longer in use.",
+             fragment.AVOutputURL().path());
+      // What the removal refuses or fails to do is left for the next
+      // cleanup.
+      (void)fragment.deleteFromFilesystem();
+    });
   });
+  // Holds the service weakly, and hands its reference on: the operation
+  // queue is the service's own, and must not be destroyed from one of its
+  // threads.
+  tidy->setCompletionBlock(
+      [weak = weak_from_this(), bundle, completion = std::move(completion)]() mutable {
+        auto self = weak.lock();
+        if (!self) return;
+        SavedRecordingService* service = self.get();
+        service->_performOnServiceQueue(
+            [self = std::move(self), bundle, completion = std::move(completion)]() mutable {
+              self->_onQueueFinishFragmentCleanup(bundle, std::move(completion));
+            },
+            WorkLength::Short);
+      });
+  _fragmentCleanupOperationQueue->addOperation(std::move(tidy));
+}
+
+void SavedRecordingService::_onQueueFinishFragmentCleanup(const std::string& bundle,
+                                                          WorkBlock completion) {
+  QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
+  if (completion) completion();
+  auto done = _fragmentCleanupsInProgress.extract(bundle);
+  if (done.empty()) return;
+  for (WorkBlock& next : done.mapped().waiting) next();
+}
+
+void SavedRecordingService::_onQueueAfterFragmentCleanupOfCompositionAVURL(
+    const platform::URL& compositionAVURL, WorkBlock block) {
+  QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
+  auto running = _fragmentCleanupsInProgress.find(compositionAVURL.URLByStandardizingPath().path());
+  if (running == _fragmentCleanupsInProgress.end()) return block();
+  running->second.waiting.push_back(std::move(block));
 }
 
 void SavedRecordingService::_addDisabledOrphanCleanupForCompositionAVURL(
     std::optional<platform::URL> compositionAVURL,
     std::shared_ptr<platform::Connection> xpcConnection, CompletionHandler completionBlock) {
-  _performOnServiceQueue([this, self = shared_from_this(), url = std::move(compositionAVURL),
-                          connection = std::move(xpcConnection),
-                          completion = std::move(completionBlock)]() mutable {
-    if (connection) {
-      HeldURLs held = heldURLs(*connection);
-      if (!held) {
-        held = std::make_shared<std::set<platform::URL>>();
-        rc_setUserInfo(*connection, held, kDisabledOrphanedFragmentCleanupAVURLsKey);
-      }
-      if (url && held->insert(*url).second) {
-        ++_disabledOrphanedFragmentCleanupByCompositionAVURL[*url];
-      }
-    }
-    if (completion) completion(std::nullopt);
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), url = std::move(compositionAVURL),
+       connection = std::move(xpcConnection), completion = std::move(completionBlock)]() mutable {
+        if (connection) {
+          HeldURLs held = heldURLs(*connection);
+          if (!held) {
+            held = std::make_shared<std::set<platform::URL>>();
+            rc_setUserInfo(*connection, held, kDisabledOrphanedFragmentCleanupAVURLsKey);
+          }
+          if (url && held->insert(*url).second) {
+            ++_disabledOrphanedFragmentCleanupByCompositionAVURL[*url];
+          }
+        }
+        if (!completion) return;
+        // A cleanup of the recording that started before the hold may still be
+        // deleting: the client hears that the hold stands only once it is done.
+        if (!url) return completion(std::nullopt);
+        _onQueueAfterFragmentCleanupOfCompositionAVURL(
+            *url, [completion = std::move(completion)]() mutable { completion(std::nullopt); });
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::_removeDisabledOrphanCleanupForCompositionAVURL(
     std::optional<platform::URL> compositionAVURL,
     std::shared_ptr<platform::Connection> xpcConnection) {
-  _performOnServiceQueue([this, self = shared_from_this(), url = std::move(compositionAVURL),
-                          connection = std::move(xpcConnection)] {
-    if (!url || !connection) return;
-    HeldURLs held = heldURLs(*connection);
-    if (!held || held->erase(*url) == 0) return;  // not held by this connection
-    auto count = _disabledOrphanedFragmentCleanupByCompositionAVURL.find(*url);
-    if (count != _disabledOrphanedFragmentCleanupByCompositionAVURL.end() && --count->second == 0) {
-      _disabledOrphanedFragmentCleanupByCompositionAVURL.erase(count);
-    }
-    _attemptOrphanedFragmentsCleanupForCompositionAVURL(*url, nullptr, nullptr);
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), url = std::move(compositionAVURL),
+       connection = std::move(xpcConnection)] {
+        if (!url || !connection) return;
+        HeldURLs held = heldURLs(*connection);
+        if (!held || held->erase(*url) == 0) return;  // not held by this connection
+        auto count = _disabledOrphanedFragmentCleanupByCompositionAVURL.find(*url);
+        if (count != _disabledOrphanedFragmentCleanupByCompositionAVURL.end() &&
+            --count->second == 0) {
+          _disabledOrphanedFragmentCleanupByCompositionAVURL.erase(count);
+        }
+        _attemptOrphanedFragmentsCleanupForCompositionAVURL(*url, nullptr, nullptr);
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::_removeDisabledOrphanCleanupAVURLsForConnection(
@@ -136,7 +217,8 @@ void SavedRecordingService::disableOrphanHandlingWithCompletionBlock(
       [this, self = shared_from_this(), completion = std::move(completionBlock)]() mutable {
         _isOrphanHandlingEnabled = false;
         if (completion) completion(std::nullopt);
-      });
+      },
+      WorkLength::Short);
 }
 
 void SavedRecordingService::enableOrphanHandlingWithCompletionBlock(
@@ -150,7 +232,7 @@ void SavedRecordingService::enableOrphanHandlingWithCompletionBlock(
         _onQueuePerformOrphanHandlingIfEnabled();
         if (completion) completion(std::nullopt);
       },
-      WorkLength::MayTakeLong);
+      WorkLength::MayBlock);
 }
 
 }  // namespace quorvel

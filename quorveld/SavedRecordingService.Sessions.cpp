@@ -47,12 +47,7 @@ void SavedRecordingService::_onServiceQueueOpenAccessSessionNamed(
     std::shared_ptr<platform::Connection> xpcConnection,
     AccessSessionHandler accessSessionHandler) {
   QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
-  if (xpcConnection && !rcs_isValid(*xpcConnection)) {
-    QV_LOG(platform::kLogLevelNotice,
-           "Not opening '{}' access session for '{}': connection {} has ended", name,
-           compositionAVURL.lastPathComponent(), xpcConnection->description());
-    return;
-  }
+  if (_onServiceQueueConnectionHasEnded(name, compositionAVURL, xpcConnection)) return;
 
   std::optional<platform::Error> error;
   auto session = _assetSesionController->openAccessSessionWithName(
@@ -103,12 +98,31 @@ void SavedRecordingService::_onServiceQueueRunDeferredAccessRequest(
                                       RCSSavedRecordingServiceErrorDeferredRequestSuperseded));
     return;
   }
-  _performOnServiceQueue([this, self = shared_from_this(), name, compositionAVURL, exclusive,
-                          xpcConnection = std::move(xpcConnection),
-                          handler = std::move(accessSessionHandler)]() mutable {
-    _onServiceQueueOpenAccessSessionNamed(name, compositionAVURL, exclusive,
-                                          std::move(xpcConnection), std::move(handler));
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), name, compositionAVURL, exclusive,
+       xpcConnection = std::move(xpcConnection),
+       handler = std::move(accessSessionHandler)]() mutable {
+        // The request left the recording's table when a session closed; a
+        // client gone since then leaves nobody to take the turn, so the work
+        // that waited behind the request gets it.
+        if (_onServiceQueueConnectionHasEnded(name, compositionAVURL, xpcConnection)) {
+          _onServiceQueueRunDeferredWorkForCompositionAVURL(compositionAVURL);
+          return;
+        }
+        _onServiceQueueOpenAccessSessionNamed(name, compositionAVURL, exclusive,
+                                              std::move(xpcConnection), std::move(handler));
+      },
+      WorkLength::Short);
+}
+
+bool SavedRecordingService::_onServiceQueueConnectionHasEnded(
+    const std::string& name, const platform::URL& compositionAVURL,
+    const std::shared_ptr<platform::Connection>& xpcConnection) {
+  if (!xpcConnection || rcs_isValid(*xpcConnection)) return false;
+  QV_LOG(platform::kLogLevelNotice,
+         "Not opening '{}' access session for '{}': connection {} has ended", name,
+         compositionAVURL.lastPathComponent(), xpcConnection->description());
+  return true;
 }
 
 bool SavedRecordingService::_onServiceQueueHasActiveExclusiveSessionForCompositionAVURL(
@@ -143,27 +157,33 @@ void SavedRecordingService::_onQueueCloseAccessSession(
   _attemptOrphanedFragmentsCleanupForCompositionAVURL(
       url, session, [this, self = shared_from_this(), session, normalTermination] {
         if (normalTermination) {
-          _performOnServiceQueue([this, self, session] {
-            QV_LOG(platform::kLogLevelNotice, "Finally closing access session: {}",
-                   session->debugDescription());
-            _onQueueFinishClosingAccessSession(session);
-            _onQueueScheduleFinalizationAfterEditing(session);
-          });
+          _performOnServiceQueue(
+              [this, self, session] {
+                QV_LOG(platform::kLogLevelNotice, "Finally closing access session: {}",
+                       session->debugDescription());
+                // An edit is finalized once: not again when the close has just
+                // started the recording's waiting finalization, nor while one
+                // still waits for a later close.
+                if (!_onQueueFinishClosingAccessSession(session)) {
+                  _onQueueScheduleFinalizationAfterEditing(session);
+                }
+              },
+              WorkLength::Short);
           return;
         }
         // The client is gone: finalize what it left, with its waveform,
         // before the session goes, whatever the outcome.
-        _attemptFinalizationOfCompositionAVURL(*session->accessToken().compositionAVURL(),
-                                               /*cacheWaveform=*/true, session,
-                                               [this, self, session](bool /*success*/) {
-                                                 _performOnServiceQueue([this, self, session] {
-                                                   _onQueueFinishClosingAccessSession(session);
-                                                 });
-                                               });
+        _attemptFinalizationOfCompositionAVURL(
+            *session->accessToken().compositionAVURL(),
+            /*cacheWaveform=*/true, session, [this, self, session](bool /*success*/) {
+              _performOnServiceQueue(
+                  [this, self, session] { _onQueueFinishClosingAccessSession(session); },
+                  WorkLength::Short);
+            });
       });
 }
 
-void SavedRecordingService::_onQueueFinishClosingAccessSession(
+bool SavedRecordingService::_onQueueFinishClosingAccessSession(
     const std::shared_ptr<AssetAccessSession>& session) {
   QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
   // One step: a session closed twice is listed twice, and the first final
@@ -171,44 +191,56 @@ void SavedRecordingService::_onQueueFinishClosingAccessSession(
   // the already ended transaction again and looks for deferred work again.
   std::erase(_closingSessions, session);
   _assetSesionController->closeSession(session);
-  _onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(session);
+  return _onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(session);
 }
 
-void SavedRecordingService::_onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(
+bool SavedRecordingService::_onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(
     const std::shared_ptr<AssetAccessSession>& session) {
   QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
   const std::optional<platform::URL>& url = session->accessToken().compositionAVURL();
-  if (!url) return;
-  auto deferred = _compositionAVURLsDeferredAccessRequestBlocksByAVURL.find(*url);
+  if (!url) return false;
+  bool started = _onServiceQueueRunDeferredWorkForCompositionAVURL(*url);
+  // Still waiting (an access request went first): no other finalization
+  // may start beside it.
+  return started || std::ranges::find(_compositionAVURLsToFinalize, *url) !=
+                        _compositionAVURLsToFinalize.end();
+}
+
+bool SavedRecordingService::_onServiceQueueRunDeferredWorkForCompositionAVURL(
+    const platform::URL& compositionAVURL) {
+  QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
+  auto deferred = _compositionAVURLsDeferredAccessRequestBlocksByAVURL.find(compositionAVURL);
   if (deferred != _compositionAVURLsDeferredAccessRequestBlocksByAVURL.end()) {
     auto run = std::move(deferred->second.run);
     _compositionAVURLsDeferredAccessRequestBlocksByAVURL.erase(deferred);
     run(false);
-    return;
+    return false;
   }
   // A waiting finalization goes after a waiting access request, and waits
   // for the next close when there was one.
-  if (std::erase(_compositionAVURLsToFinalize, *url) > 0) {
-    _attemptToRunDeferredFinalizationOfCompositionAVURL(*url);
-  }
+  if (std::erase(_compositionAVURLsToFinalize, compositionAVURL) == 0) return false;
+  _attemptToRunDeferredFinalizationOfCompositionAVURL(compositionAVURL);
+  return true;
 }
 
 void SavedRecordingService::_handleXPCDisconnect(
     const std::shared_ptr<platform::Connection>& connection) {
-  _performOnServiceQueue([this, self = shared_from_this(), connection] {
-    rcs_setValid(*connection, false);
-    // Its waiting request goes unanswered: there is nobody left to answer.
-    std::erase_if(_compositionAVURLsDeferredAccessRequestBlocksByAVURL,
-                  [&](const auto& entry) { return entry.second.connection == connection; });
-    for (const auto& session :
-         _assetSesionController->activeSessionsWithXPCConnection(connection)) {
-      QV_LOG(platform::kLogLevelNotice,
-             "Terminating access session {} for terminated connection: {}",
-             session->debugDescription(), describe(connection));
-      _onQueueCloseAccessSession(session, false);
-    }
-    _removeDisabledOrphanCleanupAVURLsForConnection(connection);
-  });
+  _performOnServiceQueue(
+      [this, self = shared_from_this(), connection] {
+        rcs_setValid(*connection, false);
+        // Its waiting request goes unanswered: there is nobody left to answer.
+        std::erase_if(_compositionAVURLsDeferredAccessRequestBlocksByAVURL,
+                      [&](const auto& entry) { return entry.second.connection == connection; });
+        for (const auto& session :
+             _assetSesionController->activeSessionsWithXPCConnection(connection)) {
+          QV_LOG(platform::kLogLevelNotice,
+                 "Terminating access session {} for terminated connection: {}",
+                 session->debugDescription(), describe(connection));
+          _onQueueCloseAccessSession(session, false);
+        }
+        _removeDisabledOrphanCleanupAVURLsForConnection(connection);
+      },
+      WorkLength::Short);
 }
 
 std::vector<platform::URL>
@@ -225,6 +257,10 @@ SavedRecordingService::_onQueue_composedAVURLsWithActiveSessionsOrScheduledWork(
                _compositionAVURLsToFinalize.end());
   for (const auto& session : _assetSesionController->activeSessions()) {
     if (const auto& url = session->accessToken().compositionAVURL()) inUse.push_back(*url);
+  }
+  // Bundles being tidied right now.
+  for (const auto& [bundle, cleanup] : _fragmentCleanupsInProgress) {
+    inUse.push_back(cleanup.compositionAVURL);
   }
   return inUse;
 }

@@ -74,6 +74,8 @@ void SavedRecordingService::_init(bool watchDebugSignal) {
   // The queues were made by the constructor, the instance queue first.
   _assetSesionController = std::make_unique<AssetAccessSessionController>();
   _assetExportController = std::make_shared<AssetExportController>();
+  _fragmentCleanupOperationQueue = std::make_unique<platform::OperationQueue>();
+  _fragmentCleanupOperationQueue->setMaxConcurrentOperationCount(2);
   _isOrphanHandlingEnabled = true;
   if (watchDebugSignal) _setupSignalHandler();
 }
@@ -113,7 +115,7 @@ platform::Status SavedRecordingService::start() {
           self->_onQueuePerformOrphanHandlingIfEnabled();
           orphanKeepAlive->endTransaction();
         },
-        WorkLength::MayTakeLong);
+        WorkLength::MayBlock);
   });
 
   if (_xpcListener) return {};

@@ -34,6 +34,7 @@
 
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "platform/Error.h"
+#include "platform/OperationQueue.h"
 #include "platform/SerialQueue.h"
 #include "platform/SignalSource.h"
 #include "platform/URL.h"
@@ -132,11 +133,18 @@ class SavedRecordingService final : public platform::ListenerDelegate,
 
   // Runs `block` later on the service serial queue, under the keep-alive
   // "Dispatch to service queue" that ends one second after the block ran.
-  // Returns at once. Any thread. Work a bus call queues may run on the bus
-  // thread right after the call; a block that may take long (an orphan
-  // recovery run) says so, and then always runs on the queue's own thread.
-  enum class WorkLength { Short, MayTakeLong };
-  void _performOnServiceQueue(WorkBlock block, WorkLength length = WorkLength::Short);
+  // Returns at once. Any thread.
+  //
+  // A block marked Short may run on the bus thread right after the call
+  // that queued it, while the queue is idle, which spares a request two
+  // thread switches; the bus reads no message meanwhile, so Short is only
+  // for blocks that cannot block: no media job, no fsync, no wait for
+  // another queue's work (entering the registry's, the transaction
+  // controller's or the instance queue, whose blocks are all tiny, is fine).
+  // Everything else (the orphan recovery run, handing a finalization to the
+  // export controller) runs on the service queue's own thread.
+  enum class WorkLength { MayBlock, Short };
+  void _performOnServiceQueue(WorkBlock block, WorkLength length = WorkLength::MayBlock);
   // The connection has ended: on the service serial queue, mark it invalid
   // and release what the daemon held for it. Returns at once. Any thread.
   void _handleXPCDisconnect(const std::shared_ptr<platform::Connection>& connection);
@@ -171,7 +179,9 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // recording's deferred work. A null session does nothing.
   void _onQueueCloseAccessSession(const std::shared_ptr<AssetAccessSession>& session,
                                   bool normalTermination);
-  void _onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(
+  // The final step's start of the recording's deferred work. True when the
+  // recording's finalization was started or still waits for a later close.
+  bool _onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(
       const std::shared_ptr<AssetAccessSession>& session);
   // The recordings the orphan recovery run must leave alone: held off by a
   // client, waiting behind a deferred request or finalization, or with an
@@ -225,6 +235,11 @@ class SavedRecordingService final : public platform::ListenerDelegate,
     return _compositionAVURLsToFinalize;
   }
   AssetExportController& assetExportController() { return *_assetExportController; }
+  // Waits for the fragment cleanups' reading and deleting under way. Any
+  // thread but the service serial queue.
+  void waitUntilFragmentCleanupsAreFinishedForTesting() {
+    _fragmentCleanupOperationQueue->waitUntilAllOperationsAreFinished();
+  }
   // How many connections hold the recording's fragment cleanup off.
   std::size_t orphanedFragmentCleanupHoldCount(const platform::URL& url) const;
 
@@ -268,12 +283,30 @@ class SavedRecordingService final : public platform::ListenerDelegate,
                                                std::shared_ptr<platform::Connection> xpcConnection,
                                                AccessSessionHandler accessSessionHandler,
                                                bool cancelled);
-  void _onQueueFinishClosingAccessSession(const std::shared_ptr<AssetAccessSession>& session);
+  // The close's final step; answers as the deferred-work step above.
+  bool _onQueueFinishClosingAccessSession(const std::shared_ptr<AssetAccessSession>& session);
+  // True (and logged) when `xpcConnection` is a client's that has ended.
+  bool _onServiceQueueConnectionHasEnded(
+      const std::string& name, const platform::URL& compositionAVURL,
+      const std::shared_ptr<platform::Connection>& xpcConnection);
   // After a capture or trimming session closed normally: a recording left
   // with fragments not yet composed gets a deferred finalization.
   void _onQueueScheduleFinalizationAfterEditing(const std::shared_ptr<AssetAccessSession>& session);
+  // The fragment cleanup's decision, on the service serial queue; the
+  // reading and deleting, when there is any, run on
+  // _fragmentCleanupOperationQueue, and `completion` comes back here.
   void _onQueueCleanUpOrphanedFragments(const platform::URL& compositionAVURL,
-                                        const std::shared_ptr<AssetAccessSession>& ignored);
+                                        std::shared_ptr<AssetAccessSession> ignored,
+                                        WorkBlock completion);
+  void _onQueueFinishFragmentCleanup(const std::string& bundle, WorkBlock completion);
+  // Runs `block` now, or once the recording's running fragment cleanup has
+  // finished.
+  void _onQueueAfterFragmentCleanupOfCompositionAVURL(const platform::URL& compositionAVURL,
+                                                      WorkBlock block);
+  // The work that waited for a session of the recording to close: its
+  // deferred access request, else its waiting finalization. True when it
+  // started the waiting finalization.
+  bool _onServiceQueueRunDeferredWorkForCompositionAVURL(const platform::URL& compositionAVURL);
 
   // In declaration order, as the service's state is documented.
   // Made by the constructor, then only used:
@@ -290,10 +323,20 @@ class SavedRecordingService final : public platform::ListenerDelegate,
       _compositionAVURLsDeferredAccessRequestBlocksByAVURL;
   // Counted set: recording -> number of connections holding its cleanup off.
   std::unordered_map<platform::URL, std::size_t> _disabledOrphanedFragmentCleanupByCompositionAVURL;
+  // A fragment cleanup that reads or deletes, by its recording's bundle
+  // path: cleanups of one recording run one at a time, and what waits for
+  // the running one goes on in order when it ends.
+  struct FragmentCleanup {
+    platform::URL compositionAVURL;
+    std::vector<WorkBlock> waiting;
+  };
+  std::unordered_map<std::string, FragmentCleanup> _fragmentCleanupsInProgress;
   // Made by _init; its open and close on the service serial queue only:
   std::unique_ptr<AssetAccessSessionController> _assetSesionController;
   std::unique_ptr<platform::SignalSource> _signalDispatchSource;
   std::shared_ptr<AssetExportController> _assetExportController;
+  // The cleanups' reading and deleting; at most two at once.
+  std::unique_ptr<platform::OperationQueue> _fragmentCleanupOperationQueue;
   // Inside _serialQueue only:
   std::unordered_set<platform::URL> _compositionAVURLsBeingExported;
 

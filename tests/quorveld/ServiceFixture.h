@@ -93,7 +93,7 @@ class ServiceTest : public ::testing::Test {
   }
   // Moves the clock and runs what is due on the main queue, including the
   // service-queue work that the due timers start and the export operations
-  // that work queues, until the three queues have nothing left to hand on.
+  // and fragment cleanups that work queues, until the three queues have nothing left to hand on.
   void advance(std::chrono::nanoseconds by) {
     clock_.advance(by);
     // Each round moves every chain of work one hop further; no chain in the
@@ -102,6 +102,7 @@ class ServiceTest : public ::testing::Test {
       main_.runUntilIdle();
       drainServiceQueue();
       service_->assetExportController().waitUntilAllOperationsAreFinishedForTesting();
+      service_->waitUntilFragmentCleanupsAreFinishedForTesting();
     }
   }
   std::vector<LogLine> lines() {
