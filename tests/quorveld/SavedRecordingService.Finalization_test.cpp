@@ -11,6 +11,7 @@
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "tests/quorveld/ServiceFixture.h"
+#include "tests/support/DelegatingMediaEngine.h"
 
 namespace quorvel {
 namespace {
@@ -106,6 +107,131 @@ TEST_F(FinalizationTest, ABundleThatDoesNotLoadIsNotExportedAndItsWaveformIsSkip
             std::string::npos);
   EXPECT_EQ(linesContaining("ERROR: Skipping <GenerateWaveformOperation").size(), 1u);
   EXPECT_TRUE(std::filesystem::exists(editor->composition()->bundleURL().path()));
+}
+
+// Holds every compose at a gate until the test opens it, counting them.
+class HeldComposeEngine final : public testing::DelegatingMediaEngine {
+ public:
+  platform::Status compose(const std::vector<RCComposerSegment>& segments,
+                           const platform::URL& destination,
+                           const std::optional<platform::URL>& waveform,
+                           const RCMediaProgress& progress) override {
+    gate.update([&] { ++composes; });
+    gate.waitUntil([&] { return open; });
+    return DelegatingMediaEngine::compose(segments, destination, waveform, progress);
+  }
+  platform::testing::Gate gate;
+  int composes = 0;   // guarded by gate
+  bool open = false;  // guarded by gate
+};
+
+TEST_F(FinalizationTest, TwoSpellingsOfOneRecordingExportTogetherWithOneCompose) {
+  auto editor = makeRecording("Walk", {0.3, 0.2});
+  ASSERT_TRUE(editor);
+  auto engine = std::make_shared<HeldComposeEngine>();
+  RCMediaEngine::setCurrent(engine);
+  const std::string plain = url("Walk.m4a");
+  const std::string dotted = "file://" + directory_.string() + "/./Walk.m4a";
+  auto first = call(":1.1", "PrepareToExport", {plain, false});
+  ASSERT_TRUE(engine->gate.waitUntil([&] { return engine->composes == 1; }));
+  auto second = call(":1.2", "PrepareToExport", {dotted, false});
+  // Both finalizations are running: the second waits for the bundle.
+  ASSERT_TRUE(waitForLines("RUNNING asset finalization operation", 2));
+  engine->gate.update([&] { engine->open = true; });
+  advance(0s);
+  EXPECT_EQ(token(first).fields().at(2).asString(), plain);
+  EXPECT_EQ(token(second).fields().at(2).asString(), dotted);
+  EXPECT_EQ(engine->composes, 1);
+  EXPECT_EQ(decomposed(*editor), 0u);
+  RCUseInProcessMediaEngine();
+}
+
+// An edit finalizes its recording once: ending a capture while a trim waits
+// for it, then ending the trim, runs the one waiting finalization.
+TEST_F(FinalizationTest, EndingAnEditWhoseFinalizationWaitsStartsNoSecondOne) {
+  auto editor = makeRecording("Edit", {0.2});
+  ASSERT_TRUE(editor);
+  const std::string name = "Edit.m4a";
+  auto capture = token(prepare(":1.1", "PrepareToCapture", name));
+  auto held = holdServiceQueue();
+  end(":1.1", capture);
+  auto trim = prepare(":1.2", "PrepareToTrim", name);  // deferred behind the closing capture
+  held->count_down();
+  auto trimToken = token(trim);
+  settle();
+  EXPECT_EQ(onServiceQueue<std::size_t>(
+                [&] { return service_->compositionAVURLsToFinalizeForTesting().size(); }),
+            1u);
+  const std::size_t signalsBefore = changeSignals();
+  end(":1.2", trimToken);
+  settle();
+  EXPECT_EQ(linesContaining("Received request to schedule finalization of 'Edit.m4a'").size(), 2u);
+  EXPECT_EQ(changeSignals() - signalsBefore, 2u);
+  EXPECT_EQ(decomposed(*editor), 0u);
+  EXPECT_TRUE(onServiceQueue<bool>(
+      [&] { return service_->compositionAVURLsToFinalizeForTesting().empty(); }));
+  expectNothingLeft();
+}
+
+// A deferred request taken out for re-issue whose client vanishes before it
+// runs hands its turn to the recording's waiting finalization.
+TEST_F(FinalizationTest, ARequestWhoseClientVanishedBeforeItsReissueLetsTheFinalizationRun) {
+  auto editor = makeRecording("Gone", {0.2});
+  ASSERT_TRUE(editor);
+  const std::string name = "Gone.m4a";
+  auto capture = token(prepare(":1.1", "PrepareToCapture", name));
+  service_->_attemptToRunDeferredFinalizationOfCompositionAVURL(editor->composedAVURL());
+  drainServiceQueue();
+  ASSERT_EQ(onServiceQueue<std::size_t>(
+                [&] { return service_->compositionAVURLsToFinalizeForTesting().size(); }),
+            1u);
+
+  // The queue runs: the close's first step, the preview's deferral, the
+  // cleanup (which queues the final step) and then `marker`, which lets
+  // the client vanish while the final step waits; that step takes the
+  // preview out and queues its re-issue behind the disconnection.
+  auto held = holdServiceQueue();
+  end(":1.1", capture);
+  auto preview = prepare(":1.2", "PrepareToPreview", name);
+  auto marker = std::make_shared<std::latch>(1);
+  auto reached = std::make_shared<std::latch>(1);
+  service_->serviceSerialQueue().async([this, held, marker, reached] {
+    service_->serviceSerialQueue().async([marker, reached] {
+      reached->count_down();
+      marker->wait();
+    });
+  });
+  held->count_down();
+  reached->wait();
+  listener_->vanish(":1.2");
+  marker->count_down();
+  settle();
+  EXPECT_EQ(linesContaining("Not opening 'preview' access session").size(), 1u);
+  EXPECT_TRUE(onServiceQueue<bool>(
+      [&] { return service_->compositionAVURLsToFinalizeForTesting().empty(); }));
+  EXPECT_EQ(decomposed(*editor), 0u);
+  expectNothingLeft();
+}
+
+// What a client may send that names nothing is not an error: exporting a
+// recording that has no bundle, and ending a token whose identifier is not a
+// UUID.
+TEST_F(FinalizationTest, ARecordingWithoutABundleAndAForeignTokenAreNotErrors) {
+  auto exported = call(":1.1", "PrepareToExport", {url("Nothing.m4a"), false});
+  advance(0s);
+  BusValue granted = token(exported);
+  EXPECT_EQ(granted.fields().at(1).asInt32(), 1);
+  end(":1.1", granted);
+  call(":1.1", "EndAccessSession", {BusValue::structure({"preview", 1, url("X.m4a"), "no-uuid"})},
+       true);
+  settle();
+  EXPECT_TRUE(linesContaining("cannot load the composition").empty());
+  EXPECT_TRUE(linesContaining("parameter is required").empty());
+  EXPECT_EQ(linesContaining("Ending access session: <RCSSavedRecordingAccessToken name=preview "
+                            "type=1 (shared) compositionAVURL=" +
+                            url("X.m4a") + " identifier=no-uuid>.")
+                .size(),
+            1u);
 }
 
 }  // namespace

@@ -8,6 +8,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <functional>
@@ -27,6 +28,7 @@
 #include "quorveld/RCSXPCTransactionController.h"
 #include "quorveld/SavedRecordingService.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/Gate.h"
 
 namespace quorvel {
 
@@ -51,16 +53,21 @@ class ServiceTest : public ::testing::Test {
     platform::setConsoleLogging(false);
     platform::setLogThreshold(platform::kLogLevelDebug);
     platform::setLogSinkForTesting([this](int level, std::string_view text) {
-      std::lock_guard lock(mutex_);
-      lines_.push_back({level, std::string(text)});
+      logged_.update([&] { lines_.push_back({level, std::string(text)}); });
     });
     service_ = SavedRecordingService::makeForTesting({.watchDebugSignal = false});
     service_->setListenerFactory(
-        [this](const std::string&, platform::InterfaceDescription interface) {
-          auto listener = std::make_shared<platform::LocalListener>(std::move(interface));
-          listener_ = listener;
-          return listener;
+        [this](const std::string& name, platform::InterfaceDescription interface) {
+          return makeListener(name, std::move(interface));
         });
+  }
+
+  // The listener start() gets: by default an in-process one, which the tests
+  // drive as peers with call().
+  virtual std::shared_ptr<platform::Listener> makeListener(
+      const std::string& /*serviceName*/, platform::InterfaceDescription interface) {
+    listener_ = std::make_shared<platform::LocalListener>(std::move(interface));
+    return listener_;
   }
 
   void TearDown() override {
@@ -106,8 +113,17 @@ class ServiceTest : public ::testing::Test {
     }
   }
   std::vector<LogLine> lines() {
-    std::lock_guard lock(mutex_);
+    std::lock_guard lock(logged_.mutex());
     return lines_;
+  }
+  // Waits (at most platform::testing::kWait) until `count` lines contain
+  // `needle`.
+  bool waitForLines(std::string_view needle, std::size_t count = 1) {
+    return logged_.waitUntil([&] {
+      return std::size_t(std::ranges::count_if(lines_, [&](const LogLine& line) {
+               return line.text.find(needle) != std::string::npos;
+             })) >= count;
+    });
   }
   std::vector<std::string> linesContaining(std::string_view needle) {
     std::vector<std::string> found;
@@ -125,8 +141,8 @@ class ServiceTest : public ::testing::Test {
   platform::MainQueue main_{clock_, "test main"};
   std::shared_ptr<SavedRecordingService> service_;
   std::shared_ptr<platform::LocalListener> listener_;
-  std::mutex mutex_;
-  std::vector<LogLine> lines_;
+  platform::testing::Gate logged_;
+  std::vector<LogLine> lines_;  // guarded by logged_
 };
 
 // A started service on a recordings directory of its own, with helpers to

@@ -21,6 +21,7 @@
 #include "platform/dbus/BusListener.h"
 #include "platform/dbus/LocalListener.h"
 #include "platform/dbus/SdBusCodec.h"
+#include "tests/support/Gate.h"
 #include "tests/support/TestBus.h"
 
 namespace platform::testing {
@@ -30,28 +31,6 @@ using namespace std::chrono_literals;
 inline constexpr const char* kName = "org.quorvel.test.Listener";
 inline constexpr const char* kPath = "/org/quorvel/test/Listener";
 inline constexpr const char* kInterface = "org.quorvel.test.Listener1";
-inline constexpr auto kWait = 20s;  // upper bound on any wait for an event
-
-// Waits for a condition that other threads make true.
-class Gate {
- public:
-  void update(const std::function<void()>& change) {
-    {
-      std::lock_guard lock(mutex_);
-      change();
-    }
-    changed_.notify_all();
-  }
-  bool waitUntil(const std::function<bool()>& predicate) {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kWait, predicate);
-  }
-  std::mutex& mutex() { return mutex_; }
-
- private:
-  std::mutex mutex_;
-  std::condition_variable changed_;
-};
 
 // What the listener did, recorded by the delegate and the handlers.
 struct Observations {
