@@ -95,7 +95,10 @@ class ServiceTest : public ::testing::Test {
     }
     advance(1s);
   }
+  // Lets the fragment cleanups under way finish, then runs what the service
+  // queue holds.
   void drainServiceQueue() {
+    service_->waitUntilFragmentCleanupsAreFinishedForTesting();
     service_->serviceSerialQueue().sync([] {});
   }
   // Moves the clock and runs what is due on the main queue, including the
@@ -109,7 +112,6 @@ class ServiceTest : public ::testing::Test {
       main_.runUntilIdle();
       drainServiceQueue();
       service_->assetExportController().waitUntilAllOperationsAreFinishedForTesting();
-      service_->waitUntilFragmentCleanupsAreFinishedForTesting();
     }
   }
   std::vector<LogLine> lines() {
