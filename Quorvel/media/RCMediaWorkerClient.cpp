@@ -28,12 +28,13 @@
 // Batches. probeMany sends up to kRCMediaMaxProbeBatch files per request;
 // the worker answers each file with an item reply as it goes (written out
 // every few milliseconds), and each item pushes back the no-progress
-// deadline. Items must come in order, one per
-// file, before the result; anything else breaks the protocol. When the job
+// deadline. Items must come in order, one per file, before the result;
+// anything else breaks the protocol. When the job
 // fails (the worker died, hung, broke the protocol, or none could start) the
 // answers that came stay, and the request's other files are probed one at a
 // time: the file the worker was on when it went is retried alone and fails
 // alone if it was the cause, and the files after it get their own answers.
+// A file that hangs the worker thus costs the no-progress time twice.
 //
 // Idle exit. An idle worker exits with status 0 when no request came for its
 // idle time; the daemon notices when it next picks that worker (its socket

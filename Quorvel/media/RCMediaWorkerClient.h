@@ -5,12 +5,13 @@
 // Two small pools of the same worker program, one per lane: the short lane
 // runs probes (single and batched), at most `maxShortWorkers` workers; the
 // long lane runs composes, waveforms and title writes, at most `maxWorkers`
-// workers, started at a lower CPU priority (nice +10). Each worker runs one
-// job at a time and many jobs over its life; a job waits only for a free
-// worker of its own lane. Workers are started on the first job that needs one, over a socket
-// pair whose end the worker inherits; a worker exits by itself after
-// `idleExitAfter` without a job, and every worker dies with the daemon (the
-// kernel's parent-death signal, and the end of file on its socket).
+// workers, started at a lower CPU priority (nice +10; the .cpp says how).
+// Each worker runs one job at a time and many jobs over its life; a job
+// waits only for a free worker of its own lane. Workers are started on the
+// first job that needs one, over a socket pair whose end the worker
+// inherits; a worker exits by itself after `idleExitAfter` without a job,
+// and every worker dies with the daemon (the kernel's parent-death signal,
+// and the end of file on its socket).
 //
 // A worker that dies during a job (a signal, an address-space limit, an exit)
 // fails that job with an error naming the signal and the file; a job that
@@ -103,7 +104,8 @@ class RCMediaWorkerClient final : public RCMediaEngine {
 
  private:
   struct Worker;
-  // One pool: its workers, its limit and its wait. Guarded by mutex_.
+  // One pool: its workers, its limit and its wait. The limit and the nice
+  // increment are set by the constructor; the rest is guarded by mutex_.
   struct Lane {
     std::size_t maxWorkers = 1;
     int nice = 0;  // added to the daemon's nice value for its workers
