@@ -17,6 +17,15 @@
 // large directory costs one lstat per entry and an MD5 of the few files
 // whose sizes collide.
 //
+// The bare files the run will examine are probed before the pass, in one
+// probeMany call (with the daemon's worker, a few requests for the whole
+// directory instead of one per file): those whose listed size no in-use file
+// and no other orphan has, which the duplicate test therefore keeps. The
+// pass uses such a result only when the file is still as listed; a file of a
+// shared size, or one that changed meanwhile, is examined on its own when
+// the pass reaches it, as every file once was. So a duplicate is never
+// probed, and the decisions and their order are those of a file-by-file run.
+//
 // Deleting is the last resort and only follows a positive finding: a file
 // whose digest or audio could not be read is left where it is, with a line
 // saying why; only a file that the media engine read and found without
@@ -48,6 +57,7 @@
 #include "Quorvel/locale/RCLocalizedRecordingDate.h"
 #include "Quorvel/locale/RCPreferredLanguages.h"
 #include "Quorvel/media/RCAudioAsset.h"
+#include "Quorvel/media/RCMediaEngine.h"
 #include "platform/Log.h"
 
 namespace quorvel {
@@ -66,6 +76,12 @@ struct Identity {
     return std::tie(a.device, a.inode) < std::tie(b.device, b.inode);
   }
 };
+
+// Whether two lstat results are of the same, unchanged file.
+bool sameContents(const struct stat& a, const struct stat& b) {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino && a.st_size == b.st_size &&
+         a.st_mtim.tv_sec == b.st_mtim.tv_sec && a.st_mtim.tv_nsec == b.st_mtim.tv_nsec;
+}
 
 double secondsSince(const struct timespec& time) {
   return platform::Date::now().timeIntervalSince1970() - double(time.tv_sec) -
@@ -420,19 +436,50 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
   };
   auto lastComponent = [](std::string_view path) { return path.substr(path.rfind('/') + 1); };
 
-  for (const Keyed& item : keyed) {
-    const platform::URL& url = *item.url;
+  // The listing's entry of a bare orphan the pass looks at.
+  auto orphanEntry = [&](const platform::URL& url) -> std::optional<Entry> {
     Entry listed = fileManager.entryFor(url.path());
     if (listed.inUse || !RCCaptureFormat::isFileExtensionSupported(url.pathExtension()) ||
         inUse.containsPath(url.path())) {
-      continue;
+      return std::nullopt;
     }
     // Only regular files: a link, a directory or a device is not a bare
     // recording, and the very same file as an in-use one is in use.
     if (!listed.exists || !S_ISREG(listed.info.st_mode) ||
         inUseIdentities.contains(Identity{listed.info.st_dev, listed.info.st_ino})) {
-      continue;
+      return std::nullopt;
     }
+    return listed;
+  };
+
+  // The orphans of a size of their own, probed at once (see the top).
+  std::unordered_map<std::string, platform::Result<RCMediaProbe>> probed;
+  {
+    std::vector<std::pair<platform::URL, std::uint64_t>> orphans;
+    std::unordered_map<std::uint64_t, std::size_t> orphansBySize;
+    for (const Keyed& item : keyed) {
+      std::optional<Entry> listed = orphanEntry(*item.url);
+      if (!listed || listed->info.st_size <= 0) continue;
+      orphans.emplace_back(*item.url, std::uint64_t(listed->info.st_size));
+      ++orphansBySize[orphans.back().second];
+    }
+    std::vector<platform::URL> batch;
+    for (const auto& [url, size] : orphans) {
+      if (orphansBySize[size] == 1 && !inUseBySize.contains(size)) batch.push_back(url);
+    }
+    if (!batch.empty()) {
+      auto probes = RCMediaEngine::current()->probeMany(batch);
+      for (std::size_t i = 0; i < std::min(batch.size(), probes.size()); ++i) {
+        probed.emplace(batch[i].path(), std::move(probes[i]));
+      }
+    }
+  }
+
+  for (const Keyed& item : keyed) {
+    const platform::URL& url = *item.url;
+    std::optional<Entry> orphan = orphanEntry(url);
+    if (!orphan) continue;
+    const Entry& listed = *orphan;
     const std::string& name = item.name;
     ORPHAN_LOG("Found orphaned composed AVURL: '{}'", name);
 
@@ -488,7 +535,10 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
         name);
 
     ++statistics_.assetsProbed;
-    auto examined = RCAudioAsset::examineAssetWithURL(url);
+    auto batched = probed.find(url.path());
+    auto examined = batched != probed.end() && sameContents(listed.info, now.info)
+                        ? RCAudioAsset::examineAssetWithProbe(url, std::move(batched->second))
+                        : RCAudioAsset::examineAssetWithURL(url);
     if (!examined) {
       ORPHAN_LOG("Orphaned composed AVURL: '{}' could not be examined ({}); leaving it", name,
                  examined.error());

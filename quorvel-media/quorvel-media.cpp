@@ -1,6 +1,6 @@
 // quorvel-media: the media worker. The daemon starts it with one end of a
-// socket pair and sends it media jobs (probe, compose, waveform, title
-// write), one at a time; it runs each with the in-process media engine and
+// socket pair and sends it media jobs (probe, probe of many files, compose,
+// waveform, title write), one at a time; it runs each with the in-process media engine and
 // answers with progress, then a result or an error. Untrusted audio files are
 // parsed only here, inside a sandbox, so a decoder that crashes or hangs
 // costs the daemon one job.
@@ -12,10 +12,11 @@
 //
 // Usage (by the daemon only):
 //   quorvel-media --socket-fd=N --parent-pid=PID [--idle-exit-after=SECONDS]
-//                 [--allow=DIR]...
+//                 [--nice=INCREMENT] [--allow=DIR]...
 #include <poll.h>
 #include <signal.h>
 #include <sys/prctl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -60,6 +61,7 @@ struct Options {
   int socketFd = -1;
   pid_t parentPid = 0;
   double idleExitAfter = 30;
+  int nice = 0;
   std::vector<std::string> allowed;
 };
 
@@ -77,6 +79,8 @@ bool parse(int argc, char** argv, Options& options) {
       options.parentPid = pid_t(std::strtol(text, &end, 10));
     } else if (const char* text = value("--idle-exit-after=")) {
       options.idleExitAfter = std::strtod(text, &end);
+    } else if (const char* text = value("--nice=")) {
+      options.nice = int(std::strtol(text, &end, 10));
     } else if (const char* text = value("--allow=")) {
       options.allowed.emplace_back(text);
       continue;
@@ -100,15 +104,18 @@ class Channel {
   // without sleeping.
   bool send(const std::string& body, bool last = false) {
     if (last) spinUntil_ = std::chrono::steady_clock::now() + std::chrono::microseconds(200);
-    const std::string frame = quorvel::RCMediaEncodeFrame(body);
-    std::size_t sent = 0;
-    while (sent < frame.size()) {
-      ssize_t n = ::send(fd_, frame.data() + sent, frame.size() - sent, MSG_NOSIGNAL);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) return false;
-      sent += std::size_t(n);
-    }
-    return true;
+    return write(std::exchange(queued_, {}) + quorvel::RCMediaEncodeFrame(body));
+  }
+
+  // Queues one frame, written with the next send() or once the first frame
+  // queued has waited a few milliseconds: a batch's answers then cost the
+  // daemon a wake-up per handful of files, not per file. False when the
+  // daemon is gone.
+  bool queue(const std::string& body) {
+    const auto now = std::chrono::steady_clock::now();
+    if (queued_.empty()) queuedAt_ = now;
+    queued_ += quorvel::RCMediaEncodeFrame(body);
+    return now - queuedAt_ < std::chrono::milliseconds(5) || write(std::exchange(queued_, {}));
   }
 
   // The next request's body; nullopt at end of file or after `idle` without
@@ -151,9 +158,22 @@ class Channel {
   }
 
  private:
+  bool write(const std::string& frame) {
+    std::size_t sent = 0;
+    while (sent < frame.size()) {
+      ssize_t n = ::send(fd_, frame.data() + sent, frame.size() - sent, MSG_NOSIGNAL);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) return false;
+      sent += std::size_t(n);
+    }
+    return true;
+  }
+
   int fd_;
   quorvel::RCMediaFrameReader reader_;
   std::optional<std::chrono::steady_clock::time_point> spinUntil_;
+  std::string queued_;
+  std::chrono::steady_clock::time_point queuedAt_;
 };
 
 void serve(Channel& channel, quorvel::RCMediaEngine& engine, std::chrono::duration<double> idle) {
@@ -179,6 +199,17 @@ void serve(Channel& channel, quorvel::RCMediaEngine& engine, std::chrono::durati
         auto probe = engine.probe(request->url);
         reply = probe ? quorvel::RCMediaEncodeResult(id, &*probe)
                       : quorvel::RCMediaEncodeError(id, probe.error());
+        break;
+      }
+      case RCMediaJobKind::ProbeMany: {
+        // Each file's answer goes out within milliseconds of being known: it
+        // tells the daemon the batch is moving, and survives this process
+        // dying on a later file.
+        for (std::size_t index = 0; index < request->urls.size() && connected; ++index) {
+          connected = channel.queue(
+              quorvel::RCMediaEncodeItem(id, index, engine.probe(request->urls[index])));
+        }
+        reply = quorvel::RCMediaEncodeResult(id, nullptr);
         break;
       }
       case RCMediaJobKind::Compose:
@@ -209,8 +240,14 @@ int main(int argc, char** argv) {
     std::fprintf(stderr,
                  "quorvel-media: the daemon's media worker; not meant to be run by hand\n"
                  "usage: quorvel-media --socket-fd=N --parent-pid=PID "
-                 "[--idle-exit-after=SECONDS] [--allow=DIR]...\n");
+                 "[--idle-exit-after=SECONDS] [--nice=INCREMENT] [--allow=DIR]...\n");
     return 64;
+  }
+  // Lowered first, while this is the process's only thread: Linux keeps a
+  // nice value per thread, and every thread started later inherits it.
+  if (options.nice != 0 &&
+      ::setpriority(PRIO_PROCESS, 0, ::getpriority(PRIO_PROCESS, 0) + options.nice) != 0) {
+    std::fprintf(stderr, "quorvel-media: cannot lower its priority: %s\n", std::strerror(errno));
   }
   // Die with the daemon, even when it dies before this line ran.
   ::prctl(PR_SET_PDEATHSIG, SIGKILL);

@@ -36,7 +36,11 @@ std::shared_ptr<RCAudioAsset> RCAudioAsset::assetWithURL(const platform::URL& ur
 
 platform::Result<std::shared_ptr<RCAudioAsset>> RCAudioAsset::examineAssetWithURL(
     const platform::URL& url) {
-  auto probe = RCMediaEngine::current()->probe(url);
+  return examineAssetWithProbe(url, RCMediaEngine::current()->probe(url));
+}
+
+platform::Result<std::shared_ptr<RCAudioAsset>> RCAudioAsset::examineAssetWithProbe(
+    const platform::URL& url, platform::Result<RCMediaProbe> probe) {
   if (!probe) {
     // The media engine reports what it read and found unusable in the asset
     // domain; anything else (POSIX, the worker's own failures) is a failure

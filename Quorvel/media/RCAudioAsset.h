@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/media/RCMetadataItem.h"
 #include "platform/Date.h"
 #include "platform/Error.h"
@@ -44,6 +45,10 @@ class RCAudioAsset {
   // died or timed out), which says nothing about its contents.
   static platform::Result<std::shared_ptr<RCAudioAsset>> examineAssetWithURL(
       const platform::URL& url);
+  // What examineAssetWithURL finds, from a probe of `url` already made (one
+  // result of RCMediaEngine::probeMany, which probes many files at once).
+  static platform::Result<std::shared_ptr<RCAudioAsset>> examineAssetWithProbe(
+      const platform::URL& url, platform::Result<RCMediaProbe> probe);
 
   const platform::URL& url() const { return url_; }
   // In seconds; NaN when the file does not say.

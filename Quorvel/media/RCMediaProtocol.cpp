@@ -99,9 +99,27 @@ RCMediaProbe decodeProbe(const json& object) {
   return probe;
 }
 
+json encodeErrorObject(const platform::Error& error) {
+  std::string message = error.localizedDescription();
+  if (message.size() > kMaxMessageBytes) message.resize(kMaxMessageBytes);
+  return {{"domain", error.domain()}, {"code", error.code()}, {"message", message}};
+}
+
+platform::Error decodeErrorObject(const json& error) {
+  if (!error.is_object()) throw Malformed{"\"error\" is not an object"};
+  const json& code = field(error, "code");
+  if (!code.is_number_integer()) throw Malformed{"\"code\" is not an integer"};
+  std::string domain = stringField(error, "domain");
+  if (domain.empty()) throw Malformed{"empty error domain"};
+  std::string message = stringField(error, "message");
+  if (message.size() > kMaxMessageBytes) message.resize(kMaxMessageBytes);
+  return platform::Error(std::move(domain), code.get<long>(), std::move(message));
+}
+
 std::optional<RCMediaJobKind> kindNamed(const std::string& name) {
-  for (RCMediaJobKind kind : {RCMediaJobKind::Probe, RCMediaJobKind::Compose,
-                              RCMediaJobKind::Waveform, RCMediaJobKind::WriteTitle}) {
+  for (RCMediaJobKind kind :
+       {RCMediaJobKind::Probe, RCMediaJobKind::ProbeMany, RCMediaJobKind::Compose,
+        RCMediaJobKind::Waveform, RCMediaJobKind::WriteTitle}) {
     if (name == RCMediaJobKindName(kind)) return kind;
   }
   return std::nullopt;
@@ -149,6 +167,8 @@ const char* RCMediaJobKindName(RCMediaJobKind kind) {
   switch (kind) {
     case RCMediaJobKind::Probe:
       return "probe";
+    case RCMediaJobKind::ProbeMany:
+      return "probeMany";
     case RCMediaJobKind::Compose:
       return "compose";
     case RCMediaJobKind::Waveform:
@@ -160,12 +180,17 @@ const char* RCMediaJobKindName(RCMediaJobKind kind) {
 }
 
 std::string RCMediaEncodeRequest(const RCMediaRequest& request) {
-  json body = {{"id", request.id},
-               {"job", RCMediaJobKindName(request.kind)},
-               {"url", request.url.absoluteString()}};
+  json body = {{"id", request.id}, {"job", RCMediaJobKindName(request.kind)}};
+  if (request.kind != RCMediaJobKind::ProbeMany) body["url"] = request.url.absoluteString();
   switch (request.kind) {
     case RCMediaJobKind::Probe:
       break;
+    case RCMediaJobKind::ProbeMany: {
+      json urls = json::array();
+      for (const platform::URL& url : request.urls) urls.push_back(url.absoluteString());
+      body["urls"] = std::move(urls);
+      break;
+    }
     case RCMediaJobKind::Compose: {
       json segments = json::array();
       for (const RCComposerSegment& segment : request.segments) {
@@ -198,10 +223,26 @@ platform::Result<RCMediaRequest> RCMediaDecodeRequest(std::string_view text) {
     std::optional<RCMediaJobKind> kind = kindNamed(stringField(body, "job"));
     if (!kind) throw Malformed{"unknown job"};
     request.kind = *kind;
-    request.url = urlField(body, "url");
+    if (request.kind != RCMediaJobKind::ProbeMany) request.url = urlField(body, "url");
     switch (request.kind) {
       case RCMediaJobKind::Probe:
         break;
+      case RCMediaJobKind::ProbeMany: {
+        const json& urls = field(body, "urls");
+        if (!urls.is_array()) throw Malformed{"\"urls\" is not an array"};
+        if (urls.empty() || urls.size() > kRCMediaMaxProbeBatch) {
+          throw Malformed{"\"urls\" names " + std::to_string(urls.size()) + " files, not 1 to " +
+                          std::to_string(kRCMediaMaxProbeBatch)};
+        }
+        for (const json& url : urls) {
+          if (!url.is_string()) throw Malformed{"a URL is not a string"};
+          std::optional<platform::URL> file =
+              platform::URL::fileURLFromString(url.get<std::string>());
+          if (!file) throw Malformed{"a URL is not a file URL"};
+          request.urls.push_back(std::move(*file));
+        }
+        break;
+      }
       case RCMediaJobKind::Compose: {
         const json& segments = field(body, "segments");
         if (!segments.is_array()) throw Malformed{"\"segments\" is not an array"};
@@ -238,11 +279,18 @@ std::string RCMediaEncodeResult(std::uint64_t id, const RCMediaProbe* probe) {
 }
 
 std::string RCMediaEncodeError(std::uint64_t id, const platform::Error& error) {
-  std::string message = error.localizedDescription();
-  if (message.size() > kMaxMessageBytes) message.resize(kMaxMessageBytes);
-  return dump(
-      {{"id", id},
-       {"error", {{"domain", error.domain()}, {"code", error.code()}, {"message", message}}}});
+  return dump({{"id", id}, {"error", encodeErrorObject(error)}});
+}
+
+std::string RCMediaEncodeItem(std::uint64_t id, std::size_t index,
+                              const platform::Result<RCMediaProbe>& probe) {
+  json item = {{"index", index}};
+  if (probe) {
+    item["result"] = encodeProbe(*probe);
+  } else {
+    item["error"] = encodeErrorObject(probe.error());
+  }
+  return dump({{"id", id}, {"item", std::move(item)}});
 }
 
 platform::Result<RCMediaReply> RCMediaDecodeReply(std::string_view text) {
@@ -260,18 +308,28 @@ platform::Result<RCMediaReply> RCMediaDecodeReply(std::string_view text) {
       if (!result->is_object()) throw Malformed{"\"result\" is not an object"};
       reply.kind = RCMediaReply::Kind::Result;
       if (result->contains("playable")) reply.probe = decodeProbe(*result);
+    } else if (auto item = body.find("item"); item != body.end()) {
+      if (!item->is_object()) throw Malformed{"\"item\" is not an object"};
+      const json& index = field(*item, "index");
+      if (!index.is_number_unsigned() || index.get<std::uint64_t>() >= kRCMediaMaxProbeBatch) {
+        throw Malformed{"\"index\" is not below " + std::to_string(kRCMediaMaxProbeBatch)};
+      }
+      reply.kind = RCMediaReply::Kind::Item;
+      reply.index = std::size_t(index.get<std::uint64_t>());
+      const bool probed = item->contains("result");
+      if (probed == item->contains("error")) throw Malformed{"an item needs a result or an error"};
+      if (probed) {
+        const json& result = field(*item, "result");
+        if (!result.is_object()) throw Malformed{"\"result\" is not an object"};
+        reply.probe = decodeProbe(result);
+      } else {
+        reply.error = decodeErrorObject(field(*item, "error"));
+      }
     } else if (auto error = body.find("error"); error != body.end()) {
-      if (!error->is_object()) throw Malformed{"\"error\" is not an object"};
-      const json& code = field(*error, "code");
-      if (!code.is_number_integer()) throw Malformed{"\"code\" is not an integer"};
-      std::string domain = stringField(*error, "domain");
-      if (domain.empty()) throw Malformed{"empty error domain"};
-      std::string message = stringField(*error, "message");
-      if (message.size() > kMaxMessageBytes) message.resize(kMaxMessageBytes);
       reply.kind = RCMediaReply::Kind::Error;
-      reply.error = platform::Error(std::move(domain), code.get<long>(), std::move(message));
+      reply.error = decodeErrorObject(*error);
     } else {
-      throw Malformed{"neither progress, result nor error"};
+      throw Malformed{"neither progress, item, result nor error"};
     }
     return reply;
   } catch (const Malformed& malformed) {

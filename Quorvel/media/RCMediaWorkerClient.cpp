@@ -15,6 +15,27 @@
 // worker: it is killed (SIGKILL; harmless when it is already gone), reaped,
 // and the job fails with what happened to it.
 //
+// Lanes. Probes and long jobs draw workers from two pools with their own
+// idle lists, limits and condition variables under the one mutex, so a
+// probe never waits for a compose's worker. Long-lane workers are started
+// with --nice=10 and lower their own priority first thing, rather than this
+// process calling setpriority() on them after the spawn: Linux keeps a nice
+// value per thread, and only the worker knows it runs a single thread at that
+// moment, so every decoder or encoder thread it starts later inherits the
+// value; and the increment is relative, so a daemon that was itself started
+// at a lower priority keeps its workers below it.
+//
+// Batches. probeMany sends up to kRCMediaMaxProbeBatch files per request;
+// the worker answers each file with an item reply as it goes (written out
+// every few milliseconds), and each item pushes back the no-progress
+// deadline. Items must come in order, one per file, before the result;
+// anything else breaks the protocol. When the job
+// fails (the worker died, hung, broke the protocol, or none could start) the
+// answers that came stay, and the request's other files are probed one at a
+// time: the file the worker was on when it went is retried alone and fails
+// alone if it was the cause, and the files after it get their own answers.
+// A file that hangs the worker thus costs the no-progress time twice.
+//
 // Idle exit. An idle worker exits with status 0 when no request came for its
 // idle time; the daemon notices when it next picks that worker (its socket
 // reads as end of file) and reaps it. A request can cross the worker's
@@ -58,6 +79,8 @@ constexpr int kWorkerSocketFd = 3;
 // waits for its first job, so only pooled workers can leave under one, and
 // several jobs racing for the two slots may each meet a leaving worker.
 constexpr int kAttempts = 10;
+// How much lower the long lane's workers run than the daemon.
+constexpr int kLongJobNice = 10;
 
 platform::Error workerError(std::string text) {
   return RCMediaError(RCMediaErrorCodeWorkerFailed, std::move(text));
@@ -136,13 +159,20 @@ RCMediaWorkerClient::RCMediaWorkerClient() : RCMediaWorkerClient(Options()) {}
 
 RCMediaWorkerClient::RCMediaWorkerClient(Options options)
     : options_(std::move(options)),
-      workerPath_(options_.workerPath.empty() ? defaultWorkerPath() : options_.workerPath) {}
+      workerPath_(options_.workerPath.empty() ? defaultWorkerPath() : options_.workerPath) {
+  shortLane_.maxWorkers = std::max<std::size_t>(1, options_.maxShortWorkers);
+  longLane_.maxWorkers = std::max<std::size_t>(1, options_.maxWorkers);
+  longLane_.nice = kLongJobNice;
+}
 
 RCMediaWorkerClient::~RCMediaWorkerClient() {
   std::vector<std::unique_ptr<Worker>> idle;
   {
     std::lock_guard lock(mutex_);
-    idle.swap(idle_);
+    for (Lane* lane : {&shortLane_, &longLane_}) {
+      for (auto& worker : lane->idle) idle.push_back(std::move(worker));
+      lane->idle.clear();
+    }
   }
   // Closing the socket ends the worker; reap it so no zombie is left.
   for (auto& worker : idle) {
@@ -154,7 +184,14 @@ RCMediaWorkerClient::~RCMediaWorkerClient() {
 
 std::vector<pid_t> RCMediaWorkerClient::workerPids() const {
   std::lock_guard lock(mutex_);
-  return pids_;
+  std::vector<pid_t> pids = shortLane_.pids;
+  pids.insert(pids.end(), longLane_.pids.begin(), longLane_.pids.end());
+  return pids;
+}
+
+RCMediaWorkerClient::Lane& RCMediaWorkerClient::laneFor(RCMediaJobKind kind) {
+  const bool isShort = kind == RCMediaJobKind::Probe || kind == RCMediaJobKind::ProbeMany;
+  return isShort ? shortLane_ : longLane_;
 }
 
 void RCMediaWorkerClient::setJobObserverForTesting(JobObserver observer) {
@@ -162,7 +199,8 @@ void RCMediaWorkerClient::setJobObserverForTesting(JobObserver observer) {
   observer_ = std::move(observer);
 }
 
-platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClient::spawn() {
+platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClient::spawn(
+    const Lane& lane) {
   int sockets[2];
   if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sockets) != 0) {
     return platform::fail(workerError(
@@ -185,6 +223,7 @@ platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClie
       fmt::format("--idle-exit-after={:g}", options_.idleExitAfter.count()),
       "--allow=" + RCSavedRecordingsDirectory(),
   };
+  if (lane.nice != 0) arguments.push_back("--nice=" + std::to_string(lane.nice));
   for (const std::string& directory : options_.extraSandboxDirectories) {
     arguments.push_back("--allow=" + directory);
   }
@@ -227,56 +266,59 @@ platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClie
   return worker;
 }
 
-platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClient::acquire() {
+platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClient::acquire(
+    Lane& lane) {
   std::vector<std::unique_ptr<Worker>> ended;
   std::unique_lock lock(mutex_);
   for (;;) {
-    while (!idle_.empty()) {
-      std::unique_ptr<Worker> worker = std::move(idle_.back());
-      idle_.pop_back();
+    while (!lane.idle.empty()) {
+      std::unique_ptr<Worker> worker = std::move(lane.idle.back());
+      lane.idle.pop_back();
       if (!worker->hasEnded()) {
         lock.unlock();
         return worker;
       }
-      std::erase(pids_, worker->pid);
+      std::erase(lane.pids, worker->pid);
       ended.push_back(std::move(worker));  // reaped below, outside the lock
     }
-    if (pids_.size() + starting_ < std::max<std::size_t>(1, options_.maxWorkers)) break;
-    available_.wait(lock);
+    if (lane.pids.size() + lane.starting < lane.maxWorkers) break;
+    lane.available.wait(lock);
   }
-  ++starting_;
+  ++lane.starting;
   lock.unlock();
   for (auto& worker : ended) worker->reap(false);
   ended.clear();
-  auto worker = spawn();
+  auto worker = spawn(lane);
   lock.lock();
-  --starting_;
+  --lane.starting;
   if (worker) {
-    pids_.push_back((*worker)->pid);
+    lane.pids.push_back((*worker)->pid);
   } else {
-    available_.notify_one();
+    lane.available.notify_one();
   }
   return worker;
 }
 
-void RCMediaWorkerClient::release(std::unique_ptr<Worker> worker) {
+void RCMediaWorkerClient::release(Lane& lane, std::unique_ptr<Worker> worker) {
   std::lock_guard lock(mutex_);
-  idle_.push_back(std::move(worker));
-  available_.notify_one();
+  lane.idle.push_back(std::move(worker));
+  lane.available.notify_one();
 }
 
-void RCMediaWorkerClient::discard(std::unique_ptr<Worker> worker) {
+void RCMediaWorkerClient::discard(Lane& lane, std::unique_ptr<Worker> worker) {
   worker->reap(true);
   std::lock_guard lock(mutex_);
-  std::erase(pids_, worker->pid);
-  available_.notify_one();
+  std::erase(lane.pids, worker->pid);
+  lane.available.notify_one();
 }
 
 platform::Result<RCMediaReply> RCMediaWorkerClient::run(RCMediaRequest request,
                                                         const std::string& doing,
-                                                        const RCMediaProgress& progress) {
+                                                        const RCMediaProgress& progress,
+                                                        const ItemSink& items) {
+  Lane& lane = laneFor(request.kind);
   for (int attempt = 1;; ++attempt) {
-    auto acquired = acquire();
+    auto acquired = acquire(lane);
     if (!acquired) {
       QV_LOG(platform::kLogLevelError, "ERROR: {}", acquired.error().localizedDescription());
       return platform::fail(acquired.error());
@@ -290,7 +332,7 @@ platform::Result<RCMediaReply> RCMediaWorkerClient::run(RCMediaRequest request,
     }
     const std::string frame = RCMediaEncodeFrame(RCMediaEncodeRequest(request));
     if (frame.size() > kRCMediaMaxFrameBytes + 4) {
-      release(std::move(worker));
+      release(lane, std::move(worker));
       return platform::fail(workerError("the request for " + doing + " is too large"));
     }
 
@@ -305,7 +347,8 @@ platform::Result<RCMediaReply> RCMediaWorkerClient::run(RCMediaRequest request,
     if (observer) observer(worker->pid, request.kind);
 
     RCMediaFrameReader reader;
-    bool replied = false;  // any reply, progress included
+    bool replied = false;      // any reply, progress included
+    std::size_t answered = 0;  // items of a probeMany job
     std::optional<platform::Error> failure;
     std::optional<RCMediaReply> final;
     auto deadline =
@@ -327,11 +370,31 @@ platform::Result<RCMediaReply> RCMediaWorkerClient::run(RCMediaRequest request,
           break;
         }
         replied = true;
-        if (reply->kind == RCMediaReply::Kind::Progress) {
+        const bool isItem = reply->kind == RCMediaReply::Kind::Item;
+        const bool isBatch = request.kind == RCMediaJobKind::ProbeMany;
+        if (isItem && (!isBatch || reply->index != answered || answered >= request.urls.size())) {
+          failure = workerError(fmt::format(
+              "{} broke the protocol while {}: an answer out of order", kWorkerName, doing));
+          break;
+        }
+        if (isBatch && reply->kind == RCMediaReply::Kind::Result &&
+            answered != request.urls.size()) {
+          failure =
+              workerError(fmt::format("{} broke the protocol while {}: {} answers for {} files",
+                                      kWorkerName, doing, answered, request.urls.size()));
+          break;
+        }
+        if (reply->kind == RCMediaReply::Kind::Progress || isItem) {
           deadline = std::chrono::steady_clock::now() +
                      std::chrono::duration_cast<std::chrono::steady_clock::duration>(
                          options_.noProgressTimeout);
-          if (progress) progress(reply->progress);
+          if (isItem) {
+            ++answered;
+            if (items) items(std::move(*reply));
+            if (observer) observer(worker->pid, request.kind);
+          } else if (progress) {
+            progress(reply->progress);
+          }
         } else {
           final = std::move(*reply);
         }
@@ -369,10 +432,10 @@ platform::Result<RCMediaReply> RCMediaWorkerClient::run(RCMediaRequest request,
       failure = workerError(fmt::format("{} {} while {}", kWorkerName, worker->fate(), doing));
     }
     if (final) {
-      release(std::move(worker));
+      release(lane, std::move(worker));
       return std::move(*final);
     }
-    discard(std::move(worker));
+    discard(lane, std::move(worker));
     if (failure) {
       QV_LOG(platform::kLogLevelError, "ERROR: {}", failure->localizedDescription());
       return platform::fail(std::move(*failure));
@@ -392,6 +455,41 @@ platform::Result<RCMediaProbe> RCMediaWorkerClient::probe(const platform::URL& u
         "{} broke the protocol while probing {}: no probe", kWorkerName, url.lastPathComponent())));
   }
   return std::move(*reply->probe);
+}
+
+std::vector<platform::Result<RCMediaProbe>> RCMediaWorkerClient::probeMany(
+    const std::vector<platform::URL>& urls) {
+  std::vector<platform::Result<RCMediaProbe>> probes;
+  probes.reserve(urls.size());
+  for (std::size_t begin = 0; begin < urls.size(); begin += kRCMediaMaxProbeBatch) {
+    const std::size_t end = std::min(urls.size(), begin + kRCMediaMaxProbeBatch);
+    probeBatch(std::vector<platform::URL>(urls.begin() + begin, urls.begin() + end), probes);
+  }
+  return probes;
+}
+
+void RCMediaWorkerClient::probeBatch(const std::vector<platform::URL>& urls,
+                                     std::vector<platform::Result<RCMediaProbe>>& probes) {
+  if (urls.size() == 1) {
+    probes.push_back(probe(urls.front()));
+    return;
+  }
+  RCMediaRequest request;
+  request.kind = RCMediaJobKind::ProbeMany;
+  request.urls = urls;
+  const std::size_t first = probes.size();
+  auto reply = run(std::move(request), fmt::format("probing {} files", urls.size()), {},
+                   [&](RCMediaReply&& item) {
+                     if (item.probe) {
+                       probes.push_back(std::move(*item.probe));
+                     } else {
+                       probes.push_back(platform::fail(std::move(*item.error)));
+                     }
+                   });
+  if (reply && reply->kind == RCMediaReply::Kind::Result) return;  // every file answered
+  for (std::size_t index = probes.size() - first; index < urls.size(); ++index) {
+    probes.push_back(probe(urls[index]));
+  }
 }
 
 namespace {

@@ -35,6 +35,19 @@ class FlakyDiskEngine : public testing::DelegatingMediaEngine {
   }
 };
 
+// Remembers the files of every probeMany call.
+class BatchRecordingEngine : public testing::DelegatingMediaEngine {
+ public:
+  std::vector<platform::Result<RCMediaProbe>> probeMany(
+      const std::vector<platform::URL>& urls) override {
+    std::vector<std::string> names;
+    for (const platform::URL& url : urls) names.push_back(url.lastPathComponent());
+    batches.push_back(std::move(names));
+    return DelegatingMediaEngine::probeMany(urls);
+  }
+  std::vector<std::vector<std::string>> batches;
+};
+
 class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
  protected:
   void SetUp() override {
@@ -121,7 +134,8 @@ TEST(PathOrderTest, ShorterFirstThenDigitRunsByValue) {
 // Identical orphans keep the first in path order, a copy of a database
 // recording's file goes, same size with other bytes stays, empty and
 // unplayable files go, other extensions stay, and only files whose sizes
-// collide are digested.
+// collide are digested. The orphans of a size of their own are probed in one
+// batch before the pass, which uses each answer for its own file.
 TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
   tone("Kept.m4a", 1.0);
   model()->insertRecordingWithAudioFile(recordingsPath("Kept.m4a"), 1.0, platform::Date::now());
@@ -140,18 +154,23 @@ TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
   copy("12.flac", "13.flac");
   testing::writeFile(recordingsPath("Empty.m4a"), "");
   testing::writeFile(recordingsPath("Noise.m4a"), std::string(3000, 'x'));
+  tone("Unique.m4a", 1.5);
   copy("Recording.m4a", "Upper.M4A");
   copy("Recording.m4a", "Other.mp3");
   fs::create_directory(recordingsPath("Folder.m4a"));
+  auto engine = std::make_shared<BatchRecordingEngine>();
+  RCMediaEngine::setCurrent(engine);
 
   auto statistics = run();
 
+  EXPECT_EQ(engine->batches, (std::vector<std::vector<std::string>>{{"Noise.m4a", "Unique.m4a"}}));
   std::map<std::string, std::string> recorded = titles();
-  for (const char* stays : {"Kept.m4a", "Same size.m4a", "Recording.m4a", "9.wav", "12.flac"}) {
+  for (const char* stays :
+       {"Kept.m4a", "Same size.m4a", "Recording.m4a", "9.wav", "12.flac", "Unique.m4a"}) {
     EXPECT_TRUE(present(stays)) << stays;
     EXPECT_TRUE(recorded.contains(stays)) << stays;
   }
-  EXPECT_EQ(recorded.size(), 5u);
+  EXPECT_EQ(recorded.size(), 6u);
   for (const char* goes :
        {"Copy of kept.m4a", "Recording 2.m4a", "10.wav", "13.flac", "Empty.m4a", "Noise.m4a"}) {
     EXPECT_FALSE(present(goes)) << goes;
@@ -164,8 +183,8 @@ TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
   EXPECT_EQ(linesContaining("'Noise.m4a' unable to load AVURLAsset"), 1u);
   // Kept, its copy and the changed copy; each identical pair; nothing else.
   EXPECT_EQ(statistics.filesDigested, 9u);
-  EXPECT_EQ(statistics.assetsProbed, 5u);  // the four unique orphans and Noise
-  EXPECT_EQ(statistics.recordingsInserted, 4u);
+  EXPECT_EQ(statistics.assetsProbed, 6u);  // the five unique orphans and Noise
+  EXPECT_EQ(statistics.recordingsInserted, 5u);
 }
 
 // Bundles: one a client names through "..", one recovered into the database

@@ -2,6 +2,7 @@
 // what must survive the trip unchanged.
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <cmath>
 
 #include "Quorvel/errors/RCErrors.h"
@@ -85,6 +86,27 @@ TEST(MediaProtocolTest, RequestsAndRepliesSurviveTheTrip) {
   EXPECT_EQ(reply->probe->titleItems, probe.titleItems);
   EXPECT_DOUBLE_EQ(reply->probe->creationDate->timeIntervalSince1970(), 1577934245.5);
 
+  RCMediaRequest batch;
+  batch.kind = RCMediaJobKind::ProbeMany;
+  batch.urls = {odd, platform::URL::fileURLWithPath("/b.flac")};
+  decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(batch));
+  ASSERT_TRUE(decoded) << decoded.error();
+  EXPECT_EQ(decoded->kind, RCMediaJobKind::ProbeMany);
+  EXPECT_EQ(decoded->urls, batch.urls);
+
+  reply = RCMediaDecodeReply(RCMediaEncodeItem(7, 63, probe));
+  ASSERT_TRUE(reply) << reply.error();
+  EXPECT_EQ(reply->kind, RCMediaReply::Kind::Item);
+  EXPECT_EQ(reply->index, 63u);
+  ASSERT_TRUE(reply->probe);
+  EXPECT_EQ(reply->probe->titleItems, probe.titleItems);
+  reply = RCMediaDecodeReply(
+      RCMediaEncodeItem(7, 1, platform::fail(platform::posixError(ENOENT, "stat /a"))));
+  ASSERT_TRUE(reply) << reply.error();
+  EXPECT_EQ(reply->index, 1u);
+  EXPECT_FALSE(reply->probe);
+  EXPECT_EQ(*reply->error, platform::posixError(ENOENT, ""));
+
   reply = RCMediaDecodeReply(RCMediaEncodeError(
       8, platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorNoMovie, std::string(10000, 'm'))));
   ASSERT_TRUE(reply);
@@ -117,6 +139,17 @@ TEST(MediaProtocolTest, MalformedMessagesAreErrorValues) {
            "\"titles\":[],\"created\":1e300}}",
            "{\"id\":1,\"error\":{\"domain\":\"\",\"code\":1,\"message\":\"\"}}",
            "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1.5,\"message\":\"\"}}",
+           "{\"id\":1,\"item\":[]}",
+           "{\"id\":1,\"item\":{\"result\":{}}}",
+           "{\"id\":1,\"item\":{\"index\":-1,\"error\":{\"domain\":\"d\",\"code\":1,"
+           "\"message\":\"\"}}}",
+           "{\"id\":1,\"item\":{\"index\":64,\"error\":{\"domain\":\"d\",\"code\":1,"
+           "\"message\":\"\"}}}",
+           "{\"id\":1,\"item\":{\"index\":0}}",
+           "{\"id\":1,\"item\":{\"index\":0,\"result\":{}}}",
+           "{\"id\":1,\"item\":{\"index\":0,\"result\":{\"playable\":true,\"duration\":1,"
+           "\"container\":\"\",\"titles\":[],\"created\":null},\"error\":{\"domain\":\"d\","
+           "\"code\":1,\"message\":\"\"}}}",
        }) {
     auto decoded = RCMediaDecodeReply(reply);
     EXPECT_FALSE(decoded) << reply;
@@ -124,7 +157,15 @@ TEST(MediaProtocolTest, MalformedMessagesAreErrorValues) {
       EXPECT_EQ(decoded.error(), RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
     }
   }
-  for (const char* request : {
+  std::string tooMany = "{\"id\":1,\"job\":\"probeMany\",\"urls\":[\"file:///a\"";
+  for (std::size_t i = 1; i <= kRCMediaMaxProbeBatch; ++i) tooMany += ",\"file:///a\"";
+  tooMany += "]}";
+  for (const std::string& request : std::vector<std::string>{
+           tooMany,
+           "{\"id\":1,\"job\":\"probeMany\",\"urls\":[]}",
+           "{\"id\":1,\"job\":\"probeMany\",\"urls\":\"file:///a\"}",
+           "{\"id\":1,\"job\":\"probeMany\",\"urls\":[\"file:///a\",1]}",
+           "{\"id\":1,\"job\":\"probeMany\",\"urls\":[\"/a\"]}",
            "{\"id\":1,\"job\":\"format\",\"url\":\"file:///a\"}",
            "{\"id\":1,\"job\":\"probe\",\"url\":\"http://host/a.m4a\"}",
            "{\"id\":1,\"job\":\"probe\",\"url\":\"/a.m4a\"}",

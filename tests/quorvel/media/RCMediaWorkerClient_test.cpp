@@ -5,12 +5,14 @@
 #include <gtest/gtest.h>
 
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/types.h>
 
 #include <atomic>
 #include <cmath>
 #include <fstream>
 #include <future>
+#include <mutex>
 #include <thread>
 
 #include "Quorvel/composition/RCCompositionController.h"
@@ -144,8 +146,9 @@ TEST_F(MediaWorkerClientTest, EveryJobGivesWhatTheInProcessEngineGives) {
   EXPECT_EQ(recomposed->titleItems, retitled->titleItems);
   EXPECT_EQ(recomposed->creationDate, retitled->creationDate);
 
-  // One job at a time from one thread needs one worker, reused throughout.
-  EXPECT_EQ(worker.client().workerPids().size(), 1u);
+  // One job at a time from one thread needs one worker of each lane (the
+  // probe's, the long jobs'), reused throughout.
+  EXPECT_EQ(worker.client().workerPids().size(), 2u);
 }
 
 TEST_F(MediaWorkerClientTest, ErrorsComeBackWithTheirDomainCodeAndMessage) {
@@ -200,9 +203,118 @@ TEST_F(MediaWorkerClientTest, ErrorsComeBackWithTheirDomainCodeAndMessage) {
     EXPECT_EQ(got.error().code(), expected.error().code());
     EXPECT_EQ(got.error().localizedDescription(), expected.error().localizedDescription());
   }
-  // Errors are answers, not faults: the one worker served every job.
-  EXPECT_EQ(worker.client().workerPids().size(), 1u);
+  // Errors are answers, not faults: one worker of each lane served every job.
+  EXPECT_EQ(worker.client().workerPids().size(), 2u);
   EXPECT_FALSE(fs::exists(out.path()));
+}
+
+// Probes have workers of their own: with both long-job workers stopped in
+// the middle of a compose, a probe is answered at once, and the composing
+// workers run at the lower priority.
+TEST_F(MediaWorkerClientTest, AProbeIsAnsweredWhileBothLongJobWorkersAreHeld) {
+  platform::URL file = tone("short.wav", 0.5);
+  ScopedMediaWorkerEngine worker(options());
+  std::mutex mutex;
+  std::vector<pid_t> held;  // guarded by mutex
+  pid_t prober = 0;         // guarded by mutex
+  std::promise<void> bothHeld;
+  worker.client().setJobObserverForTesting([&](pid_t pid, RCMediaJobKind kind) {
+    std::lock_guard lock(mutex);
+    if (kind == RCMediaJobKind::Probe) {
+      prober = pid;
+      return;
+    }
+    ::kill(pid, SIGSTOP);
+    held.push_back(pid);
+    if (held.size() == 2) bothHeld.set_value();
+  });
+  auto composing = [&](const std::string& name) {
+    platform::URL destination = platform::URL::fileURLWithPath(recordingsPath(name));
+    return std::async(std::launch::async, [&worker, file, destination] {
+      return bool(worker.client().compose({{file, 0, 0.5}}, destination, std::nullopt, {}));
+    });
+  };
+  auto first = composing("One.m4a");
+  auto second = composing("Two.m4a");
+  bothHeld.get_future().wait();
+
+  auto probe = worker.client().probe(file);
+  ASSERT_TRUE(probe) << probe.error();
+  EXPECT_TRUE(probe->playable);
+  EXPECT_EQ(first.wait_for(std::chrono::seconds(0)), std::future_status::timeout);
+  EXPECT_EQ(second.wait_for(std::chrono::seconds(0)), std::future_status::timeout);
+  std::lock_guard lock(mutex);
+  for (pid_t pid : held) ::kill(pid, SIGCONT);
+  EXPECT_TRUE(first.get());
+  EXPECT_TRUE(second.get());
+  // A worker lowers its priority when it starts, which a stopped one had not
+  // yet done; they stay alive, idle, after their jobs.
+  const int own = ::getpriority(PRIO_PROCESS, 0);
+  EXPECT_EQ(::getpriority(PRIO_PROCESS, prober), own);
+  for (pid_t pid : held) EXPECT_EQ(::getpriority(PRIO_PROCESS, pid), std::min(own + 10, 19));
+}
+
+// A batch answers each file as probing it alone does, in order, over
+// several requests; when its worker is killed, the files it had not
+// answered are probed one by one, so every good file still has its answer.
+TEST_F(MediaWorkerClientTest, ABatchAnswersEachFileInOrderWhateverHappensToItsWorker) {
+  ASSERT_TRUE(testing::writeDamagedAudio(recordings_.string()));
+  testing::ToneOptions titled;
+  titled.metadata = {{"title", "Walk"}};
+  const std::vector<platform::URL> kinds = {
+      tone("titled.m4a", titled),
+      platform::URL::fileURLWithPath(recordingsPath("missing.m4a")),
+      platform::URL::fileURLWithPath(recordingsPath("text.m4a")),
+      tone("fine.wav", 0.3),
+      platform::URL::fileURLWithPath(recordingsPath("video.m4a")),
+      platform::URL::fileURLWithPath(recordings_.string()),
+  };
+  std::vector<platform::URL> files;  // more than two requests' worth
+  for (std::size_t i = 0; i < 2 * kRCMediaMaxProbeBatch + 3; ++i) {
+    files.push_back(kinds[i % kinds.size()]);
+  }
+  struct Case {
+    std::string name;
+    int killAtCall;  // of the observer for the first batch: 1 sent, 2 first answer; 0 never
+  };
+  for (const Case& row : std::vector<Case>{{"undisturbed", 0},
+                                           {"killed before answering", 1},
+                                           {"killed after its first answer", 2}}) {
+    SCOPED_TRACE(row.name);
+    ScopedMediaWorkerEngine worker(options());
+    std::atomic<int> batchCalls = 0, singles = 0;
+    worker.client().setJobObserverForTesting([&](pid_t pid, RCMediaJobKind kind) {
+      if (kind == RCMediaJobKind::Probe) ++singles;
+      if (kind != RCMediaJobKind::ProbeMany) return;
+      if (++batchCalls == row.killAtCall) ::kill(pid, SIGKILL);
+    });
+    auto probes = worker.client().probeMany(files);
+
+    ASSERT_EQ(probes.size(), files.size());
+    for (std::size_t i = 0; i < files.size(); ++i) {
+      SCOPED_TRACE(files[i].lastPathComponent() + " at " + std::to_string(i));
+      auto expected = inProcess_.probe(files[i]);
+      ASSERT_EQ(bool(probes[i]), bool(expected));
+      if (expected) {
+        EXPECT_EQ(probes[i]->playable, expected->playable);
+        if (!std::isnan(expected->duration)) {
+          EXPECT_DOUBLE_EQ(probes[i]->duration, expected->duration);
+        }
+        EXPECT_EQ(std::isnan(probes[i]->duration), std::isnan(expected->duration));
+        EXPECT_EQ(probes[i]->titleItems, expected->titleItems);
+      } else {
+        EXPECT_EQ(probes[i].error(), expected.error());
+        EXPECT_EQ(probes[i].error().localizedDescription(),
+                  expected.error().localizedDescription());
+      }
+    }
+    // Undisturbed, every file went in a batch; killed, the rest went alone.
+    if (row.killAtCall == 0) {
+      EXPECT_EQ(singles.load(), 0);
+    } else {
+      EXPECT_GT(singles.load(), 0);
+    }
+  }
 }
 
 TEST_F(MediaWorkerClientTest, AWorkerKilledMidComposeFailsThatJobOnlyAndLeavesNoTemporaryFile) {
