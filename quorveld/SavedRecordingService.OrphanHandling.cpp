@@ -89,6 +89,11 @@ void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
       _onServiceQueueHasActiveSessionsForCompositionAVURL(compositionAVURL, ignored)) {
     return finish();
   }
+  // The common case, a recording whose fragments were read before and
+  // that has nothing to tidy, is decided here at once.
+  if (RCCompositionController::isKnownToHaveNothingToRepairOrCleanUp(compositionAVURL)) {
+    return finish();
+  }
   auto controller =
       RCCompositionController::compositionControllerForComposedAVURL(compositionAVURL);
   if (!controller->composition()) {
@@ -98,8 +103,6 @@ void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
            compositionAVURL.absoluteString());
     return finish();
   }
-  // The common case, a recording whose fragments were read before and
-  // that has nothing to tidy, is decided here at once.
   if (controller->hasNothingToRepairOrCleanUp()) return finish();
 
   // Reading fragments' audio, saving the manifest and deleting files may

@@ -28,6 +28,7 @@
 
 #include <dirent.h>
 #include <sys/stat.h>
+#include <time.h>
 
 #include <cerrno>
 #include <cmath>
@@ -155,6 +156,69 @@ std::unordered_map<std::string, double> readDurations(const std::vector<platform
     read.emplace(unknown[i].path(), durationOf(probes[i]));
   }
   return read;
+}
+
+// Bundles found with nothing to repair or clean up, by composed path, with
+// what they were made of then: the bundle directory (a file added or removed
+// changes it), the manifest (replaced whole on every save) and each
+// fragment file. While none of them changed the bundle is still tidy, which
+// a few stats tell, where loading it reads and parses the manifest and lists
+// the directory; every session open and close asks.
+class TidyBundles {
+ public:
+  struct File {
+    std::string path;
+    DurationCache::Identity identity;
+    friend bool operator==(const File&, const File&) = default;
+  };
+
+  static std::optional<File> fileAt(std::string path) {
+    struct stat info {};
+    if (::lstat(path.c_str(), &info) != 0) return std::nullopt;
+    return File{std::move(path),
+                {info.st_dev, info.st_ino, info.st_size,
+                 std::int64_t{info.st_mtim.tv_sec} * 1'000'000'000 + info.st_mtim.tv_nsec}};
+  }
+
+  bool contains(const std::string& composedPath) {
+    std::vector<File> files;
+    {
+      std::lock_guard lock(mutex_);
+      auto entry = entries_.find(composedPath);
+      if (entry == entries_.end()) return false;
+      files = entry->second;
+    }
+    for (const File& file : files) {
+      if (fileAt(file.path) != file) return false;
+    }
+    return true;
+  }
+  // Remembers the bundle unless a file changed too recently to tell: file
+  // times come from a coarse clock, so a change within the same tick as the
+  // one seen would leave the time as it was.
+  void insert(const std::string& composedPath, std::vector<File> files) {
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME_COARSE, &now);
+    const std::int64_t settled =
+        std::int64_t{now.tv_sec} * 1'000'000'000 + now.tv_nsec - kSettleNanoseconds;
+    for (const File& file : files) {
+      if (file.identity.modifiedNanoseconds >= settled) return;
+    }
+    std::lock_guard lock(mutex_);
+    if (entries_.size() >= kCapacity) entries_.clear();
+    entries_[composedPath] = std::move(files);
+  }
+
+ private:
+  static constexpr std::size_t kCapacity = 1024;
+  static constexpr std::int64_t kSettleNanoseconds = 100'000'000;
+  std::mutex mutex_;
+  std::unordered_map<std::string, std::vector<File>> entries_;
+};
+
+TidyBundles& tidyBundles() {
+  static TidyBundles* bundles = new TidyBundles();  // used until the process ends
+  return *bundles;
 }
 
 // Composing is serialized per bundle, by the bundle directory's identity
@@ -367,9 +431,26 @@ void RCCompositionController::rcs_repairDecomposedFragmentMetadataIfNecessary() 
   if (state_->composition == current) state_->composition = std::move(replacement);
 }
 
+bool RCCompositionController::isKnownToHaveNothingToRepairOrCleanUp(
+    const platform::URL& composedAVURL) {
+  return tidyBundles().contains(composedAVURL.URLByStandardizingPath().path());
+}
+
 bool RCCompositionController::hasNothingToRepairOrCleanUp() const {
   std::shared_ptr<RCComposition> current = composition();
   if (!current) return false;
+  // Taken before the files are read, so a change while they are read shows.
+  std::vector<TidyBundles::File> files;
+  for (const std::string& path :
+       {current->bundleURL().path(),
+        current->bundleURL().path() + "/" + RCCompositionManifest::kFileName}) {
+    if (auto file = TidyBundles::fileAt(path)) files.push_back(std::move(*file));
+  }
+  for (const auto& entry : current->manifest().fragments) {
+    if (auto file = TidyBundles::fileAt(current->URLForFragmentFile(entry.file).path())) {
+      files.push_back(std::move(*file));
+    }
+  }
   bool known = true;
   RCCompositionManifest repaired = repairedManifest(*current, [&](const platform::URL& url) {
     std::optional<double> seconds = cachedFileDuration(url);
@@ -380,7 +461,9 @@ bool RCCompositionController::hasNothingToRepairOrCleanUp() const {
   bool orphans = false;
   current->enumerateOrphanedFragmentsWithBlock(
       [&](const RCCompositionFragment&, bool& stop) { orphans = stop = true; });
-  return !orphans;
+  if (orphans) return false;
+  tidyBundles().insert(current->composedAVURL().path(), std::move(files));
+  return true;
 }
 
 platform::Status RCCompositionController::composeNow(bool deleteFragments, bool composeWaveform) {

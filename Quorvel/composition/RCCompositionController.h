@@ -55,6 +55,10 @@ class RCCompositionController {
   // not allowed. False when the composition did not load, or when telling
   // would need a file's audio read.
   bool hasNothingToRepairOrCleanUp() const;
+  // True when hasNothingToRepairOrCleanUp() said so of the recording before
+  // and neither its bundle directory, its manifest nor a fragment file has
+  // changed since: a few stats, without loading the composition.
+  static bool isKnownToHaveNothingToRepairOrCleanUp(const platform::URL& composedAVURL);
 
   // Composes every fragment's used range, in order, into the composed audio
   // file (and, with composeWaveform, its waveform file beside it), on the
