@@ -321,8 +321,10 @@ void recordComposedDuration(const RCComposition& composition) {
 }
 
 // `duration` gives a file's duration in seconds, NaN when it cannot be read.
+// With `report`, what the repair does is logged.
 template <typename Duration>
-RCCompositionManifest repairedManifest(const RCComposition& composition, Duration&& duration) {
+RCCompositionManifest repairedManifest(const RCComposition& composition, Duration&& duration,
+                                       bool report = true) {
   RCCompositionManifest manifest = composition.manifest();
   std::vector<RCCompositionManifestFragment> kept;
   bool lostComposedAudio = false;
@@ -330,9 +332,11 @@ RCCompositionManifest repairedManifest(const RCComposition& composition, Duratio
     platform::URL url = composition.URLForFragmentFile(entry.file);
     FileState state = fileState(url);
     if (state != FileState::Present) {
-      QV_LOG(platform::kLogLevelNotice, "NOTE: dropping fragment '{}' of {}: its file is {}",
-             entry.file, composition.bundleURL().lastPathComponent(),
-             state == FileState::Missing ? "gone" : "empty");
+      if (report) {
+        QV_LOG(platform::kLogLevelNotice, "NOTE: dropping fragment '{}' of {}: its file is {}",
+               entry.file, composition.bundleURL().lastPathComponent(),
+               state == FileState::Missing ? "gone" : "empty");
+      }
       lostComposedAudio = lostComposedAudio || entry.composed;
       continue;
     }
@@ -343,7 +347,7 @@ RCCompositionManifest repairedManifest(const RCComposition& composition, Duratio
         entry.contentDuration = available;
         entry.composed = false;
       }
-    } else {
+    } else if (report) {
       QV_LOG(platform::kLogLevelError,
              "WARNING: fragment '{}' of {} cannot be read; keeping it so composing reports it",
              entry.file, composition.bundleURL().lastPathComponent());
@@ -452,11 +456,14 @@ bool RCCompositionController::hasNothingToRepairOrCleanUp() const {
     }
   }
   bool known = true;
-  RCCompositionManifest repaired = repairedManifest(*current, [&](const platform::URL& url) {
-    std::optional<double> seconds = cachedFileDuration(url);
-    known = known && seconds.has_value();
-    return seconds.value_or(std::nan(""));
-  });
+  RCCompositionManifest repaired = repairedManifest(
+      *current,
+      [&](const platform::URL& url) {
+        std::optional<double> seconds = cachedFileDuration(url);
+        known = known && seconds.has_value();
+        return seconds.value_or(std::nan(""));
+      },
+      /*report=*/false);
   if (!known || repaired != current->manifest()) return false;
   bool orphans = false;
   current->enumerateOrphanedFragmentsWithBlock(
