@@ -37,6 +37,7 @@
 #include <mutex>
 #include <optional>
 #include <set>
+#include <tuple>
 #include <unordered_map>
 
 #include "Quorvel/composition/RCCaptureFormat.h"
@@ -228,7 +229,9 @@ class BundleLocks {
   struct Key {
     dev_t device;
     ino_t inode;
-    auto operator<=>(const Key&) const = default;
+    friend bool operator<(const Key& a, const Key& b) {
+      return std::tie(a.device, a.inode) < std::tie(b.device, b.inode);
+    }
   };
   // Held while one compose of the bundle runs; waited() tells whether
   // another compose of it ran first.
