@@ -31,6 +31,11 @@ class FinalizationTest : public SessionTest {
     return count;
   }
   bool exists(const platform::URL& url) { return std::filesystem::exists(url.path()); }
+  // Entries of the recordings waiting for a later close to be finalized.
+  std::size_t waitingFinalizations() {
+    return onServiceQueue<std::size_t>(
+        [&] { return service_->compositionAVURLsToFinalizeForTesting().size(); });
+  }
 };
 
 TEST_F(FinalizationTest, AnExportAnswersOnceItsRecordingIsComposedWithItsWaveform) {
@@ -159,17 +164,14 @@ TEST_F(FinalizationTest, EndingAnEditWhoseFinalizationWaitsStartsNoSecondOne) {
   held->count_down();
   auto trimToken = token(trim);
   settle();
-  EXPECT_EQ(onServiceQueue<std::size_t>(
-                [&] { return service_->compositionAVURLsToFinalizeForTesting().size(); }),
-            1u);
+  EXPECT_EQ(waitingFinalizations(), 1u);
   const std::size_t signalsBefore = changeSignals();
   end(":1.2", trimToken);
   settle();
   EXPECT_EQ(linesContaining("Received request to schedule finalization of 'Edit.m4a'").size(), 2u);
   EXPECT_EQ(changeSignals() - signalsBefore, 2u);
   EXPECT_EQ(decomposed(*editor), 0u);
-  EXPECT_TRUE(onServiceQueue<bool>(
-      [&] { return service_->compositionAVURLsToFinalizeForTesting().empty(); }));
+  EXPECT_EQ(waitingFinalizations(), 0u);
   expectNothingLeft();
 }
 
@@ -182,9 +184,7 @@ TEST_F(FinalizationTest, ARequestWhoseClientVanishedBeforeItsReissueLetsTheFinal
   auto capture = token(prepare(":1.1", "PrepareToCapture", name));
   service_->_attemptToRunDeferredFinalizationOfCompositionAVURL(editor->composedAVURL());
   drainServiceQueue();
-  ASSERT_EQ(onServiceQueue<std::size_t>(
-                [&] { return service_->compositionAVURLsToFinalizeForTesting().size(); }),
-            1u);
+  ASSERT_EQ(waitingFinalizations(), 1u);
 
   // The queue runs: the close's first step, the preview's deferral, the
   // cleanup (which queues the final step) and then `marker`, which lets
@@ -207,8 +207,7 @@ TEST_F(FinalizationTest, ARequestWhoseClientVanishedBeforeItsReissueLetsTheFinal
   marker->count_down();
   settle();
   EXPECT_EQ(linesContaining("Not opening 'preview' access session").size(), 1u);
-  EXPECT_TRUE(onServiceQueue<bool>(
-      [&] { return service_->compositionAVURLsToFinalizeForTesting().empty(); }));
+  EXPECT_EQ(waitingFinalizations(), 0u);
   EXPECT_EQ(decomposed(*editor), 0u);
   expectNothingLeft();
 }
