@@ -28,6 +28,7 @@
 #include "platform/Log.h"
 #include "platform/OperationQueue.h"
 #include "quorveld/RCSAdditions.h"
+#include "quorveld/RCSXPCTransaction.h"
 #include "quorveld/SavedRecordingService.h"
 
 namespace quorvel {
@@ -112,6 +113,11 @@ void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
   // into the bundle while it is tidied.
   _fragmentCleanupsInProgress.emplace(bundle,
                                       FragmentCleanup{.compositionAVURL = compositionAVURL});
+  // Keeps the daemon alive while it reads and deletes, also when no session
+  // asked (a released hold).
+  auto keepAlive = RCSXPCTransaction::initWithName("Fragment cleanup of " +
+                                                   compositionAVURL.lastPathComponent());
+  keepAlive->beginTransaction();
   auto tidy = std::make_shared<platform::BlockOperation>([controller] {
     controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
     auto repaired = controller->composition();
@@ -128,17 +134,18 @@ void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
   // Holds the service weakly, and hands its reference on: the operation
   // queue is the service's own, and must not be destroyed from one of its
   // threads.
-  tidy->setCompletionBlock(
-      [weak = weak_from_this(), bundle, completion = std::move(completion)]() mutable {
-        auto self = weak.lock();
-        if (!self) return;
-        SavedRecordingService* service = self.get();
-        service->_performOnServiceQueue(
-            [self = std::move(self), bundle, completion = std::move(completion)]() mutable {
-              self->_onQueueFinishFragmentCleanup(bundle, std::move(completion));
-            },
-            WorkLength::Short);
-      });
+  tidy->setCompletionBlock([weak = weak_from_this(), bundle, keepAlive,
+                            completion = std::move(completion)]() mutable {
+    auto self = weak.lock();
+    if (!self) return keepAlive->endTransaction();
+    SavedRecordingService* service = self.get();
+    service->_performOnServiceQueue(
+        [self = std::move(self), bundle, keepAlive, completion = std::move(completion)]() mutable {
+          self->_onQueueFinishFragmentCleanup(bundle, std::move(completion));
+          keepAlive->endTransaction();
+        },
+        WorkLength::Short);
+  });
   _fragmentCleanupOperationQueue->addOperation(std::move(tidy));
 }
 
