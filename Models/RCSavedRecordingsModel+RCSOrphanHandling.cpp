@@ -54,6 +54,7 @@
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCFileCreationDate.h"
+#include "Quorvel/files/RCFileVersion.h"
 #include "Quorvel/locale/RCLocalizedRecordingDate.h"
 #include "Quorvel/locale/RCPreferredLanguages.h"
 #include "Quorvel/media/RCAudioAsset.h"
@@ -76,12 +77,6 @@ struct Identity {
     return std::tie(a.device, a.inode) < std::tie(b.device, b.inode);
   }
 };
-
-// Whether two lstat results are of the same, unchanged file.
-bool sameContents(const struct stat& a, const struct stat& b) {
-  return a.st_dev == b.st_dev && a.st_ino == b.st_ino && a.st_size == b.st_size &&
-         a.st_mtim.tv_sec == b.st_mtim.tv_sec && a.st_mtim.tv_nsec == b.st_mtim.tv_nsec;
-}
 
 double secondsSince(const struct timespec& time) {
   return platform::Date::now().timeIntervalSince1970() - double(time.tv_sec) -
@@ -536,9 +531,10 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
 
     ++statistics_.assetsProbed;
     auto batched = probed.find(url.path());
-    auto examined = batched != probed.end() && sameContents(listed.info, now.info)
-                        ? RCAudioAsset::examineAssetWithProbe(url, std::move(batched->second))
-                        : RCAudioAsset::examineAssetWithURL(url);
+    auto examined =
+        batched != probed.end() && RCFileVersion::of(listed.info) == RCFileVersion::of(now.info)
+            ? RCAudioAsset::examineAssetWithProbe(url, std::move(batched->second))
+            : RCAudioAsset::examineAssetWithURL(url);
     if (!examined) {
       ORPHAN_LOG("Orphaned composed AVURL: '{}' could not be examined ({}); leaving it", name,
                  examined.error());

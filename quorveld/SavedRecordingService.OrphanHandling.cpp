@@ -76,12 +76,11 @@ void SavedRecordingService::_onQueueCleanUpOrphanedFragments(
     if (completion) completion();
   };
   const std::string bundle = compositionAVURL.URLByStandardizingPath().path();
-  if (auto running = _fragmentCleanupsInProgress.find(bundle);
-      running != _fragmentCleanupsInProgress.end()) {
+  if (auto* waiting = _onQueueWorkWaitingForFragmentCleanup(bundle)) {
     // Decided afresh once the running one has finished: holds and sessions
     // may have changed by then.
-    running->second.waiting.push_back([this, compositionAVURL, ignored = std::move(ignored),
-                                       completion = std::move(completion)]() mutable {
+    waiting->push_back([this, compositionAVURL, ignored = std::move(ignored),
+                        completion = std::move(completion)]() mutable {
       _onQueueCleanUpOrphanedFragments(compositionAVURL, std::move(ignored), std::move(completion));
     });
     return;
@@ -158,12 +157,11 @@ void SavedRecordingService::_onQueueFinishFragmentCleanup(const std::string& bun
   for (WorkBlock& next : done.mapped().waiting) next();
 }
 
-void SavedRecordingService::_onQueueAfterFragmentCleanupOfCompositionAVURL(
-    const platform::URL& compositionAVURL, WorkBlock block) {
+std::vector<SavedRecordingService::WorkBlock>*
+SavedRecordingService::_onQueueWorkWaitingForFragmentCleanup(const std::string& bundle) {
   QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
-  auto running = _fragmentCleanupsInProgress.find(compositionAVURL.URLByStandardizingPath().path());
-  if (running == _fragmentCleanupsInProgress.end()) return block();
-  running->second.waiting.push_back(std::move(block));
+  auto running = _fragmentCleanupsInProgress.find(bundle);
+  return running == _fragmentCleanupsInProgress.end() ? nullptr : &running->second.waiting;
 }
 
 void SavedRecordingService::_addDisabledOrphanCleanupForCompositionAVURL(
@@ -185,9 +183,12 @@ void SavedRecordingService::_addDisabledOrphanCleanupForCompositionAVURL(
         if (!completion) return;
         // A cleanup of the recording that started before the hold may still be
         // deleting: the client hears that the hold stands only once it is done.
-        if (!url) return completion(std::nullopt);
-        _onQueueAfterFragmentCleanupOfCompositionAVURL(
-            *url, [completion = std::move(completion)]() mutable { completion(std::nullopt); });
+        auto* waiting =
+            url ? _onQueueWorkWaitingForFragmentCleanup(url->URLByStandardizingPath().path())
+                : nullptr;
+        if (!waiting) return completion(std::nullopt);
+        waiting->push_back(
+            [completion = std::move(completion)]() mutable { completion(std::nullopt); });
       },
       WorkLength::Short);
 }

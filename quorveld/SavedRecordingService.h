@@ -299,10 +299,9 @@ class SavedRecordingService final : public platform::ListenerDelegate,
                                         std::shared_ptr<AssetAccessSession> ignored,
                                         WorkBlock completion);
   void _onQueueFinishFragmentCleanup(const std::string& bundle, WorkBlock completion);
-  // Runs `block` now, or once the recording's running fragment cleanup has
-  // finished.
-  void _onQueueAfterFragmentCleanupOfCompositionAVURL(const platform::URL& compositionAVURL,
-                                                      WorkBlock block);
+  // What waits for the running fragment cleanup of `bundle` (a standardized
+  // composed path), to run in order when it ends; nullptr when none runs.
+  std::vector<WorkBlock>* _onQueueWorkWaitingForFragmentCleanup(const std::string& bundle);
   // The work that waited for a session of the recording to close: its
   // deferred access request, else its waiting finalization. True when it
   // started the waiting finalization.

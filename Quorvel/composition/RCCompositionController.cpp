@@ -45,6 +45,7 @@
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCFileVersion.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioAsset.h"
 #include "Quorvel/media/RCMediaEngine.h"
@@ -71,36 +72,28 @@ FileState fileState(const platform::URL& url) {
   return FileState::Present;
 }
 
-// Durations already read, by file identity. Every session that opens or
+// Durations already read, by file version. Every session that opens or
 // closes on a recording repairs it, and reading a duration is a media job
 // (in the daemon, a round trip to its worker); a fragment file does not
 // change once captured, and one that does gets a new size or mtime.
 class DurationCache {
  public:
-  struct Identity {
-    dev_t device;
-    ino_t inode;
-    off_t size;
-    std::int64_t modifiedNanoseconds;
-    friend bool operator==(const Identity&, const Identity&) = default;
-  };
-
-  std::optional<double> find(const std::string& path, const Identity& identity) {
+  std::optional<double> find(const std::string& path, const RCFileVersion& version) {
     std::lock_guard lock(mutex_);
     auto entry = entries_.find(path);
-    if (entry == entries_.end() || !(entry->second.first == identity)) return std::nullopt;
+    if (entry == entries_.end() || !(entry->second.first == version)) return std::nullopt;
     return entry->second.second;
   }
-  void insert(const std::string& path, const Identity& identity, double duration) {
+  void insert(const std::string& path, const RCFileVersion& version, double duration) {
     std::lock_guard lock(mutex_);
     if (entries_.size() >= kCapacity) entries_.clear();
-    entries_[path] = {identity, duration};
+    entries_[path] = {version, duration};
   }
 
  private:
   static constexpr std::size_t kCapacity = 4096;
   std::mutex mutex_;
-  std::unordered_map<std::string, std::pair<Identity, double>> entries_;
+  std::unordered_map<std::string, std::pair<RCFileVersion, double>> entries_;
 };
 
 DurationCache& durationCache() {
@@ -108,25 +101,23 @@ DurationCache& durationCache() {
   return *cache;
 }
 
-std::optional<DurationCache::Identity> identityOf(const platform::URL& url) {
+// The version of the regular file `url` names (following links).
+std::optional<RCFileVersion> versionOf(const platform::URL& url) {
   struct stat info {};
   if (::stat(url.path().c_str(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
-  return DurationCache::Identity{
-      info.st_dev, info.st_ino, info.st_size,
-      std::int64_t{info.st_mtim.tv_sec} * 1'000'000'000 + info.st_mtim.tv_nsec};
+  return RCFileVersion::of(info);
 }
 
 // The file's duration when it was read before and the file has not changed.
 std::optional<double> cachedFileDuration(const platform::URL& url) {
-  auto identity = identityOf(url);
-  return identity ? durationCache().find(url.path(), *identity) : std::nullopt;
+  auto version = versionOf(url);
+  return version ? durationCache().find(url.path(), *version) : std::nullopt;
 }
 
 void rememberDuration(const platform::URL& url, const platform::Result<RCMediaProbe>& probe) {
   // Only what was read is kept: a failure may be passing (a worker that died).
   if (!probe || !probe->playable || !std::isfinite(probe->duration)) return;
-  if (auto identity = identityOf(url))
-    durationCache().insert(url.path(), *identity, probe->duration);
+  if (auto version = versionOf(url)) durationCache().insert(url.path(), *version, probe->duration);
 }
 
 double durationOf(const platform::Result<RCMediaProbe>& probe) {
@@ -169,16 +160,14 @@ class TidyBundles {
  public:
   struct File {
     std::string path;
-    DurationCache::Identity identity;
+    RCFileVersion version;
     friend bool operator==(const File&, const File&) = default;
   };
 
   static std::optional<File> fileAt(std::string path) {
-    struct stat info {};
-    if (::lstat(path.c_str(), &info) != 0) return std::nullopt;
-    return File{std::move(path),
-                {info.st_dev, info.st_ino, info.st_size,
-                 std::int64_t{info.st_mtim.tv_sec} * 1'000'000'000 + info.st_mtim.tv_nsec}};
+    auto version = RCFileVersion::atPath(path);
+    if (!version) return std::nullopt;
+    return File{std::move(path), *version};
   }
 
   bool contains(const std::string& composedPath) {
@@ -203,7 +192,7 @@ class TidyBundles {
     const std::int64_t settled =
         std::int64_t{now.tv_sec} * 1'000'000'000 + now.tv_nsec - kSettleNanoseconds;
     for (const File& file : files) {
-      if (file.identity.modifiedNanoseconds >= settled) return;
+      if (file.version.modifiedNanoseconds >= settled) return;
     }
     std::lock_guard lock(mutex_);
     if (entries_.size() >= kCapacity) entries_.clear();
