@@ -42,14 +42,21 @@ class ResponsivenessTest : public SessionTest {
  protected:
   std::shared_ptr<platform::Listener> makeListener(
       const std::string& serviceName, platform::InterfaceDescription interface) override {
-    return std::make_shared<platform::BusListener>(
+    busListener_ = std::make_shared<platform::BusListener>(
         platform::BusListenerOptions{.busAddress = bus_.address(),
                                      .serviceName = serviceName,
                                      .objectPath = RCSSavedRecordingServiceObjectPath},
         std::move(interface));
+    return busListener_;
   }
   void TearDown() override {
     engine_->gate.update([&] { engine_->released = true; });
+    // The clients' disconnections reach the bus thread at some time after
+    // the test body; stopping the listener first ends what they started, so
+    // settling finds it all queued and no bus-thread block outlives the
+    // service.
+    if (busListener_) busListener_->stop();
+    busListener_.reset();
     SessionTest::TearDown();
     RCUseInProcessMediaEngine();
   }
@@ -73,6 +80,7 @@ class ResponsivenessTest : public SessionTest {
   }
 
   platform::testing::TestBus bus_;
+  std::shared_ptr<platform::BusListener> busListener_;
   std::shared_ptr<StuckProbeEngine> engine_ = [] {
     auto engine = std::make_shared<StuckProbeEngine>();
     RCMediaEngine::setCurrent(engine);
