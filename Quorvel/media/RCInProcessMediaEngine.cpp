@@ -163,7 +163,12 @@ platform::Result<RCMediaProbe> RCInProcessMediaEngine::probe(const platform::URL
   }
   if (!titlesRead) probe.titleItems = titlesFromDictionary(dictionary);
 
-  if (avformat_find_stream_info(input->get(), nullptr) < 0) {
+  if (const int status = avformat_find_stream_info(input->get(), nullptr); status < 0) {
+    // Running out of memory or a read error says nothing about the file;
+    // only what libavformat read and could not make sense of does.
+    if (isSystemError(status)) {
+      return platform::fail(platform::posixError(AVUNERROR(status), "read " + path));
+    }
     QV_LOG(platform::kLogLevelDebug, "{} is not playable: no stream information",
            url.lastPathComponent());
     return probe;
