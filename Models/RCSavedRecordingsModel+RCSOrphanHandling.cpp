@@ -30,6 +30,11 @@
 // whose digest or audio could not be read is left where it is, with a line
 // saying why; only a file that the media engine read and found without
 // playable audio, or without a positive duration, is deleted as unplayable.
+// And only once settled (RCRemoveSettledFile): a file someone is still
+// copying in, or that changed since it was listed, waits for the next run.
+// Each thing the run keeps for its safety gets one line saying why. A write
+// that fails (the disk may be full) stops the run before anything more is
+// removed.
 #include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
 
 #include <dirent.h>
@@ -55,6 +60,7 @@
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCFileCreationDate.h"
 #include "Quorvel/files/RCFileVersion.h"
+#include "Quorvel/files/RCSettledFileRemoval.h"
 #include "Quorvel/locale/RCLocalizedRecordingDate.h"
 #include "Quorvel/locale/RCPreferredLanguages.h"
 #include "Quorvel/media/RCAudioAsset.h"
@@ -121,8 +127,7 @@ class RCSOrphanHandling::FileManager {
   bool directoryResolved() const { return !resolvedDirectory_.empty(); }
 
   // The standardized path of `url`, in the directory's own spelling when
-  // its parent is the directory reached another way. Paths elsewhere are
-  // remembered: the listing does not size them.
+  // its parent is the directory reached another way.
   std::string canonicalPath(const platform::URL& url) { return canonicalPath(url.path()); }
   std::string canonicalPath(std::string_view file) {
     std::string path = RCURLSet::standardizedPath(file);
@@ -137,10 +142,8 @@ class RCSOrphanHandling::FileManager {
       std::free(resolved);
     }
     if (found->second) return directory_ + path.substr(slash);
-    elsewhere_.push_back(path);
     return path;
   }
-  const std::vector<std::string>& elsewhere() const { return elsewhere_; }
 
   // Lists the directory: one lstat per entry, and whether `inUse` holds it.
   // A directory that cannot be listed gives no entries.
@@ -166,6 +169,29 @@ class RCSOrphanHandling::FileManager {
     return urls;
   }
 
+  // Whether the directory finds its entries under other letter cases too:
+  // one listed name, its letters' case swapped, leads to the same file.
+  bool foldsCase() {
+    if (foldsCase_) return *foldsCase_;
+    foldsCase_ = false;
+    for (const auto& [name, entry] : entries_) {
+      std::string swapped = name;
+      for (char& c : swapped) {
+        if (c >= 'a' && c <= 'z') {
+          c = char(c - 'a' + 'A');
+        } else if (c >= 'A' && c <= 'Z') {
+          c = char(c - 'A' + 'a');
+        }
+      }
+      if (swapped == name || !entry.exists) continue;
+      Entry other = lstatNow(directory_ + "/" + swapped);
+      foldsCase_ = other.exists && other.info.st_dev == entry.info.st_dev &&
+                   other.info.st_ino == entry.info.st_ino;
+      break;
+    }
+    return *foldsCase_;
+  }
+
   // What the listing saw of `path`, or a fresh lstat for a file elsewhere.
   Entry entryFor(std::string_view path) const {
     const std::size_t slash = path.rfind('/');
@@ -180,6 +206,12 @@ class RCSOrphanHandling::FileManager {
   static Entry lstatNow(const std::string& path) {
     Entry entry;
     entry.exists = ::lstat(path.c_str(), &entry.info) == 0;
+    return entry;
+  }
+  // The file `path` names, through links.
+  static Entry statNow(const std::string& path) {
+    Entry entry;
+    entry.exists = ::stat(path.c_str(), &entry.info) == 0;
     return entry;
   }
 
@@ -198,7 +230,7 @@ class RCSOrphanHandling::FileManager {
   std::string resolvedDirectory_;
   std::unordered_map<std::string, bool> resolvedParents_;
   std::unordered_map<std::string, Entry> entries_;
-  std::vector<std::string> elsewhere_;
+  std::optional<bool> foldsCase_;
 };
 
 // ---- title and date ----
@@ -262,6 +294,7 @@ void RCSOrphanHandling::performOrphanRecoveryAndCleanupWithExternallyInUseCompos
       "performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs: checking for orphaned "
       "recordings.");
   statistics_ = {};
+  stopped_ = false;
   FileManager fileManager(model_.directory());
   std::vector<platform::URL> handedIn;
   handedIn.reserve(externallyInUseComposedAVURLs.size());
@@ -293,7 +326,7 @@ void RCSOrphanHandling::performOrphanRecoveryAndCleanupWithExternallyInUseCompos
                                                                           listing);
     _performOrphanRecoveryAndCleanupOfBareAssetsWithInUseComposedAVURLs(*inUse, fileManager,
                                                                         listing);
-    removeStaleTemporaryFiles(fileManager);
+    if (!stopped_) removeStaleTemporaryFiles(fileManager);
   }
   ORPHAN_LOG("performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs: done.");
 }
@@ -311,6 +344,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfCompositionsWithInUseC
     RCURLSet& inUse, FileManager& fileManager,
     const std::vector<platform::URL>& URLsInSavedRecordingsDirectory) {
   for (const platform::URL& bundleURL : URLsInSavedRecordingsDirectory) {
+    if (stopped_) return;
     if (bundleURL.pathExtension() != RCComposition::kBundleExtension) continue;
     const std::string name = bundleURL.lastPathComponent();
     auto loaded = RCComposition::load(bundleURL);
@@ -328,8 +362,12 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfCompositionsWithInUseC
       // its capture session: a young bundle waits for the next run, and the
       // database is asked again right before the removal.
       Entry entry = fileManager.entryFor(bundleURL.path());
-      if (secondsSince(entry.info.st_mtim) < kMinimumBundleAge ||
-          databaseNames(composedAVURL, composition->savedRecordingURI())) {
+      if (secondsSince(entry.info.st_mtim) < kMinimumBundleAge) {
+        ORPHAN_LOG("Leaving composition ({}) alone: it holds no audio yet but is new", name);
+        continue;
+      }
+      if (databaseNames(composedAVURL, composition->savedRecordingURI())) {
+        ORPHAN_LOG("Leaving composition ({}) alone: the database names its recording", name);
         continue;
       }
       ORPHAN_LOG("Found orphaned composition ({}) with no assets, deleting it.", name);
@@ -337,7 +375,8 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfCompositionsWithInUseC
       continue;
     }
     if (databaseNames(composedAVURL, composition->savedRecordingURI())) {
-      inUse.addURL(composedAVURL);
+      ORPHAN_LOG("Leaving composition ({}) alone: the database names its recording", name);
+      inUse.addPath(fileManager.canonicalPath(composedAVURL));
       continue;
     }
     ORPHAN_LOG(
@@ -367,39 +406,51 @@ void RCSOrphanHandling::recoverComposition(RCURLSet& inUse, FileManager& fileMan
     }
     repaired->setSavedRecordingURIFromRecoveredRecordingURI(recording->URIRepresentation());
   });
+  inUse.addPath(fileManager.canonicalPath(composedAVURL));
   if (auto saved = repaired->saveMetadataToDefaultLocation(); !saved) {
-    ORPHAN_LOG("ERROR: cannot save the metadata of {}: {}",
-               repaired->bundleURL().lastPathComponent(), saved.error());
+    stop("cannot save the metadata of " + repaired->bundleURL().lastPathComponent() + ": " +
+         saved.error().description());
   }
   if (auto saved = model_.saveIfNecessary(); !saved) {
-    ORPHAN_LOG("ERROR: cannot save the recordings database: {}", saved.error());
+    stop("cannot save the recordings database: " + saved.error().description());
   } else {
     ++statistics_.recordingsInserted;
   }
-  inUse.addPath(fileManager.canonicalPath(composedAVURL));
 }
 
 void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseComposedAVURLs(
     RCURLSet& inUse, FileManager& fileManager,
     const std::vector<platform::URL>& URLsInSavedRecordingsDirectory) {
+  if (stopped_) return;
   std::unordered_map<std::string, RCMD5Digest> digestCache;
 
   // In-use files by size (existing regular files only: a member that is not
-  // there has size 0, which no candidate reaches the comparison with) and
-  // by identity. Members in the directory are sized from the listing.
+  // there has size 0, which no candidate reaches the comparison with) and by
+  // identity, from every member of the set as it stands now, the composed
+  // files the composition pass recovered included. A member the listing
+  // holds under its very name is known from the listing, unless it is a
+  // link; any other is looked at with stat, which follows links and finds
+  // the file a case-folding file system lists under another spelling (on
+  // any other, a name the listing does not hold is not there, and tens of
+  // thousands of members named in formats they were never saved in cost
+  // nothing).
   std::unordered_multimap<std::uint64_t, std::string> inUseBySize;
   std::set<Identity> inUseIdentities;
   auto noteInUse = [&](const std::string& path, const struct stat& info) {
     inUseIdentities.insert(Identity{info.st_dev, info.st_ino});
     if (S_ISREG(info.st_mode) && info.st_size > 0) inUseBySize.emplace(info.st_size, path);
   };
-  const std::string prefix = fileManager.directory() + "/";
-  for (const auto& [name, entry] : fileManager.entries()) {
-    if (entry.inUse) noteInUse(prefix + name, entry.info);
+  for (const std::string& path : inUse.paths()) {
+    Entry entry = fileManager.entryFor(path);
+    if (S_ISLNK(entry.info.st_mode) || (!entry.exists && fileManager.foldsCase())) {
+      entry = FileManager::statNow(path);
+    }
+    if (entry.exists) noteInUse(path, entry.info);
   }
-  for (const std::string& path : fileManager.elsewhere()) {
-    if (Entry entry = FileManager::lstatNow(path); entry.exists) noteInUse(path, entry.info);
-  }
+  auto forgetInUse = [&](const std::string& path) {
+    std::erase_if(inUseBySize, [&](const auto& member) { return member.second == path; });
+    digestCache.erase(path);
+  };
 
   // Path order. Every entry lies in the directory, so the names decide.
   struct Keyed {
@@ -426,25 +477,53 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
     if (digest && *digest) digestCache.emplace(path, **digest);
     return digest;
   };
-  auto remove = [&](const platform::URL& url) {
-    if (fileManager.remove(url)) ++statistics_.itemsDeleted;
-  };
   auto lastComponent = [](std::string_view path) { return path.substr(path.rfind('/') + 1); };
 
-  // The listing's entry of a bare orphan the pass looks at.
-  auto orphanEntry = [&](const platform::URL& url) -> std::optional<Entry> {
+  // The listing's entry of a bare orphan the pass looks at; nullopt for
+  // anything else. What has an audio name nobody uses but is no regular
+  // file of its own stays, and `keptBecause` says why.
+  auto orphanEntry = [&](const platform::URL& url,
+                         const char** keptBecause = nullptr) -> std::optional<Entry> {
     Entry listed = fileManager.entryFor(url.path());
-    if (listed.inUse || !RCCaptureFormat::isFileExtensionSupported(url.pathExtension()) ||
+    if (listed.inUse || !listed.exists ||
+        !RCCaptureFormat::isFileExtensionSupported(url.pathExtension()) ||
         inUse.containsPath(url.path())) {
       return std::nullopt;
     }
-    // Only regular files: a link, a directory or a device is not a bare
-    // recording, and the very same file as an in-use one is in use.
-    if (!listed.exists || !S_ISREG(listed.info.st_mode) ||
-        inUseIdentities.contains(Identity{listed.info.st_dev, listed.info.st_ino})) {
+    const char* why = nullptr;
+    if (S_ISLNK(listed.info.st_mode)) {
+      why = "it is a symbolic link";
+    } else if (!S_ISREG(listed.info.st_mode)) {
+      why = "it is not a regular file";
+    } else if (inUseIdentities.contains(Identity{listed.info.st_dev, listed.info.st_ino})) {
+      why = "it is the same file as one in use";
+    }
+    if (why) {
+      if (keptBecause) *keptBecause = why;
       return std::nullopt;
     }
     return listed;
+  };
+
+  // Deletes an orphan only when it is settled: still as listed, open in no
+  // other process, and still unknown to the database.
+  auto removeOrphan = [&](const platform::URL& url, const std::string& name, const Entry& listed) {
+    auto removal =
+        RCRemoveSettledFile(fileManager.directory(), name, RCFileVersion::of(listed.info),
+                            kMinimumUnleasedFileAge, [&] { return !databaseNames(url, {}); });
+    if (!removal) {
+      ORPHAN_LOG("Orphaned composed AVURL: '{}' could not be removed: {}", name, removal.error());
+      return false;
+    }
+    if (*removal == RCSettledRemoval::Removed) {
+      ++statistics_.itemsDeleted;
+      return true;
+    }
+    if (*removal != RCSettledRemoval::Missing) {
+      ORPHAN_LOG("Orphaned composed AVURL: '{}' {}; leaving it for the next run", name,
+                 RCSettledRemovalDescription(*removal));
+    }
+    return false;
   };
 
   // The orphans of a size of their own, probed at once (see the top).
@@ -471,11 +550,16 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
   }
 
   for (const Keyed& item : keyed) {
+    if (stopped_) return;
     const platform::URL& url = *item.url;
-    std::optional<Entry> orphan = orphanEntry(url);
-    if (!orphan) continue;
-    const Entry& listed = *orphan;
     const std::string& name = item.name;
+    const char* keptBecause = nullptr;
+    std::optional<Entry> orphan = orphanEntry(url, &keptBecause);
+    if (!orphan) {
+      if (keptBecause) ORPHAN_LOG("Leaving '{}' alone: {}", name, keptBecause);
+      continue;
+    }
+    const Entry& listed = *orphan;
     ORPHAN_LOG("Found orphaned composed AVURL: '{}'", name);
 
     // The duplicate test, sizes first.
@@ -519,7 +603,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
           "Orphaned composed AVURL: '{}' already has a duplicate in database or unsynced "
           "assets manifest.  Deleting!",
           name);
-      remove(url);
+      removeOrphan(url, name, listed);
       continue;
     }
     inUse.addPath(url.path());
@@ -542,12 +626,14 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
     }
     std::shared_ptr<RCAudioAsset> asset = *examined;
     // Read, and found without playable audio or without length: deleted.
+    // Its name stays in the in-use set, but an identical orphan later in the
+    // pass finds no file to match and is judged on its own.
     auto deleteUnplayable = [&] {
       ORPHAN_LOG(
           "Orphaned composed AVURL: '{}' unable to insert orphaned asset into database.  "
           "Deleting!",
           name);
-      remove(url);
+      if (removeOrphan(url, name, listed)) forgetInUse(url.path());
     };
     if (!asset) {
       ORPHAN_LOG("Orphaned composed AVURL: '{}' unable to load AVURLAsset", name);
@@ -575,11 +661,16 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
                  recording->customLabel());
     });
     if (auto saved = model_.saveIfNecessary(); !saved) {
-      ORPHAN_LOG("ERROR: cannot save the recordings database: {}", saved.error());
+      stop("cannot save the recordings database: " + saved.error().description());
     } else {
       ++statistics_.recordingsInserted;
     }
   }
+}
+
+void RCSOrphanHandling::stop(const std::string& why) {
+  ORPHAN_LOG("ERROR: {}; stopping here, without removing anything more.", why);
+  stopped_ = true;
 }
 
 void RCSOrphanHandling::removeStaleTemporaryFiles(FileManager& fileManager) {

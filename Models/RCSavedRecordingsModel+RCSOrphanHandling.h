@@ -62,6 +62,10 @@ class RCSOrphanHandling {
   // leftover of an interrupted atomic replace before it is removed.
   static constexpr double kMinimumBundleAge = 60;
   static constexpr double kMinimumTempFileAge = 3600;
+  // Where the kernel cannot say whether another process has an orphan open
+  // (no lease on this file system, or a file of another owner), how long it
+  // must have been left unchanged before it may be deleted.
+  static constexpr double kMinimumUnleasedFileAge = 60;
 
   explicit RCSOrphanHandling(RCSavedRecordingsModel& model);
   RCSOrphanHandling(const RCSOrphanHandling&) = delete;
@@ -100,9 +104,13 @@ class RCSOrphanHandling {
                           const std::shared_ptr<class RCComposition>& composition);
   void removeStaleTemporaryFiles(FileManager& fileManager);
   bool databaseNames(const platform::URL& composedAVURL, const std::string& recordingURI);
+  // Ends the run after a failed write: the database or a bundle could not
+  // take a change, and the disk may be full. Nothing more is removed.
+  void stop(const std::string& why);
 
   RCSavedRecordingsModel& model_;
   Statistics statistics_;
+  bool stopped_ = false;
 };
 
 }  // namespace quorvel

@@ -49,6 +49,9 @@ class RCURLSet {
   // A snapshot of the members in standardized form: later additions do not
   // change it.
   std::set<platform::URL> URLs() const;
+  // The members as standardized paths, without copying; invalidated by the
+  // next addition.
+  const std::unordered_set<std::string>& paths() const { return _set; }
   std::size_t count() const { return _set.size(); }
 
   // `path` with "." and ".." segments and repeated separators resolved.

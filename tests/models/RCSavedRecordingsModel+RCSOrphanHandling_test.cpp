@@ -3,8 +3,12 @@
 // what goes, what is inserted with which title, and what is digested.
 #include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -46,6 +50,23 @@ class BatchRecordingEngine : public testing::DelegatingMediaEngine {
     return DelegatingMediaEngine::probeMany(urls);
   }
   std::vector<std::vector<std::string>> batches;
+};
+
+// While it reads a file whose name starts with "Growing", appends to it (a
+// copy still coming in); one starting with "Replaced", renames another file
+// over it (a sync tool's atomic replace).
+class BusyDirectoryEngine : public testing::DelegatingMediaEngine {
+ public:
+  platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
+    const std::string name = url.lastPathComponent();
+    if (name.starts_with("Growing")) {
+      testing::writeFile(url.path(), testing::readFile(url.path()) + "more");
+    } else if (name.starts_with("Replaced")) {
+      testing::writeFile(url.path() + ".new", std::string(3400, 'r'));
+      fs::rename(url.path() + ".new", url.path());
+    }
+    return DelegatingMediaEngine::probe(url);
+  }
 };
 
 class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
@@ -253,6 +274,89 @@ TEST_F(OrphanHandlingTest, NeverDeletesWhatItCouldNotProveOrphaned) {
   EXPECT_EQ(titles().size(), 1u);
   EXPECT_EQ(linesContaining("'Only.m4a'"), 0u);
   EXPECT_EQ(linesContaining("'Flaky.m4a' could not be examined"), 1u);
+}
+
+// What the run finds open, changing, or no file of its own stays, each with
+// one line saying why; copies of files that stay go, be they recovered with
+// their bundle or reached through a link out of the directory; a deleted
+// unplayable file is matched by no later orphan.
+TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy) {
+  const std::string take = (root_ / "take.wav").string();
+  ASSERT_TRUE(testing::writeTone(take, 1.0, "wav"));
+  auto alpha = RCCompositionEditor::createCompositionForNewRecording(*model(), "Alpha");
+  ASSERT_TRUE(alpha) << alpha.error();
+  ASSERT_TRUE(alpha->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take)));
+  forgetDatabase();
+  tone("Alpha.m4a", 1.0, 550);
+  copy("Alpha.m4a", "Beta.m4a");
+  tone("Kept.m4a", 1.0);
+  testing::writeFile(recordingsPath("Target.m4a"), std::string(3000, 't'));
+  fs::create_symlink(recordingsPath("Target.m4a"), recordingsPath("Member.m4a"));
+  testing::ToneOptions outside;
+  outside.frequencyHz = 660;
+  ASSERT_TRUE(testing::writeTone((root_ / "outside.m4a").string(), outside));
+  fs::create_symlink(root_ / "outside.m4a", recordingsPath("Out.m4a"));
+  fs::copy_file(root_ / "outside.m4a", recordingsPath("Outside copy.m4a"));
+  for (const char* name : {"Kept.m4a", "Member.m4a", "Out.m4a"})
+    model()->insertRecordingWithAudioFile(recordingsPath(name), 1.0, platform::Date::now());
+  fs::create_symlink(recordingsPath("Kept.m4a"), recordingsPath("Link.m4a"));
+  ASSERT_EQ(::mkfifo(recordingsPath("Pipe.m4a").c_str(), 0600), 0);
+  fs::create_directory(recordingsPath("Folder.m4a"));
+  const bool device = ::mknod(recordingsPath("Null.m4a").c_str(), S_IFCHR | 0600, makedev(1, 3)) ==
+                      0;  // needs root
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  const std::string socketPath = recordingsPath("Socket.m4a");
+  ASSERT_LT(socketPath.size(), sizeof address.sun_path);
+  socketPath.copy(address.sun_path, socketPath.size());
+  const int socket = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  ASSERT_EQ(::bind(socket, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  testing::writeFile(recordingsPath("Noise A.m4a"), std::string(3001, 'n'));
+  copy("Noise A.m4a", "Noise B.m4a");
+  testing::writeFile(recordingsPath("Growing.m4a"), std::string(3100, 'g'));
+  testing::writeFile(recordingsPath("Replaced.m4a"), std::string(3200, 'r'));
+  testing::writeFile(recordingsPath("Writing.m4a"), std::string(3300, 'w'));
+  const int writer = ::open(recordingsPath("Writing.m4a").c_str(), O_WRONLY | O_APPEND);
+  ASSERT_GE(writer, 0);
+  RCMediaEngine::setCurrent(std::make_shared<BusyDirectoryEngine>());
+
+  run();
+
+  struct Row {
+    const char* name;
+    bool stays;
+    const char* line;  // logged once
+  };
+  const Row rows[] = {
+      {"Pipe.m4a", true, "Leaving 'Pipe.m4a' alone: it is not a regular file"},
+      {"Socket.m4a", true, "Leaving 'Socket.m4a' alone: it is not a regular file"},
+      {"Folder.m4a", true, "Leaving 'Folder.m4a' alone: it is not a regular file"},
+      {"Link.m4a", true, "Leaving 'Link.m4a' alone: it is a symbolic link"},
+      {"Target.m4a", true, "Leaving 'Target.m4a' alone: it is the same file as one in use"},
+      {"Writing.m4a", true, "'Writing.m4a' is open in another process; leaving it"},
+      {"Growing.m4a", true, "'Growing.m4a' changed during the run; leaving it"},
+      {"Replaced.m4a", true, "'Replaced.m4a' changed during the run; leaving it"},
+      {"Noise A.m4a", false, "'Noise A.m4a' unable to load AVURLAsset"},
+      {"Noise B.m4a", false, "'Noise B.m4a' unable to load AVURLAsset"},
+      {"Beta.m4a", false, "orphanPath = Beta.m4a matches existing file = Alpha.m4a"},
+      {"Outside copy.m4a", false, "orphanPath = Outside copy.m4a matches existing file = Out.m4a"},
+      {"Alpha.m4a", true, "orphaned composition (Alpha.composition) with assets"},
+  };
+  for (const Row& row : rows) {
+    EXPECT_EQ(present(row.name), row.stays) << row.name;
+    EXPECT_EQ(linesContaining(row.line), 1u) << row.line;
+  }
+  if (device) {
+    EXPECT_EQ(linesContaining("'Null.m4a' alone: it is not a regular file"), 1u);
+  }
+  EXPECT_TRUE(fs::exists(root_ / "outside.m4a"));
+  EXPECT_EQ(linesContaining("matches existing file = Noise A.m4a"), 0u);
+
+  // Once the writer is done, the next run deletes what it left unplayable.
+  ::close(writer);
+  ::close(socket);
+  run();
+  EXPECT_FALSE(present("Writing.m4a"));
 }
 
 // Titles follow the preferred languages; the container's creation date is
