@@ -18,7 +18,7 @@ std::string Error::description() const {
   std::string text = fmt::format("Error Domain={} Code={}", domain_, code_);
   if (!description_.empty()) text += fmt::format(" \"{}\"", description_);
   if (underlying_)
-    text += fmt::format(" UserInfo={{NSUnderlyingError={}}}", underlying_->description());
+    text += fmt::format(" (underlying error: {})", underlying_->description());
   return text;
 }
 

@@ -51,7 +51,7 @@ using Status = expected<void, Error>;
 inline unexpected<Error> fail(Error error) { return unexpected<Error>(std::move(error)); }
 
 // The domain of errors that come from the operating system (code = errno).
-inline constexpr const char* kPOSIXErrorDomain = "NSPOSIXErrorDomain";
+inline constexpr const char* kPOSIXErrorDomain = "org.quorvel.POSIXError";
 // An Error for errno value `err`, described as "<what>: <strerror>".
 Error posixError(int err, std::string_view what);
 

@@ -10,7 +10,7 @@ namespace {
 
 constexpr std::string_view kDomainPrefix = "Error Domain=";
 constexpr std::string_view kCodeMarker = " Code=";
-constexpr std::string_view kUnderlyingMarker = " UserInfo={NSUnderlyingError=";
+constexpr std::string_view kUnderlyingMarker = " (underlying error: ";
 
 struct NamedCode {
   const char* name;
@@ -53,7 +53,7 @@ std::optional<platform::Error> parseDescription(std::string_view text, int depth
       text = {};
     }
   }
-  if (text.starts_with(kUnderlyingMarker) && text.ends_with('}')) {
+  if (text.starts_with(kUnderlyingMarker) && text.ends_with(')')) {
     std::string_view inner = text.substr(kUnderlyingMarker.size());
     inner.remove_suffix(1);
     underlying = parseDescription(inner, depth + 1);

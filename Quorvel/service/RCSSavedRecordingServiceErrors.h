@@ -3,7 +3,7 @@
 // error values and D-Bus error replies (name, message).
 //
 // The message of a D-Bus error is the error's description,
-//   Error Domain=<domain> Code=<code>[ "<text>"][ UserInfo={NSUnderlyingError=<same form>}]
+//   Error Domain=<domain> Code=<code>[ "<text>"][ (underlying error: <same form>)]
 // so a client turns any reply back into an error with the same domain and
 // code (and the underlying chain), whatever library it uses. Plain functions;
 // safe to call from any thread.

@@ -70,8 +70,8 @@ TEST(ErrorTest, CarriesDomainCodeAndUnderlyingError) {
   ASSERT_NE(outer.underlyingError(), nullptr);
   EXPECT_EQ(*outer.underlyingError(), inner);
   EXPECT_EQ(outer.description(),
-            "Error Domain=org.quorvel.Error Code=1 \"compose failed\" UserInfo={NSUnderlyingError="
-            "Error Domain=NSPOSIXErrorDomain Code=2 \"open: No such file or directory\"}");
+            "Error Domain=org.quorvel.Error Code=1 \"compose failed\" (underlying error: "
+            "Error Domain=org.quorvel.POSIXError Code=2 \"open: No such file or directory\")");
   Result<int> failed = fail(outer);
   ASSERT_FALSE(failed);
   EXPECT_EQ(failed.error().code(), 1);
