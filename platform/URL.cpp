@@ -105,7 +105,8 @@ std::optional<std::string> percentDecode(std::string_view text) {
 
 URL::URL(std::string path, bool directory) {
   while (path.size() > 1 && path.back() == '/') path.pop_back();
-  if (path.empty()) path = "/";
+  // (push_back: GCC 12 at -O3 takes assigning "/" for an overlapping copy.)
+  if (path.empty()) path.push_back('/');
   std::string absolute = std::string(kScheme) + percentEncodePath(path);
   if (directory && path != "/") absolute += '/';
   storage_ = std::make_shared<const Storage>(Storage{std::move(path), std::move(absolute)});

@@ -273,7 +273,7 @@ platform::Result<std::unique_ptr<BundleLocks::Lock>> lockBundle(const platform::
 // Removes temporary files an interrupted replacement of `destination` left.
 void removeLeftoverTemporaryFiles(const platform::URL& destination) {
   const platform::URL directory = destination.URLByDeletingLastPathComponent();
-  const std::string prefix = "." + destination.lastPathComponent() + ".";
+  const std::string prefix = fmt::format(".{}.", destination.lastPathComponent());
   std::vector<std::string> leftovers;
   if (DIR* listing = ::opendir(directory.path().c_str())) {
     while (const dirent* entry = ::readdir(listing)) {

@@ -94,11 +94,11 @@ platform::Result<RCCompositionEditor> RCCompositionEditor::createCompositionForN
     platform::Date date) {
   if (!RCIsPlainFileName(baseName) || !isValidUTF8(baseName)) {
     return platform::fail(
-        invalidEdit("'" + std::string(baseName) + "' is not a plain UTF-8 file name"));
+        invalidEdit(fmt::format("'{}' is not a plain UTF-8 file name", baseName)));
   }
   if (!RCCaptureFormat::isFileExtensionSupported(captureExtension)) {
     return platform::fail(
-        invalidEdit("'" + std::string(captureExtension) + "' is not a capture format's extension"));
+        invalidEdit(fmt::format("'{}' is not a capture format's extension", captureExtension)));
   }
   const std::string& directory = model.directory();
   std::string name;
@@ -188,7 +188,7 @@ platform::Result<platform::URL> RCCompositionEditor::beginFragment(
     std::string_view captureExtension) {
   if (!RCCaptureFormat::isFileExtensionSupported(captureExtension)) {
     return platform::fail(
-        invalidEdit("'" + std::string(captureExtension) + "' is not a capture format's extension"));
+        invalidEdit(fmt::format("'{}' is not a capture format's extension", captureExtension)));
   }
   if (auto decomposed = decomposeComposedFileIfNeeded(); !decomposed) {
     return platform::fail(decomposed.error());

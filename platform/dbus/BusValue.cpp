@@ -74,7 +74,7 @@ std::string BusValue::signature() const {
     case Kind::StringArray:
       return "as";
     case Kind::Struct:
-      return "(" + signatureOf(std::get<StructFields>(value_).fields) + ")";
+      return fmt::format("({})", signatureOf(std::get<StructFields>(value_).fields));
   }
   return {};
 }

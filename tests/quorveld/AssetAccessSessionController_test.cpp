@@ -71,19 +71,20 @@ TEST_F(SessionRegistryTest, EachSessionKeepsTheProcessAliveUntilClosed) {
 
 TEST_F(SessionRegistryTest, DumpPrintsOneLineWhenEmptyAndABlockPerRecording) {
   EXPECT_EQ(registry_.stateDescription(),
-            "[" + registry_.description() + "] *** No Active Sessions ***\n");
+            fmt::format("[{}] *** No Active Sessions ***\n", registry_.description()));
   auto walk = open(walk_, false);
   auto walkToo = open(walk_, false);
   auto talk = open(talk_, true);
   std::string dump = registry_.stateDescription();
-  std::string expected =
-      "[" + registry_.description() + "] *** Active Sessions (by compositionAVURL/URL) ***\n\n" +
-      "compositionAVURL = file:///recordings/Walk.m4a\n" +
-      "\tActive Sessions (2) = " + walk->debugDescription() + "; " + walkToo->debugDescription() +
-      "\n" + "\tComposition Metadata = (null)\n\n\n" +
-      "compositionAVURL = file:///recordings/Talk.m4a\n" +
-      "\tActive Sessions (1) = " + talk->debugDescription() + "\n" +
-      "\tComposition Metadata = (null)\n\n\n" + std::string(41, '*') + "\n";
+  std::string expected = fmt::format("[{}] *** Active Sessions (by compositionAVURL/URL) ***\n\n",
+                                     registry_.description()) +
+                         "compositionAVURL = file:///recordings/Walk.m4a\n" +
+                         "\tActive Sessions (2) = " + walk->debugDescription() + "; " +
+                         walkToo->debugDescription() + "\n" +
+                         "\tComposition Metadata = (null)\n\n\n" +
+                         "compositionAVURL = file:///recordings/Talk.m4a\n" +
+                         "\tActive Sessions (1) = " + talk->debugDescription() + "\n" +
+                         "\tComposition Metadata = (null)\n\n\n" + std::string(41, '*') + "\n";
   EXPECT_EQ(dump, expected);
 }
 

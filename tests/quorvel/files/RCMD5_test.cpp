@@ -46,7 +46,7 @@ TEST_F(RCMD5Test, KnownAnswerAndAgreementWithMd5sumAcrossChunkBoundaries) {
     SCOPED_TRACE(size);
     std::string bytes(size, '\0');
     for (char& c : bytes) c = char(random());
-    const std::string path = write("f" + std::to_string(size), bytes);
+    const std::string path = write(fmt::format("f{}", size), bytes);
     auto digest = RCMD5DigestOfFile(path);
     ASSERT_TRUE(digest);
     ASSERT_TRUE(*digest);
