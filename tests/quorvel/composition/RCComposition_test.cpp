@@ -36,6 +36,17 @@ TEST(CompositionManifestTest, RoundTripsAndLaysFragmentsEndToEnd) {
   auto parsed = RCCompositionManifest::parse(manifest.serialize());
   ASSERT_TRUE(parsed) << parsed.error();
   EXPECT_EQ(*parsed, manifest);
+
+  // An unreadable fragment is out of the composed audio, whatever length it
+  // had: it takes no time, and the mark survives the trip.
+  manifest.fragments.insert(manifest.fragments.begin(),
+                            {"c.flac", {0, 0}, 0, 3.0, false, /*unreadable=*/true});
+  manifest.recomputeTimeRanges();
+  EXPECT_DOUBLE_EQ(manifest.composedDuration, 2.0);
+  EXPECT_EQ(manifest.fragments[1].timeRangeInComposition, (RCTimeRange{0, 2.0}));
+  parsed = RCCompositionManifest::parse(manifest.serialize());
+  ASSERT_TRUE(parsed) << parsed.error();
+  EXPECT_EQ(*parsed, manifest);
 }
 
 TEST(CompositionManifestTest, RefusesEveryMalformedShapeWithAReason) {
