@@ -621,6 +621,7 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
     // Taken before composing: a file rewritten meanwhile is not the one the
     // compose judged.
     std::vector<std::optional<RCFileVersion>> versions;
+    versions.reserve(segments.size());
     for (const RCComposerSegment& segment : segments) {
       versions.push_back(versionOf(segment.fragmentURL));
     }
