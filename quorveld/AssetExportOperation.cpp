@@ -79,7 +79,11 @@ bool CompositionExportOperation::run(std::optional<platform::Error>* error) {
     }
     return false;
   }
-  if (composition->decomposedFragments().empty()) return true;
+  // A recording whose every fragment is left out as unreadable has no audio
+  // to export: composing it fails, unless a fragment reads again.
+  if (composition->decomposedFragments().empty() && !composition->allFragmentsUnreadable()) {
+    return true;
+  }
 
   // The old waveform describes the old audio; a failure (none there) is fine.
   (void)RCRemoveItemInSavedRecordingsDirectory(RCWaveform::waveformURLForAVURL(compositionAVURL()));

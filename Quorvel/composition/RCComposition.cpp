@@ -138,6 +138,13 @@ std::vector<RCCompositionFragment> RCComposition::decomposedFragments() const {
   return result;
 }
 
+bool RCComposition::allFragmentsUnreadable() const {
+  return !manifest_.fragments.empty() &&
+         std::ranges::all_of(manifest_.fragments, [](const RCCompositionManifestFragment& entry) {
+           return entry.unreadable;
+         });
+}
+
 std::uint64_t RCComposition::fileSizeOfAssetsIncludingRelatedResources(bool includeRelated) const {
   platform::URL composed = composedAVURL();
   std::uint64_t total = regularFileSize(composed.path());

@@ -58,8 +58,12 @@ class RCComposition {
 
   // Every fragment, in composition order.
   std::vector<RCCompositionFragment> fragments() const;
-  // The fragments whose audio is not in the composed file yet.
+  // The fragments whose audio is not in the composed file yet (those marked
+  // unreadable are left out of it, and are not among them).
   std::vector<RCCompositionFragment> decomposedFragments() const;
+  // Whether it has fragments and every one is marked unreadable: none of
+  // its audio can be composed, however up to date the composed file looks.
+  bool allFragmentsUnreadable() const;
   // The file URL of the bundle entry `name`.
   platform::URL URLForFragmentFile(const std::string& name) const;
 

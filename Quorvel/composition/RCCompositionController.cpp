@@ -5,8 +5,19 @@
 // first audio byte) or have lost files (deleted by hand, a crash between a
 // manifest write and a removal). Repair reconciles the two without ever
 // giving up audio that is still on disk: only entries whose files are gone
-// or empty are dropped, and a file that exists but cannot be read keeps its
-// entry, so composing fails loudly rather than leaving the audio out.
+// or empty are dropped.
+//
+// A fragment whose file the media engine read and found unusable (a capture
+// cut off before its header, bytes damaged after the recording) keeps its
+// entry, marked unreadable: it is left out of the composed audio, its file
+// stays, and the recording can still be exported. Only such a verdict marks
+// a fragment; a failure to look (I/O, memory, a media worker that died or
+// timed out) says nothing about the file, so the repair leaves the entry as
+// it is and a compose fails. The repair clears the mark once the file reads
+// again, and the next finalization composes it again. A probe reads only a
+// file's header, so damage inside the audio shows only when composing
+// decodes it: the compose names the fragment it failed on, which is then
+// marked, and the rest is composed without it.
 //
 // When every remaining fragment was composed but some composed fragment's
 // file is gone, the composed file is the only complete copy of the audio:
@@ -30,6 +41,7 @@
 #include <sys/stat.h>
 #include <time.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cmath>
 #include <condition_variable>
@@ -72,32 +84,64 @@ FileState fileState(const platform::URL& url) {
   return FileState::Present;
 }
 
-// Durations already read, by file version. Every session that opens or
-// closes on a recording repairs it, and reading a duration is a media job
-// (in the daemon, a round trip to its worker); a fragment file does not
-// change once captured, and one that does gets a new size or mtime.
-class DurationCache {
+// What reading a fragment file's audio found.
+struct FileReading {
+  enum class Verdict {
+    // The audio is there: `duration` seconds of it.
+    Readable,
+    // The media engine read the file and found no usable audio: not a media
+    // file, invalid data, no audio stream, no duration, or (found by a
+    // compose) audio that does not decode.
+    Unreadable,
+    // The file could not be looked at (I/O, memory, permissions, a media
+    // worker that died or timed out); says nothing about the file.
+    NotRead,
+  };
+  Verdict verdict = Verdict::NotRead;
+  double duration = std::nan("");
+  // NotRead: why.
+  std::optional<platform::Error> error;
+
+  bool readable() const { return verdict == Verdict::Readable; }
+  bool unreadable() const { return verdict == Verdict::Unreadable; }
+  static FileReading of(const platform::URL& url, platform::Result<RCMediaProbe> probe) {
+    auto asset = RCAudioAsset::examineAssetWithProbe(url, std::move(probe));
+    if (!asset) return FileReading{Verdict::NotRead, std::nan(""), asset.error()};
+    if (!*asset || !std::isfinite((*asset)->duration())) return FileReading{Verdict::Unreadable};
+    return FileReading{Verdict::Readable, (*asset)->duration()};
+  }
+};
+
+// Verdicts already reached, by file version. Every session that opens or
+// closes on a recording repairs it, and reading a file is a media job (in
+// the daemon, a round trip to its worker); a fragment file does not change
+// once captured, and one that does gets a new size or mtime. A file a
+// compose found undecodable is remembered as unreadable although a probe
+// would pass it, so the repair does not take it back in until it changes.
+class ReadingCache {
  public:
-  std::optional<double> find(const std::string& path, const RCFileVersion& version) {
+  std::optional<FileReading> find(const std::string& path, const RCFileVersion& version) {
     std::lock_guard lock(mutex_);
     auto entry = entries_.find(path);
     if (entry == entries_.end() || !(entry->second.first == version)) return std::nullopt;
     return entry->second.second;
   }
-  void insert(const std::string& path, const RCFileVersion& version, double duration) {
+  // Only verdicts are kept: a failure to look may be passing.
+  void insert(const std::string& path, const RCFileVersion& version, const FileReading& reading) {
+    if (reading.verdict == FileReading::Verdict::NotRead) return;
     std::lock_guard lock(mutex_);
     if (entries_.size() >= kCapacity) entries_.clear();
-    entries_[path] = {version, duration};
+    entries_[path] = {version, reading};
   }
 
  private:
   static constexpr std::size_t kCapacity = 4096;
   std::mutex mutex_;
-  std::unordered_map<std::string, std::pair<RCFileVersion, double>> entries_;
+  std::unordered_map<std::string, std::pair<RCFileVersion, FileReading>> entries_;
 };
 
-DurationCache& durationCache() {
-  static DurationCache* cache = new DurationCache();
+ReadingCache& readingCache() {
+  static ReadingCache* cache = new ReadingCache();  // used until the process ends
   return *cache;
 }
 
@@ -108,46 +152,65 @@ std::optional<RCFileVersion> versionOf(const platform::URL& url) {
   return RCFileVersion::of(info);
 }
 
-// The file's duration when it was read before and the file has not changed.
-std::optional<double> cachedFileDuration(const platform::URL& url) {
+// What reading the file found before, when it has not changed since.
+std::optional<FileReading> cachedReading(const platform::URL& url) {
   auto version = versionOf(url);
-  return version ? durationCache().find(url.path(), *version) : std::nullopt;
+  return version ? readingCache().find(url.path(), *version) : std::nullopt;
 }
 
-void rememberDuration(const platform::URL& url, const platform::Result<RCMediaProbe>& probe) {
-  // Only what was read is kept: a failure may be passing (a worker that died).
-  if (!probe || !probe->playable || !std::isfinite(probe->duration)) return;
-  if (auto version = versionOf(url)) durationCache().insert(url.path(), *version, probe->duration);
+// Remembers `reading` of the file as it was at `version` (taken before the
+// file was read, so a change while it was read is not taken for the file
+// that was read).
+void rememberReading(const platform::URL& url, const std::optional<RCFileVersion>& version,
+                     const FileReading& reading) {
+  if (version) readingCache().insert(url.path(), *version, reading);
 }
 
-double durationOf(const platform::Result<RCMediaProbe>& probe) {
-  return probe && probe->playable ? probe->duration : std::nan("");
+FileReading readFile(const platform::URL& url) {
+  auto version = versionOf(url);
+  if (version) {
+    if (auto known = readingCache().find(url.path(), *version)) return *known;
+  }
+  FileReading reading = FileReading::of(url, RCMediaEngine::current()->probe(url));
+  rememberReading(url, version, reading);
+  return reading;
 }
 
-// The file's duration in seconds; NaN when it cannot be read.
-double fileDuration(const platform::URL& url) {
-  if (auto known = cachedFileDuration(url)) return *known;
-  auto probe = RCMediaEngine::current()->probe(url);
-  rememberDuration(url, probe);
-  return durationOf(probe);
-}
-
-// The durations of the files not read before, by path, read in one batch so
+// The readings of the files not read before, by path, read in one batch so
 // a recording of many fragments costs one round trip to the media worker.
-std::unordered_map<std::string, double> readDurations(const std::vector<platform::URL>& files) {
+std::unordered_map<std::string, FileReading> readFiles(const std::vector<platform::URL>& files) {
   std::vector<platform::URL> unknown;
+  std::vector<std::optional<RCFileVersion>> versions;
   for (const platform::URL& url : files) {
     // Gone or empty files are dropped by the repair without being read.
-    if (fileState(url) == FileState::Present && !cachedFileDuration(url)) unknown.push_back(url);
+    if (fileState(url) != FileState::Present) continue;
+    auto version = versionOf(url);
+    if (version && readingCache().find(url.path(), *version)) continue;
+    unknown.push_back(url);
+    versions.push_back(version);
   }
-  std::unordered_map<std::string, double> read;
+  std::unordered_map<std::string, FileReading> read;
   if (unknown.empty()) return read;
   auto probes = RCMediaEngine::current()->probeMany(unknown);
   for (std::size_t i = 0; i < unknown.size() && i < probes.size(); ++i) {
-    rememberDuration(unknown[i], probes[i]);
-    read.emplace(unknown[i].path(), durationOf(probes[i]));
+    FileReading reading = FileReading::of(unknown[i], std::move(probes[i]));
+    rememberReading(unknown[i], versions[i], reading);
+    read.emplace(unknown[i].path(), std::move(reading));
   }
   return read;
+}
+
+// Marks `entry` unreadable (left out of the composed audio, its file kept)
+// and, with `report`, says so when it was not marked already.
+void markUnreadable(RCCompositionManifestFragment& entry, const RCComposition& composition,
+                    bool report = true) {
+  if (entry.unreadable) return;
+  entry.unreadable = true;
+  entry.composed = false;
+  if (!report) return;
+  QV_LOG(platform::kLogLevelError,
+         "WARNING: leaving fragment '{}' of {} out of the composed audio: it cannot be read",
+         entry.file, composition.bundleURL().lastPathComponent());
 }
 
 // Bundles found with nothing to repair or clean up, by composed path, with
@@ -312,10 +375,10 @@ void recordComposedDuration(const RCComposition& composition) {
   }
 }
 
-// `duration` gives a file's duration in seconds, NaN when it cannot be read.
-// With `report`, what the repair does is logged.
-template <typename Duration>
-RCCompositionManifest repairedManifest(const RCComposition& composition, Duration&& duration,
+// `read` gives what reading a file finds. With `report`, what the repair
+// does is logged.
+template <typename Read>
+RCCompositionManifest repairedManifest(const RCComposition& composition, Read&& read,
                                        bool report = true) {
   RCCompositionManifest manifest = composition.manifest();
   std::vector<RCCompositionManifestFragment> kept;
@@ -332,20 +395,36 @@ RCCompositionManifest repairedManifest(const RCComposition& composition, Duratio
       lostComposedAudio = lostComposedAudio || entry.composed;
       continue;
     }
-    double seconds = duration(url);
-    if (std::isfinite(seconds)) {
-      double available = std::max(0.0, seconds - entry.contentStart);
+    FileReading reading = read(url);
+    if (reading.readable()) {
+      if (entry.unreadable) {
+        // Back in the composition: the next finalization composes it.
+        entry.unreadable = false;
+        entry.composed = false;
+        if (report) {
+          QV_LOG(platform::kLogLevelNotice, "NOTE: fragment '{}' of {} can be read again",
+                 entry.file, composition.bundleURL().lastPathComponent());
+        }
+      }
+      double available = std::max(0.0, reading.duration - entry.contentStart);
       if (!entry.contentDuration || *entry.contentDuration > available + kDurationTolerance) {
         entry.contentDuration = available;
         entry.composed = false;
       }
+    } else if (reading.unreadable()) {
+      // Kept, never dropped: the file may still be rescued, and dropping the
+      // entry would make it an orphan for the cleanup to delete.
+      markUnreadable(entry, composition, report);
     } else if (report) {
       QV_LOG(platform::kLogLevelError,
-             "WARNING: fragment '{}' of {} cannot be read; keeping it so composing reports it",
-             entry.file, composition.bundleURL().lastPathComponent());
+             "WARNING: cannot read fragment '{}' of {} now, leaving its entry as it is: {}",
+             entry.file, composition.bundleURL().lastPathComponent(),
+             reading.error ? reading.error->localizedDescription() : std::string("no reason"));
     }
     kept.push_back(std::move(entry));
   }
+  // An unreadable fragment is never composed, so it keeps the composed file
+  // from standing for the whole recording, and keeps its own entry.
   bool allComposed = true;
   for (const auto& entry : kept) allComposed = allComposed && entry.composed;
   if (lostComposedAudio && allComposed) kept.clear();
@@ -356,8 +435,8 @@ RCCompositionManifest repairedManifest(const RCComposition& composition, Duratio
     platform::URL composed = composition.composedAVURL();
     if (fileState(composed) == FileState::Missing) {
       manifest.composedDuration = 0;
-    } else if (double seconds = duration(composed); std::isfinite(seconds)) {
-      manifest.composedDuration = seconds;
+    } else if (FileReading reading = read(composed); reading.readable()) {
+      manifest.composedDuration = reading.duration;
     }
   }
   return manifest;
@@ -409,10 +488,10 @@ void RCCompositionController::rcs_repairDecomposedFragmentMetadataIfNecessary() 
   for (const auto& entry : current->manifest().fragments) {
     files.push_back(current->URLForFragmentFile(entry.file));
   }
-  const auto read = readDurations(files);
+  const auto read = readFiles(files);
   RCCompositionManifest repaired = repairedManifest(*current, [&](const platform::URL& url) {
     auto found = read.find(url.path());
-    return found != read.end() ? found->second : fileDuration(url);
+    return found != read.end() ? found->second : readFile(url);
   });
   if (repaired == current->manifest()) return;
   auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(repaired));
@@ -451,9 +530,9 @@ bool RCCompositionController::hasNothingToRepairOrCleanUp() const {
   RCCompositionManifest repaired = repairedManifest(
       *current,
       [&](const platform::URL& url) {
-        std::optional<double> seconds = cachedFileDuration(url);
-        known = known && seconds.has_value();
-        return seconds.value_or(std::nan(""));
+        std::optional<FileReading> reading = cachedReading(url);
+        known = known && reading.has_value();
+        return reading.value_or(FileReading{});
       },
       /*report=*/false);
   if (!known || repaired != current->manifest()) return false;
@@ -471,7 +550,12 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
     return platform::fail(
         RCError(RCErrorCodeInvalidManifest, "there is no composition to compose"));
   }
-  if (current->decomposedFragments().empty()) return {};
+  // With every fragment left out there is no audio at all: composing finds
+  // out whether one reads again, or fails.
+  auto nothingToDo = [](const RCComposition& composition) {
+    return composition.decomposedFragments().empty() && !composition.allFragmentsUnreadable();
+  };
+  if (nothingToDo(*current)) return {};
 
   // One bundle is composed by one job at a time, whatever URL spelling or
   // controller asked: two composes of the same files would each take the
@@ -487,46 +571,73 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
       std::lock_guard lock(state_->mutex);
       state_->composition = current;
     }
-    if (current->decomposedFragments().empty()) return {};
+    if (nothingToDo(*current)) return {};
   }
 
   RCCompositionManifest manifest = current->manifest();
-  std::vector<RCComposerSegment> segments;
-  bool leftOut = false;
   for (RCCompositionManifestFragment& entry : manifest.fragments) {
-    platform::URL url = current->URLForFragmentFile(entry.file);
-    if (!entry.contentDuration || entry.unreadable) {
-      // A fragment whose file cannot be read is left out, not allowed to
-      // make the whole recording impossible to finalize; its file stays.
-      double duration = fileDuration(url);
-      entry.unreadable = !std::isfinite(duration);
-      if (entry.unreadable) {
-        QV_LOG(platform::kLogLevelError,
-               "WARNING: leaving fragment '{}' of {} out of the composed audio: it cannot be read",
-               entry.file, current->bundleURL().lastPathComponent());
-        leftOut = true;
-        continue;
-      }
-      if (!entry.contentDuration)
-        entry.contentDuration = std::max(0.0, duration - entry.contentStart);
+    if (entry.contentDuration && !entry.unreadable) continue;
+    // Open-ended (its length never recorded) or marked unreadable: what its
+    // file holds now decides. Only the engine's verdict leaves it out; a
+    // failure to look fails the compose and marks nothing.
+    FileReading reading = readFile(current->URLForFragmentFile(entry.file));
+    if (reading.verdict == FileReading::Verdict::NotRead) {
+      return platform::fail(reading.error.value_or(
+          RCError(RCErrorCodeUnreadableAudio, "fragment " + entry.file + " cannot be read now")));
     }
-    if (*entry.contentDuration > 0) {
-      segments.push_back(RCComposerSegment{url, entry.contentStart, *entry.contentDuration});
+    if (reading.unreadable()) {
+      markUnreadable(entry, *current);
+      continue;
     }
+    entry.unreadable = false;
+    if (!entry.contentDuration)
+      entry.contentDuration = std::max(0.0, reading.duration - entry.contentStart);
   }
-  if (segments.empty()) {
-    return platform::fail(
-        leftOut ? RCError(RCErrorCodeUnreadableAudio, "none of the fragments can be read")
-                : RCError(RCErrorCodeInvalidEdit, "the fragments hold no audio to compose"));
-  }
+
   platform::URL destination = current->composedAVURL();
   std::optional<platform::URL> waveform;
   if (composeWaveform) waveform = RCWaveform::waveformURLForAVURL(destination);
-  removeLeftoverTemporaryFiles(destination);
-  if (waveform) removeLeftoverTemporaryFiles(*waveform);
-  if (auto composed = RCMediaEngine::current()->compose(segments, destination, waveform, {});
-      !composed) {
-    return composed;
+  // A fragment whose audio turns out not to decode is named by the failed
+  // compose; it is marked, and the rest composed again without it. Files
+  // that read fine cost one compose, as before; each unreadable one that
+  // only composing finds costs one failed attempt more.
+  for (;;) {
+    std::vector<RCComposerSegment> segments;
+    std::vector<std::size_t> entryOfSegment;
+    bool leftOut = false;
+    for (std::size_t i = 0; i < manifest.fragments.size(); ++i) {
+      const RCCompositionManifestFragment& entry = manifest.fragments[i];
+      leftOut = leftOut || entry.unreadable;
+      if (entry.unreadable || !entry.contentDuration || *entry.contentDuration <= 0) continue;
+      segments.push_back(RCComposerSegment{current->URLForFragmentFile(entry.file),
+                                           entry.contentStart, *entry.contentDuration});
+      entryOfSegment.push_back(i);
+    }
+    if (segments.empty()) {
+      return platform::fail(
+          leftOut ? RCError(RCErrorCodeUnreadableAudio, "none of the fragments can be read")
+                  : RCError(RCErrorCodeInvalidEdit, "the fragments hold no audio to compose"));
+    }
+    // Taken before composing: a file rewritten meanwhile is not the one the
+    // compose judged.
+    std::vector<std::optional<RCFileVersion>> versions;
+    versions.reserve(segments.size());
+    for (const RCComposerSegment& segment : segments) {
+      versions.push_back(versionOf(segment.fragmentURL));
+    }
+    removeLeftoverTemporaryFiles(destination);
+    if (waveform) removeLeftoverTemporaryFiles(*waveform);
+    platform::Status composed =
+        RCMediaEngine::current()->compose(segments, destination, waveform, {});
+    if (composed) break;
+    std::optional<std::size_t> failed = RCComposerFailedSegment(composed.error());
+    if (!failed || *failed >= segments.size()) return composed;
+    QV_LOG(platform::kLogLevelDebug, "Composing {} stopped at fragment '{}': {}",
+           destination.lastPathComponent(), segments[*failed].fragmentURL.lastPathComponent(),
+           composed.error());
+    rememberReading(segments[*failed].fragmentURL, versions[*failed],
+                    FileReading{FileReading::Verdict::Unreadable});
+    markUnreadable(manifest.fragments[entryOfSegment[*failed]], *current);
   }
 
   // Composing takes long; an app may have changed the manifest meanwhile
@@ -540,19 +651,24 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
                                   "the manifest of " + current->bundleURL().lastPathComponent() +
                                       " changed while it was composed; it was left as it is"));
   }
-  // A left-out fragment stays listed, open-ended (no time in the
-  // composition), so nothing deletes its file.
+  // A left-out fragment stays listed, with no time in the composition, so
+  // nothing deletes its file.
   for (RCCompositionManifestFragment& entry : manifest.fragments) {
     entry.composed = !entry.unreadable;
   }
   manifest.recomputeTimeRanges();
+  // The composed file stands for the fragments it holds only while no
+  // fragment waits outside it: one that reads again is composed back in its
+  // place, between the others, so they stay until then.
+  const bool anyLeftOut = std::ranges::any_of(
+      manifest.fragments,
+      [](const RCCompositionManifestFragment& entry) { return entry.unreadable; });
   std::vector<platform::URL> toDelete;
-  if (deleteFragments) {
-    std::erase_if(manifest.fragments, [&](const RCCompositionManifestFragment& entry) {
-      if (entry.unreadable) return false;
+  if (deleteFragments && !anyLeftOut) {
+    for (const RCCompositionManifestFragment& entry : manifest.fragments) {
       toDelete.push_back(current->URLForFragmentFile(entry.file));
-      return true;
-    });
+    }
+    manifest.fragments.clear();
   }
   auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(manifest));
   if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) return saved;

@@ -44,9 +44,12 @@ class RCCompositionController {
   // (an open-ended one, left by a capture that never finished, is closed at
   // the file's end; one longer than its file is cut to it); the fragments are
   // laid end to end and the composed duration recomputed. A fragment whose
-  // file exists but cannot be read stays, so composing it fails instead of
-  // silently dropping audio. Blocks on the file system, and reads the
-  // durations it does not know yet in one media job.
+  // file the media engine found holding no usable audio stays, marked
+  // unreadable (no time in the composition, never composed, its file kept);
+  // one marked so whose file reads again is unmarked, so the next compose
+  // takes it back. A file that cannot be looked at now leaves its entry as it
+  // is. Blocks on the file system, and reads the files it has no verdict on
+  // yet in one media job.
   void rcs_repairDecomposedFragmentMetadataIfNecessary();
 
   // True when the repair above would change nothing and no orphaned
@@ -62,10 +65,16 @@ class RCCompositionController {
 
   // Composes every fragment's used range, in order, into the composed audio
   // file (and, with composeWaveform, its waveform file beside it), on the
-  // global queue; returns at once. On success every fragment is marked
-  // composed and the manifest saved; with deleteFragments the manifest drops
-  // the fragments first and their files are removed after. Nothing to
-  // compose (no decomposed fragments) is a success that touches nothing.
+  // global queue; returns at once. A fragment whose audio the media engine
+  // finds unusable, before or while composing, is marked unreadable and left
+  // out; composing fails when no fragment is left, or when a file cannot be
+  // looked at (then nothing is marked). On success every other fragment is
+  // marked composed and the manifest saved; with deleteFragments the
+  // manifest drops the fragments first and their files are removed after,
+  // unless a fragment was left out (then every fragment and file stays, so
+  // it can be composed back in its place). Nothing to compose (no
+  // decomposed fragments, and not every fragment unreadable) is a success
+  // that touches nothing.
   // `completionBlock` runs exactly once, on a global queue thread.
   // canGenerateWaveformByProcessingAVURL is accepted for the interface; the
   // composer always computes the waveform from the audio it writes.

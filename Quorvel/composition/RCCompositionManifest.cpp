@@ -170,7 +170,7 @@ platform::Result<RCCompositionManifest> RCCompositionManifest::parse(std::string
 void RCCompositionManifest::recomputeTimeRanges() {
   double at = 0;
   for (RCCompositionManifestFragment& entry : fragments) {
-    double duration = entry.contentDuration.value_or(0);
+    double duration = entry.unreadable ? 0 : entry.contentDuration.value_or(0);
     entry.timeRangeInComposition = RCTimeRange{at, duration};
     at += duration;
   }

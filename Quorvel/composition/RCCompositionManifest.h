@@ -12,7 +12,8 @@
 //       { "file": "Walk-1.m4a",            // name inside the bundle
 //         "timeRangeInComposition": { "start": 0, "duration": 5 },
 //         "contentRange": { "start": 0, "duration": 5 | null },
-//         "composed": false }
+//         "composed": false,
+//         "unreadable": true }             // only when set
 //     ]
 //   }
 // A content duration of null means "to the end of the file": the fragment is
@@ -47,9 +48,11 @@ struct RCCompositionManifestFragment {
   // nullopt: to the end of the file (capture in progress).
   std::optional<double> contentDuration;
   bool composed = false;
-  // Its file could not be read when the recording was last composed (a
-  // capture cut off before its header, say): it was left out of the composed
-  // audio, and its file stays for whoever can still rescue it.
+  // The media engine read its file and found no usable audio (a capture cut
+  // off before its header, bytes damaged after the recording): it is left
+  // out of the composed audio and takes no time in the composition, is never
+  // composed, and its file stays for whoever can still rescue it. The
+  // fragment cleanup clears the mark once the file reads again.
   bool unreadable = false;
   friend bool operator==(const RCCompositionManifestFragment&,
                          const RCCompositionManifestFragment&) = default;
@@ -69,8 +72,8 @@ struct RCCompositionManifest {
 
   static platform::Result<RCCompositionManifest> parse(std::string_view json);
   // Lays the fragments end to end in their order (each takes its content
-  // duration, 0 while open-ended) and, when there are fragments, makes the
-  // composed duration their sum.
+  // duration, 0 while open-ended or unreadable) and, when there are
+  // fragments, makes the composed duration their sum.
   void recomputeTimeRanges();
   // The JSON text; parse(serialize()) gives the manifest back.
   std::string serialize() const;

@@ -7,6 +7,8 @@
 // returning immutable values; safe to call from any thread.
 #pragma once
 
+#include <cstddef>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -62,7 +64,8 @@ inline constexpr const char* kRCMediaErrorDomain = "org.quorvel.Media";
 enum RCMediaErrorCode : long {
   // A request that cannot be carried out as asked.
   RCMediaErrorCodeInvalidArgument = 1,
-  // The file is missing, unreadable or not a media file.
+  // The file is not a media file that can be opened (one that is missing or
+  // cannot be read at all is a POSIX error).
   RCMediaErrorCodeCannotOpen = 2,
   // The file opened but holds no audio.
   RCMediaErrorCodeNoAudioStream = 3,
@@ -85,8 +88,32 @@ enum RCMediaErrorCode : long {
 
 platform::Error RCMediaError(RCMediaErrorCode code, std::string description);
 // An error for a negative FFmpeg result `averror`, described as "<what>: <FFmpeg's text>".
+// A system error (RCIsSystemAVError) becomes a POSIX error with its errno:
+// it tells that the file could not be read, not what the file holds.
 // Defined in libquorvel-media (RCFFmpegLogging.cpp), with the rest of the FFmpeg code.
 platform::Error RCMediaErrorFromAV(RCMediaErrorCode code, int averror, std::string_view what);
+// True when the FFmpeg result `averror` is the operating system's failure
+// (EIO, ENOMEM, EACCES, ENOENT…) rather than FFmpeg's finding about the data.
+bool RCIsSystemAVError(int averror);
+
+// True when `error` is the media engine's verdict on a file it read: not a
+// media file, invalid data, no audio stream, audio that does not decode or
+// ends early (the asset domain, and those codes of the media domain). Any
+// other error (POSIX, a media worker that died or timed out, a failure to
+// write) says nothing about the file, and nothing may be concluded from it.
+bool RCIsAudioDataError(const platform::Error& error);
+
+// ---- Composing: the fragment whose audio cannot be read ----
+
+// The domain of a compose that failed because one segment's fragment holds
+// unusable audio (RCIsAudioDataError): the code is that segment's index in
+// the compose request, the underlying error what reading it found. Failures
+// to read at all never take this form.
+inline constexpr const char* kRCComposerSegmentErrorDomain = "org.quorvel.ComposerSegment";
+
+platform::Error RCComposerSegmentError(std::size_t segmentIndex, const platform::Error& underlying);
+// The index of the segment `error` blames, when it is a segment error.
+std::optional<std::size_t> RCComposerFailedSegment(const platform::Error& error);
 
 // ---- MP4 atom reading and title writing ----
 

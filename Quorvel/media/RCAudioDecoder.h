@@ -2,8 +2,9 @@
 // (libavformat) and, when asked, decoded (libavcodec, one thread).
 //
 // Owned by one user and used on one thread at a time; not synchronized.
-// Every failure is an Error in kRCMediaErrorDomain: CannotOpen for a missing,
-// unreadable or unrecognised file, NoAudioStream, DecodeFailed.
+// A failure of the data is an Error in kRCMediaErrorDomain: CannotOpen for
+// an unrecognised file, NoAudioStream, DecodeFailed, Truncated. A failure to
+// read at all (a missing file, EIO, EACCES, ENOMEM) is a POSIX error.
 #pragma once
 
 #include <cstdint>

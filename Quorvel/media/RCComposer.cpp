@@ -153,6 +153,15 @@ std::int64_t shortfallTolerance(int rate, std::int64_t frameSize) {
   return std::max<std::int64_t>(2 * frameSize, rate / 20);
 }
 
+// A failure while the segment at `index` was read. When it is the media
+// engine's verdict on that fragment's audio (RCIsAudioDataError), it names
+// the segment, so the caller can leave that fragment out and compose the
+// rest; a failure to read at all (I/O, memory) stays as it is.
+platform::Status blamingSegment(platform::Status status, std::size_t index) {
+  if (status || !RCIsAudioDataError(status.error())) return status;
+  return platform::fail(RCComposerSegmentError(index, status.error()));
+}
+
 platform::Error truncatedError(const Input& input, double endSeconds) {
   return RCMediaError(RCMediaErrorCodeTruncated,
                       fmt::format("{} ends at {:.3f}s, before the end of its range at {:.3f}s",
@@ -413,8 +422,9 @@ platform::Status composeByCopy(std::vector<Input>& inputs, const std::string& pa
   StreamCopier copier(**output, parameters, waveform);
   if (auto opened = copier.openWaveformDecoder(parameters); !opened) return opened;
   for (std::size_t i = 0; i < inputs.size(); ++i) {
-    if (auto opened = inputs[i].open(); !opened) return opened;
-    if (auto copied = copier.copy(inputs[i], i == 0, progress); !copied) return copied;
+    if (auto opened = inputs[i].open(); !opened) return blamingSegment(opened, i);
+    if (auto copied = copier.copy(inputs[i], i == 0, progress); !copied)
+      return blamingSegment(copied, i);
     inputs[i].decoder.reset();
     progress.finished(inputs[i]);
   }
@@ -582,10 +592,11 @@ platform::Status composeByReencoding(std::vector<Input>& inputs, const std::stri
   if (!encoder) return platform::fail(encoder.error());
   kept.applyTo((*encoder)->output());
   if (*waveform) *waveform = std::make_unique<RCWaveformBuilder>((*encoder)->sampleRate());
-  for (Input& input : inputs) {
-    if (auto opened = input.open(); !opened) return opened;
+  for (std::size_t i = 0; i < inputs.size(); ++i) {
+    Input& input = inputs[i];
+    if (auto opened = input.open(); !opened) return blamingSegment(opened, i);
     if (auto done = reencodeSegment(input, **encoder, waveform->get(), progress); !done)
-      return done;
+      return blamingSegment(done, i);
     input.decoder.reset();
     progress.finished(input);
   }
@@ -626,7 +637,7 @@ platform::Status compose(const std::vector<RCComposerSegment>& segments,
   inputs.reserve(segments.size());
   for (const RCComposerSegment& segment : segments) {
     Input input{segment, nullptr, nullptr};
-    if (auto opened = input.open(); !opened) return opened;
+    if (auto opened = input.open(); !opened) return blamingSegment(opened, inputs.size());
     input.parameters.reset(avcodec_parameters_alloc());
     if (!input.parameters ||
         avcodec_parameters_copy(input.parameters.get(), input.decoder->codecParameters()) < 0) {

@@ -37,7 +37,11 @@ using RCComposerProgress = std::function<void(double fraction)>;
 // extension picks the container: m4a, flac or wav). Writes the composed
 // waveform to `waveformDestination` when given. Never leaves a half file.
 // Reports its progress to `progress` when given.
-// Errors are in kRCMediaErrorDomain (or POSIX for file system failures).
+// Errors are in kRCMediaErrorDomain (or POSIX for file system failures and
+// other failures to read). When a segment's fragment turns out to hold
+// unusable audio (it does not open as audio, has no audio stream, does not
+// decode, ends early), the error is an RCComposerSegmentError naming that
+// segment's index, with what was found as its underlying error.
 platform::Status RCComposeAudio(
     const std::vector<RCComposerSegment>& segments, const platform::URL& destination,
     const std::optional<platform::URL>& waveformDestination = std::nullopt,

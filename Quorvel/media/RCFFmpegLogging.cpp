@@ -5,6 +5,7 @@ extern "C" {
 #include <libavutil/log.h>
 }
 
+#include <cerrno>
 #include <cstdarg>
 #include <mutex>
 #include <string>
@@ -58,7 +59,32 @@ void RCInstallFFmpegLogging() {
   std::call_once(once, [] { av_log_set_callback(&routeFFmpegLog); });
 }
 
+bool RCIsSystemAVError(int averror) {
+  switch (AVUNERROR(averror)) {
+    case EACCES:
+    case EPERM:
+    case EIO:
+    case ENOMEM:
+    case EMFILE:
+    case ENFILE:
+    case ENOENT:
+    case EAGAIN:
+    case EINTR:
+    case ENXIO:
+    case ENODEV:
+    case EBUSY:
+    case ETIMEDOUT:
+    case ELOOP:
+      return true;
+    default:
+      return false;
+  }
+}
+
 platform::Error RCMediaErrorFromAV(RCMediaErrorCode code, int averror, std::string_view what) {
+  if (averror < 0 && RCIsSystemAVError(averror)) {
+    return platform::posixError(AVUNERROR(averror), what);
+  }
   char text[AV_ERROR_MAX_STRING_SIZE] = {};
   av_strerror(averror, text, sizeof text);
   return RCMediaError(code, fmt::format("{}: {}", what, text));

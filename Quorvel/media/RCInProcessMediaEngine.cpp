@@ -38,27 +38,7 @@ platform::Error assetError(long code, std::string text) {
   return platform::Error(kRCAudioAssetErrorDomain, code, std::move(text));
 }
 
-bool isSystemError(int status) {
-  switch (AVUNERROR(status)) {
-    case EACCES:
-    case EPERM:
-    case EIO:
-    case ENOMEM:
-    case EMFILE:
-    case ENFILE:
-    case ENOENT:
-    case EAGAIN:
-    case EINTR:
-    case ENXIO:
-    case ENODEV:
-    case EBUSY:
-    case ETIMEDOUT:
-    case ELOOP:
-      return true;
-    default:
-      return false;
-  }
-}
+bool isSystemError(int status) { return RCIsSystemAVError(status); }
 
 // Opens `path` with libavformat. Only regular files: a FIFO or a device
 // would block the open or the reads forever.

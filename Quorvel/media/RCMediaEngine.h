@@ -68,7 +68,9 @@ class RCMediaEngine {
 
   // Concatenates the segments' used ranges, in order, into `destination`
   // (replaced atomically), and writes the composed waveform to
-  // `waveformDestination` when given.
+  // `waveformDestination` when given. When a segment's fragment holds
+  // unusable audio, fails with an RCComposerSegmentError naming it (see
+  // RCComposer.h); every other failure says nothing about the fragments.
   virtual platform::Status compose(const std::vector<RCComposerSegment>& segments,
                                    const platform::URL& destination,
                                    const std::optional<platform::URL>& waveformDestination,

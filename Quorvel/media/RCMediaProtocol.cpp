@@ -99,13 +99,22 @@ RCMediaProbe decodeProbe(const json& object) {
   return probe;
 }
 
-json encodeErrorObject(const platform::Error& error) {
+// How deep underlying errors are carried: a compose that blames a segment
+// wraps what reading it found, and nothing needs more.
+constexpr int kMaxErrorDepth = 2;
+
+json encodeErrorObject(const platform::Error& error, int depth = 1) {
   std::string message = error.localizedDescription();
   if (message.size() > kMaxMessageBytes) message.resize(kMaxMessageBytes);
-  return {{"domain", error.domain()}, {"code", error.code()}, {"message", message}};
+  json object{{"domain", error.domain()}, {"code", error.code()}, {"message", message}};
+  if (const platform::Error* underlying = error.underlyingError();
+      underlying != nullptr && depth < kMaxErrorDepth) {
+    object["underlying"] = encodeErrorObject(*underlying, depth + 1);
+  }
+  return object;
 }
 
-platform::Error decodeErrorObject(const json& error) {
+platform::Error decodeErrorObject(const json& error, int depth = 1) {
   if (!error.is_object()) throw Malformed{"\"error\" is not an object"};
   const json& code = field(error, "code");
   if (!code.is_number_integer()) throw Malformed{"\"code\" is not an integer"};
@@ -113,6 +122,11 @@ platform::Error decodeErrorObject(const json& error) {
   if (domain.empty()) throw Malformed{"empty error domain"};
   std::string message = stringField(error, "message");
   if (message.size() > kMaxMessageBytes) message.resize(kMaxMessageBytes);
+  if (auto underlying = error.find("underlying"); underlying != error.end()) {
+    if (depth >= kMaxErrorDepth) throw Malformed{"underlying errors nested too deep"};
+    return platform::Error(std::move(domain), code.get<long>(), std::move(message),
+                           decodeErrorObject(*underlying, depth + 1));
+  }
   return platform::Error(std::move(domain), code.get<long>(), std::move(message));
 }
 

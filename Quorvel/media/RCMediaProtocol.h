@@ -20,6 +20,9 @@
 //   {"id": N, "progress": 0.25}
 //   {"id": N, "result": {}}   (a probe's result holds the probe's fields)
 //   {"id": N, "error": {"domain": "...", "code": 4, "message": "..."}}
+// An error object may carry the error it wraps as "underlying", an error
+// object without one of its own (a compose that blames one segment:
+// RCComposerSegmentError, whose code is the segment's index).
 // A probeMany job answers each file, in order, with an item reply of its
 // own, which also counts as progress; then an empty result ends the job:
 //   {"id": N, "item": {"index": I, "result": {probe fields}}}

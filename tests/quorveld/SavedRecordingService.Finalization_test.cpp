@@ -1,17 +1,20 @@
 // Finalization through the service core on real recordings: an export that
 // composes and caches the waveform first, a recording left by a vanished
-// capture client, the background finalization after a capture, and a bundle
-// that does not load.
+// capture client, the background finalization after a capture, a bundle
+// that does not load, and fragments whose files are damaged.
 #include <gtest/gtest.h>
 
 #include <filesystem>
 #include <fstream>
 
 #include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/media/RCAudioAsset.h"
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "tests/quorveld/ServiceFixture.h"
 #include "tests/support/DelegatingMediaEngine.h"
+#include "tests/support/TempDirectory.h"
 
 namespace quorvel {
 namespace {
@@ -31,6 +34,27 @@ class FinalizationTest : public SessionTest {
     return count;
   }
   bool exists(const platform::URL& url) { return std::filesystem::exists(url.path()); }
+  RCCompositionManifest manifestOf(const RCCompositionEditor& editor) {
+    auto loaded = RCComposition::load(editor.composition()->bundleURL());
+    EXPECT_TRUE(loaded) << loaded.error();
+    return loaded ? (*loaded)->manifest() : RCCompositionManifest{};
+  }
+  double composedSeconds(const RCCompositionEditor& editor) {
+    auto asset = RCAudioAsset::assetWithURL(editor.composedAVURL());
+    return asset ? asset->duration() : -1;
+  }
+  // Overwrites the file's header with bytes no media file starts with, as
+  // a failing disk or a stray write would, keeping its size.
+  static void damage(const std::string& path) {
+    std::fstream file(path, std::ios::binary | std::ios::in | std::ios::out);
+    file << std::string(64, '\x5a');
+  }
+  std::size_t linesAt(int level, std::string_view text) {
+    auto all = lines();
+    return std::size_t(std::ranges::count_if(all, [&](const LogLine& line) {
+      return line.level == level && line.text.find(text) != std::string::npos;
+    }));
+  }
   // Entries of the recordings waiting for a later close to be finalized.
   std::size_t waitingFinalizations() {
     return onServiceQueue<std::size_t>(
@@ -112,6 +136,103 @@ TEST_F(FinalizationTest, ABundleThatDoesNotLoadIsNotExportedAndItsWaveformIsSkip
             std::string::npos);
   EXPECT_EQ(linesContaining("ERROR: Skipping <GenerateWaveformOperation").size(), 1u);
   EXPECT_TRUE(std::filesystem::exists(editor->composition()->bundleURL().path()));
+}
+
+// A fragment damaged after it was recorded is left out of the export and
+// kept; once its bytes are back, the fragment cleanup of the next session
+// takes it back in and the next export composes it again.
+TEST_F(FinalizationTest, ADamagedFragmentIsLeftOutOfTheExportUntilItReadsAgain) {
+  auto editor = makeRecording("Damaged", {0.4, 0.2});
+  ASSERT_TRUE(editor);
+  const std::string name = editor->composedAVURL().lastPathComponent();
+  const std::string fragment = editor->composition()->fragments()[1].AVOutputURL().path();
+  const std::string bytes = testing::readFile(fragment);
+  damage(fragment);
+
+  auto exported = call(":1.1", "PrepareToExport", {url(name), false});
+  advance(0s);
+  end(":1.1", token(exported));
+  settle();
+  EXPECT_NEAR(composedSeconds(*editor), 0.4, 0.03);
+  auto manifest = manifestOf(*editor);
+  ASSERT_EQ(manifest.fragments.size(), 2u);
+  EXPECT_FALSE(manifest.fragments[0].unreadable);
+  EXPECT_TRUE(manifest.fragments[1].unreadable);
+  EXPECT_NEAR(manifest.composedDuration, 0.4, 0.01);
+  EXPECT_TRUE(std::filesystem::exists(fragment));
+  const std::string leftOut =
+      "WARNING: leaving fragment '" + std::filesystem::path(fragment).filename().string() +
+      "' of Damaged.composition out of the composed audio: it cannot be read";
+  EXPECT_EQ(linesAt(platform::kLogLevelError, leftOut), 1u);
+
+  std::ofstream(fragment, std::ios::binary | std::ios::trunc) << bytes;
+  end(":1.2", token(prepare(":1.2", "PrepareToPreview", name)));
+  settle();
+  EXPECT_FALSE(manifestOf(*editor).fragments[1].unreadable);
+  exported = call(":1.1", "PrepareToExport", {url(name), false});
+  advance(0s);
+  end(":1.1", token(exported));
+  settle();
+  EXPECT_NEAR(composedSeconds(*editor), 0.6, 0.03);
+  EXPECT_EQ(decomposed(*editor), 0u);
+  EXPECT_EQ(linesAt(platform::kLogLevelError, leftOut), 1u);
+  expectNothingLeft();
+}
+
+// Fails every job as a media worker that died would.
+class DeadWorkerEngine final : public testing::DelegatingMediaEngine {
+ public:
+  platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
+    return platform::fail(
+        RCMediaError(RCMediaErrorCodeWorkerFailed, "killed probing " + url.path()));
+  }
+  platform::Status compose(const std::vector<RCComposerSegment>&, const platform::URL& destination,
+                           const std::optional<platform::URL>&, const RCMediaProgress&) override {
+    return platform::fail(
+        RCMediaError(RCMediaErrorCodeWorkerFailed, "killed composing " + destination.path()));
+  }
+};
+
+// The export fails (401) when no fragment can be read, and when the media
+// worker fails, which says nothing about the files: then even a damaged
+// fragment is not marked. Either way every file stays.
+TEST_F(FinalizationTest, AnExportWithNoReadableFragmentOrNoWorkerFailsAndKeepsTheFiles) {
+  struct Case {
+    std::string title;
+    std::size_t damaged;  // fragments damaged, from the last
+    std::shared_ptr<RCMediaEngine> engine;
+    std::size_t marked;  // fragments marked unreadable after
+  };
+  for (const Case& c : std::vector<Case>{
+           {"EveryFragmentDamaged", 2, std::make_shared<RCInProcessMediaEngine>(), 2},
+           {"WorkerDied", 1, std::make_shared<DeadWorkerEngine>(), 0},
+       }) {
+    SCOPED_TRACE(c.title);
+    auto editor = makeRecording(c.title, {0.2, 0.2});
+    ASSERT_TRUE(editor);
+    auto fragments = editor->composition()->fragments();
+    for (std::size_t i = fragments.size() - c.damaged; i < fragments.size(); ++i)
+      damage(fragments[i].AVOutputURL().path());
+    RCMediaEngine::setCurrent(c.engine);
+    auto exported = call(":1.1", "PrepareToExport", {url(c.title + ".m4a"), false});
+    advance(0s);
+    RCUseInProcessMediaEngine();
+    ASSERT_TRUE(exported->waitFor(10s));
+    ASSERT_FALSE(exported->isError()) << exported->errorName();
+    EXPECT_EQ(exported->values().at(0).fields().at(1).asInt32(), 0);  // no token
+    auto failed = linesContaining("/" + c.title + ".m4a failed with error: ");
+    ASSERT_EQ(failed.size(), 1u);
+    EXPECT_NE(failed[0].find(std::string(RCSSavedRecordingServiceErrorDomain) + " Code=401"),
+              std::string::npos);
+    auto manifest = manifestOf(*editor);
+    ASSERT_EQ(manifest.fragments.size(), 2u);
+    EXPECT_EQ(std::size_t(std::ranges::count_if(
+                  manifest.fragments, [](const auto& entry) { return entry.unreadable; })),
+              c.marked);
+    for (const auto& fragment : fragments) EXPECT_TRUE(exists(fragment.AVOutputURL()));
+    EXPECT_FALSE(exists(editor->composedAVURL()));
+    settle();
+  }
 }
 
 // Holds every compose at a gate until the test opens it, counting them.

@@ -59,6 +59,15 @@ class TempDirectoryTest : public ::testing::Test {
       if (prefix ? line.starts_with(text) : line.find(text) != std::string::npos) return true;
     return false;
   }
+  // How many captured lines of log level `level` contain `text`.
+  std::size_t loggedCount(std::string_view text, int level) {
+    std::lock_guard lock(logMutex_);
+    const std::string levelPrefix = std::to_string(level) + " ";
+    std::size_t count = 0;
+    for (const auto& line : log_)
+      count += line.starts_with(levelPrefix) && line.find(text) != std::string::npos;
+    return count;
+  }
   // Names of the hidden (temporary) files left in the directory.
   std::vector<std::string> hiddenFiles() const {
     std::vector<std::string> names;

@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <fstream>
+#include <functional>
 #include <future>
 #include <thread>
 
@@ -257,19 +258,20 @@ TEST_P(CompositionControllerTest, UnreadableAudioIsLeftOutAndKept) {
   controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
   ASSERT_EQ(controller->composition()->fragments().size(), 2u);
   EXPECT_FALSE(controller->composition()->fragments()[1].contentDuration());
-  EXPECT_TRUE(logged("cannot be read; keeping it"));
-
-  // The readable rest is composed, even when fragments are deleted after;
-  // the cut-off file stays listed, so nothing deletes it.
-  ASSERT_TRUE(compose(*controller, true, false));
+  EXPECT_TRUE(controller->composition()->manifest().fragments[1].unreadable);
   EXPECT_TRUE(logged("WARNING: leaving fragment '" + cut->lastPathComponent() +
                      "' of Broken.composition out of the composed audio"));
+
+  // The readable rest is composed; the cut-off file stays listed, so
+  // nothing deletes it, and so does the rest, to be composed with it should
+  // it be rescued.
+  ASSERT_TRUE(compose(*controller, true, false));
   EXPECT_NEAR(durationOf(editor->composedAVURL()), 0.5, 0.05);
   EXPECT_TRUE(fs::exists(cut->path()));
   auto reloaded =
       RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
-  ASSERT_EQ(reloaded->composition()->fragments().size(), 1u);
-  EXPECT_TRUE(reloaded->composition()->manifest().fragments[0].unreadable);
+  ASSERT_EQ(reloaded->composition()->fragments().size(), 2u);
+  EXPECT_TRUE(reloaded->composition()->manifest().fragments[1].unreadable);
   EXPECT_TRUE(reloaded->composition()->decomposedFragments().empty());
   EXPECT_NEAR(reloaded->composition()->composedDuration(), 0.5, 1e-6);
 
@@ -286,6 +288,82 @@ TEST_P(CompositionControllerTest, UnreadableAudioIsLeftOutAndKept) {
   EXPECT_FALSE(fs::exists(lone->composedAVURL().path()));
   EXPECT_EQ(nothing->composition()->manifest().serialize(), manifestBefore);
   EXPECT_TRUE(logged("ERROR: composing Lost.m4a failed"));
+}
+
+// A fragment damaged after it was recorded (its length is in the manifest)
+// is left out by the compose that finds it, and kept; the repair keeps it
+// out while it stays as it is, also where only decoding shows the damage,
+// and takes it back once its bytes are restored.
+TEST_P(CompositionControllerTest, ADamagedFragmentIsLeftOutUntilItReadsAgain) {
+  struct Case {
+    std::string name;
+    testing::ToneOptions tone;
+    std::function<void(const std::string& path)> damage;
+  };
+  auto cut = [](double fraction) {
+    return [fraction](const std::string& path) {
+      fs::resize_file(path, std::uintmax_t(double(fs::file_size(path)) * fraction));
+    };
+  };
+  auto overwriteHeader = [](const std::string& path) {
+    std::fstream(path, std::ios::binary | std::ios::in | std::ios::out) << std::string(64, 'Z');
+  };
+  for (const Case& c : std::vector<Case>{
+           {"HeaderOverwritten", {.seconds = 1.0, .format = "wav"}, overwriteHeader},
+           {"MovieHeaderCutOff", {.seconds = 1.0, .format = "m4a"}, cut(0.5)},
+           // The header is intact, so a probe passes: only decoding finds it.
+           {"AudioDataCut",
+            {.seconds = 1.0, .format = "m4a", .layout = testing::M4ALayout::MoovFirst},
+            cut(0.6)},
+       }) {
+    SCOPED_TRACE(c.name);
+    auto editor = RCCompositionEditor::createCompositionForNewRecording(*model_, c.name, "m4a");
+    ASSERT_TRUE(editor);
+    testing::ToneOptions first = c.tone, last = c.tone;
+    first.seconds = 0.5;
+    last.seconds = 0.25;
+    for (const auto& [file, tone] :
+         {std::pair{"first", first}, {"damaged", c.tone}, {"last", last}}) {
+      std::string path = (root_ / "sources" / (c.name + file + "." + tone.format)).string();
+      ASSERT_TRUE(testing::writeTone(path, tone));
+      ASSERT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(path)));
+    }
+    const std::string damaged = editor->composition()->fragments()[1].AVOutputURL().path();
+    const std::string bytes = testing::readFile(damaged);
+    c.damage(damaged);
+    auto controller =
+        RCCompositionController::compositionControllerForComposedAVURL(editor->composedAVURL());
+
+    // Fragments are deleted once composed, but not while one is left out:
+    // it can only be composed back in its place with the others.
+    ASSERT_TRUE(compose(*controller, /*deleteFragments=*/true, false));
+    EXPECT_NEAR(durationOf(editor->composedAVURL()), 0.75, 0.05);
+    const std::string leftOut = "WARNING: leaving fragment '" +
+                                fs::path(damaged).filename().string() + "' of " + c.name +
+                                ".composition out of the composed audio";
+    EXPECT_EQ(loggedCount(leftOut, platform::kLogLevelError), 1u);
+    RCCompositionManifest composed = controller->composition()->manifest();
+    ASSERT_EQ(composed.fragments.size(), 3u);
+    EXPECT_TRUE(composed.fragments[0].composed && composed.fragments[2].composed);
+    EXPECT_TRUE(composed.fragments[1].unreadable);
+    EXPECT_FALSE(composed.fragments[1].composed);
+    EXPECT_EQ(composed.fragments[1].timeRangeInComposition, (RCTimeRange{0.5, 0}));
+    EXPECT_NEAR(composed.composedDuration, 0.75, 0.01);
+    for (const auto& fragment : controller->composition()->fragments()) {
+      EXPECT_TRUE(fs::exists(fragment.AVOutputURL().path()));
+    }
+
+    controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+    EXPECT_EQ(controller->composition()->manifest(), composed);
+
+    std::ofstream(damaged, std::ios::binary | std::ios::trunc) << bytes;
+    controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+    ASSERT_EQ(controller->composition()->decomposedFragments().size(), 1u);
+    ASSERT_TRUE(compose(*controller, false, false));
+    // AAC fragments join on whole frames, a few per join.
+    EXPECT_NEAR(durationOf(editor->composedAVURL()), 1.75, 0.1);
+    EXPECT_EQ(loggedCount(leftOut, platform::kLogLevelError), 1u);
+  }
 }
 
 TEST_P(CompositionControllerTest, ComposedAndDeletedFragmentsComeBackForTheNextTrim) {

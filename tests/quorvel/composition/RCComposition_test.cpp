@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/composition/RCCompositionController.h"
 #include "Quorvel/composition/RCCompositionManifest.h"
 #include "Quorvel/errors/RCErrors.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
@@ -34,6 +35,17 @@ TEST(CompositionManifestTest, RoundTripsAndLaysFragmentsEndToEnd) {
   EXPECT_DOUBLE_EQ(manifest.composedDuration, 2.0);  // the open-ended one counts 0
   EXPECT_EQ(manifest.fragments[1].timeRangeInComposition, (RCTimeRange{2.0, 0}));
   auto parsed = RCCompositionManifest::parse(manifest.serialize());
+  ASSERT_TRUE(parsed) << parsed.error();
+  EXPECT_EQ(*parsed, manifest);
+
+  // An unreadable fragment is out of the composed audio, whatever length it
+  // had: it takes no time, and the mark survives the trip.
+  manifest.fragments.insert(manifest.fragments.begin(),
+                            {"c.flac", {0, 0}, 0, 3.0, false, /*unreadable=*/true});
+  manifest.recomputeTimeRanges();
+  EXPECT_DOUBLE_EQ(manifest.composedDuration, 2.0);
+  EXPECT_EQ(manifest.fragments[1].timeRangeInComposition, (RCTimeRange{0, 2.0}));
+  parsed = RCCompositionManifest::parse(manifest.serialize());
   ASSERT_TRUE(parsed) << parsed.error();
   EXPECT_EQ(*parsed, manifest);
 }
@@ -156,6 +168,18 @@ TEST_F(CompositionTest, BundlesThatMustNotLoadAreRefusedLoggedAndLeftUntouched) 
          fs::create_symlink(outside / "secret.m4a", b / "f.m4a");
        },
        "symbolic link"},
+      {"EscapingFragment",
+       [&](const fs::path& b) {
+         writeFile(b / "manifest.json",
+                   manifestText("EscapingFragment.m4a", "../../outside/secret.m4a"));
+       },
+       "not a plain file name"},
+      {"AbsoluteFragment",
+       [&](const fs::path& b) {
+         writeFile(b / "manifest.json",
+                   manifestText("AbsoluteFragment.m4a", (outside / "secret.m4a").string()));
+       },
+       "not a plain file name"},
       {"DirectoryFragment",
        [&](const fs::path& b) {
          writeFile(b / "manifest.json", manifestText("DirectoryFragment.m4a", "f.m4a"));
@@ -190,6 +214,12 @@ TEST_F(CompositionTest, BundlesThatMustNotLoadAreRefusedLoggedAndLeftUntouched) 
         platform::URL::fileURLWithPath(bundle.string())));
     EXPECT_TRUE(logged("ERROR: cannot load the composition '" + c.name + ".composition'"))
         << c.name;
+    // So neither the repair nor composing ever reads or removes what it names.
+    auto controller = RCCompositionController::compositionControllerForComposedAVURL(
+        platform::URL::fileURLWithPath((recordings_ / (c.name + ".m4a")).string()));
+    EXPECT_FALSE(controller->composition()) << c.name;
+    controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+    EXPECT_FALSE(controller->composeNow(/*deleteFragments=*/true, false)) << c.name;
     if (!before.empty()) {
       EXPECT_EQ(readFile(bundle / "manifest.json"), before) << c.name;
     }

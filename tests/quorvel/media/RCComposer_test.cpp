@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -253,31 +254,47 @@ TEST_F(ComposerTest, BadInputFailsWithoutTouchingTheDestination) {
   ASSERT_TRUE(writeTone(path("old.m4a"), 0.5, "m4a", 44100, 1, 100));
   const std::string before = testing::readFile(path("old.m4a"));
   const double nan = std::nan("");
+  // `blamed`: the segment a failure of the fragment's own audio names, so
+  // the caller can leave it out; none where the failure says nothing about a
+  // fragment (a file that could not be looked at, a bad request, the output).
   struct Case {
     const char* what;
     std::vector<RCComposerSegment> segments;
     platform::URL destination;
+    std::optional<std::size_t> blamed;
   };
   const platform::URL old = url("old.m4a");
+  const std::nullopt_t none = std::nullopt;
   for (const Case& c : std::vector<Case>{
-           {"no fragments", {}, old},
-           {"missing fragment", {{url("good.m4a"), 0, 1}, {url("gone.m4a"), 0, 1}}, old},
-           {"text renamed", {{url("good.m4a"), 0, 1}, {url("text.m4a"), 0, 1}}, old},
-           {"truncated data", {{url("good.wav"), 0, 1}, {url("cut.wav"), 0, 2}}, old},
-           {"truncated audio (copy)", {{url("good.m4a"), 0, 1}, {url("cutdata.m4a"), 0, 2}}, old},
-           {"range past the end (copy)", {{url("good.m4a"), 0.5, 1.5}}, old},
-           {"range past the end (re-encode)", {{url("good.wav"), 0, 2}}, old},
-           {"no audio stream", {{url("video.m4a"), 0, 0.5}}, old},
-           {"negative start", {{url("good.m4a"), -1, 1}}, old},
-           {"empty range", {{url("good.m4a"), 0, 0}}, old},
-           {"NaN range", {{url("good.m4a"), nan, 1}}, old},
-           {"unknown container", {{url("good.m4a"), 0, 1}}, url("out.mp3")},
-           {"missing directory", {{url("good.m4a"), 0, 1}}, url("nowhere/out.m4a")},
+           {"no fragments", {}, old, none},
+           {"missing fragment", {{url("good.m4a"), 0, 1}, {url("gone.m4a"), 0, 1}}, old, none},
+           {"text renamed", {{url("good.m4a"), 0, 1}, {url("text.m4a"), 0, 1}}, old, 1},
+           {"truncated data", {{url("good.wav"), 0, 1}, {url("cut.wav"), 0, 2}}, old, 1},
+           {"truncated audio (copy)",
+            {{url("good.m4a"), 0, 1}, {url("cutdata.m4a"), 0, 2}},
+            old,
+            1},
+           {"movie header cut off", {{url("cut.m4a"), 0, 1}, {url("good.m4a"), 0, 1}}, old, 0},
+           {"range past the end (copy)", {{url("good.m4a"), 0.5, 1.5}}, old, 0},
+           {"range past the end (re-encode)", {{url("good.wav"), 0, 2}}, old, 0},
+           {"no audio stream", {{url("video.m4a"), 0, 0.5}}, old, 0},
+           {"negative start", {{url("good.m4a"), -1, 1}}, old, none},
+           {"empty range", {{url("good.m4a"), 0, 0}}, old, none},
+           {"NaN range", {{url("good.m4a"), nan, 1}}, old, none},
+           {"unknown container", {{url("good.m4a"), 0, 1}}, url("out.mp3"), none},
+           {"missing directory", {{url("good.m4a"), 0, 1}}, url("nowhere/out.m4a"), none},
        }) {
     SCOPED_TRACE(c.what);
     auto status = RCComposeAudio(c.segments, c.destination, url("old.waveform"));
     ASSERT_FALSE(status);
     EXPECT_FALSE(status.error().localizedDescription().empty());
+    EXPECT_EQ(RCComposerFailedSegment(status.error()), c.blamed) << status.error();
+    if (c.blamed) {
+      ASSERT_NE(status.error().underlyingError(), nullptr);
+      EXPECT_TRUE(RCIsAudioDataError(*status.error().underlyingError()));
+    } else {
+      EXPECT_FALSE(RCIsAudioDataError(status.error())) << status.error();
+    }
     EXPECT_EQ(testing::readFile(path("old.m4a")), before);
     EXPECT_FALSE(fs::exists(path("old.waveform")));
     EXPECT_FALSE(fs::exists(path("out.mp3")));

@@ -114,6 +114,15 @@ TEST(MediaProtocolTest, RequestsAndRepliesSurviveTheTrip) {
   EXPECT_EQ(*reply->error, platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorNoMovie));
   EXPECT_EQ(reply->error->localizedDescription().size(), 4096u);  // long messages are cut
 
+  // A compose that blames a segment: the index and what was found both arrive.
+  reply = RCMediaDecodeReply(RCMediaEncodeError(
+      10, RCComposerSegmentError(3, RCMediaError(RCMediaErrorCodeTruncated, "b.m4a ends early"))));
+  ASSERT_TRUE(reply) << reply.error();
+  EXPECT_EQ(RCComposerFailedSegment(*reply->error), 3u);
+  ASSERT_NE(reply->error->underlyingError(), nullptr);
+  EXPECT_EQ(*reply->error->underlyingError(), RCMediaError(RCMediaErrorCodeTruncated, ""));
+  EXPECT_EQ(reply->error->underlyingError()->localizedDescription(), "b.m4a ends early");
+
   reply = RCMediaDecodeReply(RCMediaEncodeProgress(9, 0.5));
   ASSERT_TRUE(reply);
   EXPECT_EQ(reply->kind, RCMediaReply::Kind::Progress);
@@ -139,6 +148,11 @@ TEST(MediaProtocolTest, MalformedMessagesAreErrorValues) {
            "\"titles\":[],\"created\":1e300}}",
            "{\"id\":1,\"error\":{\"domain\":\"\",\"code\":1,\"message\":\"\"}}",
            "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1.5,\"message\":\"\"}}",
+           "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1,\"message\":\"\","
+           "\"underlying\":7}}",
+           "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1,\"message\":\"\","
+           "\"underlying\":{\"domain\":\"d\",\"code\":1,\"message\":\"\",\"underlying\":"
+           "{\"domain\":\"d\",\"code\":1,\"message\":\"\"}}}}",
            "{\"id\":1,\"item\":[]}",
            "{\"id\":1,\"item\":{\"result\":{}}}",
            "{\"id\":1,\"item\":{\"index\":-1,\"error\":{\"domain\":\"d\",\"code\":1,"
