@@ -65,7 +65,9 @@ class RCCompositionController {
   // global queue; returns at once. On success every fragment is marked
   // composed and the manifest saved; with deleteFragments the manifest drops
   // the fragments first and their files are removed after. Nothing to
-  // compose (no decomposed fragments) is a success that touches nothing.
+  // compose (no decomposed fragments) is a success that touches nothing but
+  // the database's duration of the recording, when it differs from the
+  // composed one (a compose interrupted after its manifest was saved).
   // `completionBlock` runs exactly once, on a global queue thread.
   // canGenerateWaveformByProcessingAVURL is accepted for the interface; the
   // composer always computes the waveform from the audio it writes.
