@@ -62,14 +62,15 @@ struct Call {
   bool inDirectory = false;
 };
 std::optional<Call> parseCall(const std::string& line, const std::string& dir) {
-  const std::size_t space = line.find(' ');
+  // strace pads the process id to a width.
+  const std::size_t name = line.find_first_not_of(' ', line.find(' '));
   const std::size_t paren = line.find('(');
-  if (space == std::string::npos || paren == std::string::npos || paren < space) return {};
-  if (line.compare(space + 1, 4, "<...") == 0 || line.compare(space + 1, 3, "+++") == 0 ||
-      line.compare(space + 1, 3, "---") == 0) {
+  if (name == std::string::npos || paren == std::string::npos || paren < name) return {};
+  if (line.compare(name, 4, "<...") == 0 || line.compare(name, 3, "+++") == 0 ||
+      line.compare(name, 3, "---") == 0) {
     return {};  // a resumed call (counted at its start), an exit, a signal
   }
-  Call call{line.substr(space + 1, paren - space - 1)};
+  Call call{line.substr(name, paren - name)};
   // The first argument, or the second after AT_FDCWD.
   const std::string arguments = line.substr(paren + 1);
   std::size_t end = arguments.find(", ");
