@@ -476,7 +476,13 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
     return platform::fail(
         RCError(RCErrorCodeInvalidManifest, "there is no composition to compose"));
   }
-  if (current->decomposedFragments().empty()) return recordComposedDuration(*current);
+  // Nothing to compose. A compose interrupted between its manifest and the
+  // database left the old duration there: brought up to date now (a failure
+  // is logged; the composed audio the caller asked for is there).
+  if (current->decomposedFragments().empty()) {
+    (void)recordComposedDuration(*current);
+    return {};
+  }
 
   // One bundle is composed by one job at a time, whatever URL spelling or
   // controller asked: two composes of the same files would each take the
@@ -492,7 +498,10 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
       std::lock_guard lock(state_->mutex);
       state_->composition = current;
     }
-    if (current->decomposedFragments().empty()) return recordComposedDuration(*current);
+    if (current->decomposedFragments().empty()) {
+      (void)recordComposedDuration(*current);
+      return {};
+    }
   }
 
   RCCompositionManifest manifest = current->manifest();

@@ -67,7 +67,8 @@ class RCCompositionController {
   // the fragments first and their files are removed after. Nothing to
   // compose (no decomposed fragments) is a success that touches nothing but
   // the database's duration of the recording, when it differs from the
-  // composed one (a compose interrupted after its manifest was saved).
+  // composed one (a compose interrupted after its manifest was saved). A
+  // database that does not take the new duration after a compose fails it.
   // `completionBlock` runs exactly once, on a global queue thread.
   // canGenerateWaveformByProcessingAVURL is accepted for the interface; the
   // composer always computes the waveform from the audio it writes.
