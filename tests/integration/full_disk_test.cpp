@@ -62,7 +62,10 @@ class FullDiskTest : public ::testing::Test {
     bus_.reset();
     RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
     if (mounted_) ::umount2(disk_.c_str(), MNT_DETACH);
-    if (!disk_.empty()) fs::remove_all(disk_);
+    if (!disk_.empty()) {
+      fs::remove_all(disk_);
+      fs::remove(disk_.string() + "-take.wav");
+    }
   }
 
   void startDaemon() {
