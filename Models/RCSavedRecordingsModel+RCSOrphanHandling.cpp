@@ -314,11 +314,18 @@ void RCSOrphanHandling::performOrphanRecoveryAndCleanupWithExternallyInUseCompos
     std::string stem = dot == std::string::npos || dot < slash ? path : path.substr(0, dot);
     for (const std::string& extension : extensions) inUse->addPath(stem + "." + extension);
   });
-  if (!walked || !fileManager.directoryResolved()) {
-    ORPHAN_LOG("ERROR: leaving the recordings directory alone: {}",
-               walked ? "it cannot be resolved"
-                      : "the recordings database cannot be read: " +
-                            walked.error().localizedDescription());
+  // The walk above counts recordings inserted but not saved yet, such as
+  // those of an earlier run whose save failed (a full disk): unsaved, they
+  // would keep their files from being recovered for good. So they are saved
+  // now, or the run touches nothing.
+  platform::Status saved = walked ? model_.saveIfNecessary() : platform::Status();
+  if (!walked || !saved || !fileManager.directoryResolved()) {
+    ORPHAN_LOG(
+        "ERROR: leaving the recordings directory alone: {}",
+        !walked ? "the recordings database cannot be read: " + walked.error().localizedDescription()
+        : !saved
+            ? "the recordings database cannot be saved: " + saved.error().localizedDescription()
+            : std::string("it cannot be resolved"));
   } else {
     std::vector<platform::URL> listing = fileManager.list(*inUse);
     statistics_.listedEntries = listing.size();

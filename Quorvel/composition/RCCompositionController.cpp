@@ -357,22 +357,27 @@ void removeLeftoverTemporaryFiles(const platform::URL& destination) {
 
 // The database's duration of a recording follows its composed audio. The
 // caller's model (if any) belongs to its own queue, so this writes through a
-// connection of its own; a failure is logged and changes nothing else.
-void recordComposedDuration(const RCComposition& composition) {
-  if (composition.savedRecordingURI().empty()) return;
+// connection of its own. Writes only when the duration differs, so a compose
+// that was interrupted after saving its manifest has the database brought
+// up to date by the next one, which finds nothing else to do.
+platform::Status recordComposedDuration(const RCComposition& composition) {
+  if (composition.savedRecordingURI().empty()) return {};
   auto model = RCSavedRecordingsModel::modelWithDirectory(RCSavedRecordingsDirectory());
   auto recording =
       model ? (*model)->recordingWithURIRepresentation(composition.savedRecordingURI())
             : platform::Result<std::shared_ptr<RCSavedRecording>>(platform::fail(model.error()));
-  if (!recording) {
-    QV_LOG(platform::kLogLevelError, "WARNING: cannot record the duration of {}: {}",
-           composition.composedAVURL().lastPathComponent(), recording.error());
-    return;
-  }
-  if (*recording &&
+  platform::Status status = recording ? platform::Status() : platform::fail(recording.error());
+  if (recording && *recording &&
       std::abs((*recording)->duration() - composition.composedDuration()) > kDurationTolerance) {
-    (*recording)->setDuration(composition.composedDuration());
+    (*model)->performWithSavingDisabled(
+        [&] { (*recording)->setDuration(composition.composedDuration()); });
+    status = (*model)->saveIfNecessary();
   }
+  if (!status) {
+    QV_LOG(platform::kLogLevelError, "ERROR: cannot record the duration of {}: {}",
+           composition.composedAVURL().lastPathComponent(), status.error());
+  }
+  return status;
 }
 
 // `read` gives what reading a file finds. With `report`, what the repair
@@ -551,9 +556,15 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
         RCError(RCErrorCodeInvalidManifest, "there is no composition to compose"));
   }
   // With every fragment left out there is no audio at all: composing finds
-  // out whether one reads again, or fails.
+  // out whether one reads again, or fails. Nothing to compose otherwise: a
+  // compose interrupted between its manifest and the database left the old
+  // duration there, brought up to date now (a failure is logged; the
+  // composed audio the caller asked for is there).
   auto nothingToDo = [](const RCComposition& composition) {
-    return composition.decomposedFragments().empty() && !composition.allFragmentsUnreadable();
+    if (!composition.decomposedFragments().empty() || composition.allFragmentsUnreadable())
+      return false;
+    (void)recordComposedDuration(composition);
+    return true;
   };
   if (nothingToDo(*current)) return {};
 
@@ -672,11 +683,15 @@ platform::Status RCCompositionController::composeNow(bool deleteFragments, bool 
   }
   auto replacement = std::make_shared<RCComposition>(current->bundleURL(), std::move(manifest));
   if (auto saved = replacement->saveMetadataToDefaultLocation(); !saved) return saved;
-  recordComposedDuration(*replacement);
   {
     std::lock_guard lock(state_->mutex);
     state_->composition = replacement;
   }
+  // The composed audio and the manifest are in place; a database that did
+  // not take the new duration fails the compose (the next one, with nothing
+  // left to compose, records it), and the fragments' files, no longer
+  // listed, are left to the fragment cleanup.
+  if (auto recorded = recordComposedDuration(*replacement); !recorded) return recorded;
   for (const platform::URL& url : toDelete) {
     if (auto removed = RCRemoveItemInSavedRecordingsDirectory(url); !removed) {
       QV_LOG(platform::kLogLevelError, "WARNING: cannot delete composed fragment '{}': {}",

@@ -74,7 +74,10 @@ class RCCompositionController {
   // unless a fragment was left out (then every fragment and file stays, so
   // it can be composed back in its place). Nothing to compose (no
   // decomposed fragments, and not every fragment unreadable) is a success
-  // that touches nothing.
+  // that touches nothing but the database's duration of the recording, when
+  // it differs from the composed one (a compose interrupted after its
+  // manifest was saved). A database that does not take the new duration
+  // after a compose fails it.
   // `completionBlock` runs exactly once, on a global queue thread.
   // canGenerateWaveformByProcessingAVURL is accepted for the interface; the
   // composer always computes the waveform from the audio it writes.

@@ -384,8 +384,10 @@ KeptMetadata keptMetadataFor(const platform::URL& destination,
 }
 
 // Commits the composed file, carrying the titles of the file it replaces
-// into it first (m4a). A title written meanwhile replaces the file under
-// us; the commit then fails as changed, and the titles are read again.
+// into it first (m4a). A title that cannot be carried over fails the
+// compose: committing without it would lose it with the old file. A title
+// written meanwhile replaces the file under us; the commit then fails as
+// changed, and the titles are read again.
 platform::Status commitKeepingTitles(RCReplacementFile& file, const platform::URL& destination,
                                      const std::string& extension) {
   constexpr int kAttempts = 5;
@@ -398,8 +400,9 @@ platform::Status commitKeepingTitles(RCReplacementFile& file, const platform::UR
       for (const RCMetadataItem& item : titles ? *titles : std::vector<RCMetadataItem>()) {
         if (auto written = RCMP4WriteTitle(file.tempPath(), item.stringValue, item.language);
             !written) {
-          QV_LOG(platform::kLogLevelError, "WARNING: cannot keep a title of {}: {}",
+          QV_LOG(platform::kLogLevelError, "ERROR: cannot keep a title of {}: {}",
                  destination.lastPathComponent(), written.error());
+          return written;
         }
       }
     }

@@ -75,8 +75,13 @@ struct SavedRecordingServiceClient::Impl {
           } catch (const sdbus::Error& e) {
             return handler(std::nullopt, malformedReply(method, e.getMessage()));
           }
-          auto token = RCSSavedRecordingAccessToken::fromTuple(
-              {wire.get<0>(), wire.get<1>(), wire.get<2>(), wire.get<3>()});
+          const RCSSavedRecordingAccessToken::Tuple tuple{wire.get<0>(), wire.get<1>(),
+                                                          wire.get<2>(), wire.get<3>()};
+          // No token and no error: access was not granted (an export whose
+          // recording could not be finalized).
+          if (tuple == RCSSavedRecordingAccessToken::noTokenTuple())
+            return handler(std::nullopt, std::nullopt);
+          auto token = RCSSavedRecordingAccessToken::fromTuple(tuple);
           if (!token) return handler(std::nullopt, malformedReply(method, "not a token"));
           handler(std::move(token), std::nullopt);
         },
