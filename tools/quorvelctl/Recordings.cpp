@@ -83,7 +83,9 @@ int showRecording(const std::string& text, bool json) {
   if (json) {
     nlohmann::json fragments = nlohmann::json::array();
     for (const auto& fragment : manifest.fragments) {
-      fragments.push_back({{"file", fragment.file}, {"composed", fragment.composed}});
+      fragments.push_back({{"file", fragment.file},
+                           {"composed", fragment.composed},
+                           {"unreadable", fragment.unreadable}});
     }
     std::printf("%s\n", nlohmann::json{{"compositionAVURL", url.absoluteString()},
                                        {"composedDuration", manifest.composedDuration},
@@ -99,7 +101,9 @@ int showRecording(const std::string& text, bool json) {
               manifest.composedDuration, exists(waveform) ? "present" : "missing");
   for (const auto& fragment : manifest.fragments) {
     std::printf("    %s (%s)\n", fragment.file.c_str(),
-                fragment.composed ? "composed" : "not composed yet");
+                fragment.unreadable ? "unreadable: left out of the composed file"
+                : fragment.composed ? "composed"
+                                    : "not composed yet");
   }
   return 0;
 }
