@@ -142,8 +142,11 @@ class RCSOrphanHandling::FileManager {
       std::free(resolved);
     }
     if (found->second) return directory_ + path.substr(slash);
+    elsewhere_.push_back(path);
     return path;
   }
+  // The paths canonicalPath() found outside the directory.
+  const std::vector<std::string>& elsewhere() const { return elsewhere_; }
 
   // Lists the directory: one lstat per entry, and whether `inUse` holds it.
   // A directory that cannot be listed gives no entries.
@@ -230,6 +233,7 @@ class RCSOrphanHandling::FileManager {
   std::string resolvedDirectory_;
   std::unordered_map<std::string, bool> resolvedParents_;
   std::unordered_map<std::string, Entry> entries_;
+  std::vector<std::string> elsewhere_;
   std::optional<bool> foldsCase_;
 };
 
@@ -447,12 +451,21 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
     inUseIdentities.insert(Identity{info.st_dev, info.st_ino});
     if (S_ISREG(info.st_mode) && info.st_size > 0) inUseBySize.emplace(info.st_size, path);
   };
-  for (const std::string& path : inUse.paths()) {
-    Entry entry = fileManager.entryFor(path);
-    if (S_ISLNK(entry.info.st_mode) || (!entry.exists && fileManager.foldsCase())) {
-      entry = FileManager::statNow(path);
-    }
+  auto noteMember = [&](const std::string& path, Entry entry) {
+    if (!entry.exists || S_ISLNK(entry.info.st_mode)) entry = FileManager::statNow(path);
     if (entry.exists) noteInUse(path, entry.info);
+  };
+  const std::string prefix = fileManager.directory() + "/";
+  for (const auto& [name, entry] : fileManager.entries()) {
+    if (!entry.exists) continue;
+    std::string path = prefix + name;
+    if (entry.inUse || inUse.containsPath(path)) noteMember(path, entry);
+  }
+  for (const std::string& path : fileManager.elsewhere()) noteMember(path, Entry{});
+  if (fileManager.foldsCase()) {
+    for (const std::string& path : inUse.paths()) {
+      if (!fileManager.entryFor(path).exists) noteMember(path, Entry{});
+    }
   }
   auto forgetInUse = [&](const std::string& path) {
     std::erase_if(inUseBySize, [&](const auto& member) { return member.second == path; });
