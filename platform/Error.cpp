@@ -17,8 +17,7 @@ Error::Error(std::string domain, long code, std::string description, Error under
 std::string Error::description() const {
   std::string text = fmt::format("Error Domain={} Code={}", domain_, code_);
   if (!description_.empty()) text += fmt::format(" \"{}\"", description_);
-  if (underlying_)
-    text += fmt::format(" (underlying error: {})", underlying_->description());
+  if (underlying_) text += fmt::format(" (underlying error: {})", underlying_->description());
   return text;
 }
 
