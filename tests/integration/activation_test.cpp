@@ -148,7 +148,7 @@ TEST_F(ActivationTest, InstalledUnitExposureIsAtMostThree) {
   const std::string text = readFile(unit);
   for (const char* directive :
        {"Type=dbus\n", "BusName=org.quorvel.SavedRecordingService\n",
-        "Environment=SQLITE_AUTO_TRACE=1\n", "ReadWritePaths=%h/.local/share/quorvel\n",
+        "Environment=SQLITE_AUTO_TRACE=1\n", "ReadWritePaths=-%h/.local/share/quorvel\n",
         "RestrictAddressFamilies=AF_UNIX\n", "SystemCallFilter=@system-service\n"}) {
     EXPECT_NE(text.find(directive), std::string::npos) << directive;
   }
