@@ -24,7 +24,6 @@ class Date {
 
   double timeIntervalSinceNow() const;
   double timeIntervalSince1970() const;
-  Clock::time_point timePoint() const { return time_; }
   // "2024-05-01T10:20:30.500Z" (UTC, milliseconds).
   std::string ISO8601String() const;
 

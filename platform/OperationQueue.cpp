@@ -173,11 +173,6 @@ void OperationQueue::setSuspended(bool suspended) {
   state_->schedule();
 }
 
-bool OperationQueue::isSuspended() const {
-  std::lock_guard lock(state_->mutex);
-  return state_->suspended;
-}
-
 std::size_t OperationQueue::operationCount() const {
   std::lock_guard lock(state_->mutex);
   return state_->unfinished;

@@ -35,7 +35,6 @@ class OperationQueue {
   void setMaxConcurrentOperationCount(int count);
   int maxConcurrentOperationCount() const;
   void setSuspended(bool suspended);
-  bool isSuspended() const;
   // Operations queued and not yet finished (running ones included).
   std::size_t operationCount() const;
   // Blocks until every queued operation has finished and its completion

@@ -65,7 +65,6 @@ class AssetAccessSessionController {
   // What dumpState() prints.
   std::string stateDescription();
 
-  platform::SerialQueue& serialQueue() { return _serialQueue; }
   std::string description() const;
 
  private:

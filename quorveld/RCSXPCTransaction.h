@@ -41,7 +41,6 @@ class RCSXPCTransaction : public std::enable_shared_from_this<RCSXPCTransaction>
   static std::vector<std::shared_ptr<RCSXPCTransaction>> activeTransactions();
 
   const std::string& name() const { return _name; }
-  void setName(std::string name) { _name = std::move(name); }
   const platform::UUID& _identifier() const { return _uuid; }
   // <RCSXPCTransaction 0x…, name = "…">
   std::string description() const;

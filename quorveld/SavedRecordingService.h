@@ -247,7 +247,6 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   void _handleDebugSignal();
 
   platform::SerialQueue& serviceSerialQueue() { return _serviceSerialQueue; }
-  platform::SerialQueue& instanceSerialQueue() { return _serialQueue; }
   AssetAccessSessionController& assetSessionController() { return *_assetSesionController; }
   std::shared_ptr<platform::Listener> listener() const { return _xpcListener; }
   std::string description() const;

@@ -121,7 +121,7 @@ platform::URL RCComposition::URLForFragmentFile(const std::string& name) const {
 
 RCCompositionFragment RCComposition::fragmentFor(const RCCompositionManifestFragment& entry) const {
   return RCCompositionFragment(URLForFragmentFile(entry.file), entry.timeRangeInComposition,
-                               entry.contentStart, entry.contentDuration, entry.composed);
+                               entry.contentStart, entry.contentDuration);
 }
 
 std::vector<RCCompositionFragment> RCComposition::fragments() const {

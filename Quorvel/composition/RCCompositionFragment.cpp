@@ -7,12 +7,11 @@ namespace quorvel {
 RCCompositionFragment::RCCompositionFragment(platform::URL AVOutputURL,
                                              RCTimeRange timeRangeInComposition,
                                              double contentStart,
-                                             std::optional<double> contentDuration, bool composed)
+                                             std::optional<double> contentDuration)
     : AVOutputURL_(std::move(AVOutputURL)),
       timeRangeInComposition_(timeRangeInComposition),
       contentStart_(contentStart),
-      contentDuration_(contentDuration),
-      composed_(composed) {}
+      contentDuration_(contentDuration) {}
 
 RCCompositionFragment::RCCompositionFragment(platform::URL AVOutputURL)
     : AVOutputURL_(std::move(AVOutputURL)) {}

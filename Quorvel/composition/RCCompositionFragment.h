@@ -18,7 +18,7 @@ namespace quorvel {
 class RCCompositionFragment {
  public:
   RCCompositionFragment(platform::URL AVOutputURL, RCTimeRange timeRangeInComposition,
-                        double contentStart, std::optional<double> contentDuration, bool composed);
+                        double contentStart, std::optional<double> contentDuration);
   // A fragment that is only a file (an orphan).
   explicit RCCompositionFragment(platform::URL AVOutputURL);
 
@@ -29,8 +29,6 @@ class RCCompositionFragment {
   double contentStart() const { return contentStart_; }
   // Seconds of the file used; nullopt while it is being captured (to the end).
   const std::optional<double>& contentDuration() const { return contentDuration_; }
-  // Whether its audio is already in the composed file.
-  bool isComposed() const { return composed_; }
 
   // Removes the file through the confined removal of the recordings directory:
   // refused outside it or through a symbolic link. Blocks on the file system.
@@ -41,7 +39,6 @@ class RCCompositionFragment {
   RCTimeRange timeRangeInComposition_;
   double contentStart_ = 0;
   std::optional<double> contentDuration_;
-  bool composed_ = false;
 };
 
 }  // namespace quorvel

@@ -47,8 +47,6 @@ void RCSQLiteStatement::bind(int index, double value) {
   sqlite3_bind_double(statement_, index, value);
 }
 
-void RCSQLiteStatement::bindNull(int index) { sqlite3_bind_null(statement_, index); }
-
 platform::Result<bool> RCSQLiteStatement::step() {
   int rc = sqlite3_step(statement_);
   if (rc == SQLITE_ROW) return true;
@@ -151,10 +149,6 @@ platform::Result<std::optional<std::string>> RCSQLiteDatabase::textForQueryRetry
     if (!busy || std::chrono::steady_clock::now() >= deadline) return result;
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
   }
-}
-
-platform::Error RCSQLiteDatabase::lastError(std::string_view what) const {
-  return RCSQLiteError(sqlite3_extended_errcode(db_), what, sqlite3_errmsg(db_));
 }
 
 }  // namespace quorvel

@@ -26,7 +26,6 @@ class RCSQLiteStatement {
   // Parameters are numbered from 1.
   void bind(int index, std::string_view text);
   void bind(int index, double value);
-  void bindNull(int index);
 
   // Steps once: true when a row is ready, false when done.
   platform::Result<bool> step();
@@ -69,9 +68,6 @@ class RCSQLiteDatabase {
   // every few milliseconds for up to `timeoutMilliseconds`.
   platform::Result<std::optional<std::string>> textForQueryRetryingWhileBusy(
       std::string_view sql, int timeoutMilliseconds);
-
-  // The connection's current error as an Error, with `what` in its text.
-  platform::Error lastError(std::string_view what) const;
 
  private:
   explicit RCSQLiteDatabase(sqlite3* db) : db_(db) {}

@@ -33,7 +33,6 @@ class RCAudioDecoder {
   RCAudioDecoder& operator=(const RCAudioDecoder&) = delete;
 
   const platform::URL& url() const { return url_; }
-  AVFormatContext* formatContext() const { return format_; }
   AVStream* stream() const { return stream_; }
   const AVCodecParameters* codecParameters() const;
   // The duration the container declares for the stream (or the file), in
@@ -46,7 +45,6 @@ class RCAudioDecoder {
 
   // Opens the codec (once). Needed before decode().
   platform::Status openCodec();
-  AVCodecContext* codecContext() const { return codec_; }
   using FrameHandler = std::function<platform::Status(AVFrame* frame)>;
   // Sends `packet` (nullptr: drain at the end) and hands every frame the
   // codec returns to `handler`, whose failure stops and is returned.

@@ -20,8 +20,6 @@ constexpr const char* kAllowedFormats = "mov,mp4,m4a,3gp,3g2,mj2,flac,wav,mp3,og
 
 void RCRestrictMediaInputs() { restricted = true; }
 
-bool RCMediaInputsAreRestricted() { return restricted; }
-
 int RCOpenMediaInput(AVFormatContext** context, const char* path) {
   if (!restricted) return avformat_open_input(context, path, nullptr, nullptr);
   AVDictionary* options = nullptr;

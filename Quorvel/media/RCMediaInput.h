@@ -15,7 +15,6 @@ namespace quorvel {
 
 // From now on, every RCOpenMediaInput in this process is restricted.
 void RCRestrictMediaInputs();
-bool RCMediaInputsAreRestricted();
 
 // avformat_open_input(context, path) with the restrictions when they apply.
 // Returns FFmpeg's result.

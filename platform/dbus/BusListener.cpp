@@ -83,7 +83,6 @@ struct BusListener::Loop {
   std::thread thread;
   std::thread::id threadId;
   int wakeFd = -1;
-  std::atomic<bool> lost{false};
 
   ~Loop() {
     if (wakeFd >= 0) ::close(wakeFd);
@@ -284,7 +283,6 @@ void BusListener::run() {
     }
   } catch (const sdbus::Error& error) {
     QV_LOG(kLogLevelError, "lost the bus: {} {}", error.getName(), error.getMessage());
-    loop_->lost.store(true);
     busLost();
   }
   std::deque<std::function<void()>> dropped;
@@ -366,7 +364,5 @@ bool BusListener::isOnBusThread() const {
   std::lock_guard lock(loop_->mutex);
   return loop_->started && loop_->threadId == std::this_thread::get_id();
 }
-
-bool BusListener::hasLostBus() const { return loop_->lost.load(); }
 
 }  // namespace platform

@@ -55,8 +55,6 @@ class BusListener final : public Listener {
   std::string uniqueName() const;
   // Whether the calling thread is the bus thread.
   bool isOnBusThread() const;
-  // Whether the bus connection was lost.
-  bool hasLostBus() const;
   // Runs `task` on the bus thread, between two messages. Returns false (and
   // drops the task) when the bus thread is not running.
   bool performOnBusThread(std::function<void()> task);
