@@ -1,8 +1,8 @@
 #!/usr/bin/env bash
 # The installed user unit serves a new account's very first call, under a real
-# systemd user manager: the build is installed into a prefix, its unit and
-# activation file are linked into an empty home as a user would link them,
-# and a call to the service name must start quorveld through D-Bus
+# systemd user manager: the build is installed into an empty home's ~/.local,
+# where the user manager finds the unit and the session bus the activation
+# file, and a call to the service name must start quorveld through D-Bus
 # activation before ~/.local/share/quorvel exists, then compose an export
 # through the sandboxed media worker.
 #
@@ -27,14 +27,11 @@ if [ -z "${QUORVEL_USER_UNIT_INSIDE:-}" ]; then
 fi
 
 fail() { echo "FAIL: $*" >&2; exit 1; }
-# Not below /tmp or /var/tmp, which PrivateTmp= hides from the unit.
 work=$binary_dir/user-unit-test
 rm -rf "$work" && mkdir -p "$work" || fail "cannot make $work"
 trap 'systemctl --user exit >/dev/null 2>&1; sleep 0.5; kill -9 $manager 2>/dev/null; rm -rf "$work"' EXIT
 manager=
 
-cmake --install "$binary_dir" --prefix "$work/prefix" >/dev/null || fail "cmake --install"
-prefix=$work/prefix
 audio=$work/take.wav
 ffmpeg -loglevel error -f lavfi -i sine=duration=1 "$audio" || fail "ffmpeg"
 
@@ -45,12 +42,13 @@ mkdir -m 700 /run/user/0
 export XDG_RUNTIME_DIR=/run/user/0
 export HOME=/root  # the user manager takes the account's own home
 mount -t tmpfs tmpfs "$HOME" || skip "cannot mount a fresh home"
+# Installed into the account's own prefix, as a user without root would (the
+# build directory may be below /tmp, which PrivateTmp= hides from the unit).
+prefix=$HOME/.local
+cmake --install "$binary_dir" --prefix "$prefix" >/dev/null || fail "cmake --install"
 
 units=$HOME/.config/systemd/user
-mkdir -p "$units/quorveld.service.d" "$HOME/.local/share/dbus-1/services"
-ln -s "$prefix/share/systemd/user/quorveld.service" "$units/"
-ln -s "$prefix/share/dbus-1/services/org.quorvel.SavedRecordingService.service" \
-  "$HOME/.local/share/dbus-1/services/"
+mkdir -p "$units/quorveld.service.d"
 printf '[Service]\nProtectKernelTunables=no\nProtectKernelLogs=no\n' \
   >"$units/quorveld.service.d/container.conf"
 
