@@ -15,3 +15,10 @@ if(QUORVEL_FUZZ)
   add_compile_options(-fsanitize=fuzzer-no-link,address,undefined -fno-omit-frame-pointer)
   add_link_options(-fsanitize=address,undefined)
 endif()
+
+# QUORVEL_COVERAGE=ON instruments everything for gcov (scripts/coverage).
+option(QUORVEL_COVERAGE "Build with gcov instrumentation" OFF)
+if(QUORVEL_COVERAGE)
+  add_compile_options(--coverage -fprofile-update=atomic)
+  add_link_options(--coverage)
+endif()
