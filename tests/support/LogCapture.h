@@ -1,0 +1,73 @@
+// LogCapture: the log lines written while it exists, with their levels,
+// instead of the console or the journal. It lowers the threshold to `level`
+// (tracing by default) and puts the threshold and the sink back when it goes.
+// One at a time per process. Owned by the test; lines may be written from any
+// thread, and waitFor() waits for one without sleeping.
+#pragma once
+
+#include <algorithm>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/Log.h"
+#include "tests/support/Gate.h"
+
+namespace quorvel::testing {
+
+struct LogLine {
+  int level;
+  std::string text;
+  bool operator==(const LogLine&) const = default;
+};
+
+class LogCapture {
+ public:
+  explicit LogCapture(int level = platform::kLogLevelDebug) {
+    platform::setConsoleLogging(false);
+    platform::setLogThreshold(level);
+    platform::setLogSinkForTesting([this](int lineLevel, std::string_view text) {
+      gate_.update([&] { lines_.push_back({lineLevel, std::string(text)}); });
+    });
+  }
+  ~LogCapture() {
+    platform::setLogSinkForTesting(nullptr);
+    platform::setLogThreshold(platform::kLogLevelNotice);
+  }
+  LogCapture(const LogCapture&) = delete;
+  LogCapture& operator=(const LogCapture&) = delete;
+
+  std::vector<LogLine> lines() {
+    std::lock_guard lock(gate_.mutex());
+    return lines_;
+  }
+  // The texts captured so far, and forgets them.
+  std::vector<std::string> take() {
+    std::lock_guard lock(gate_.mutex());
+    std::vector<std::string> texts;
+    for (auto& line : lines_) texts.push_back(std::move(line.text));
+    lines_.clear();
+    return texts;
+  }
+  // How many lines contain `text` (of `level`, when given).
+  std::size_t count(std::string_view text, int level = -1) {
+    std::lock_guard lock(gate_.mutex());
+    return countLocked(text, level);
+  }
+  bool contains(std::string_view text, int level = -1) { return count(text, level) > 0; }
+  // Waits (up to Gate's bound) until a line contains `text`.
+  bool waitFor(std::string_view text, int level = -1) {
+    return gate_.waitUntil([&] { return countLocked(text, level) > 0; });
+  }
+
+ private:
+  std::size_t countLocked(std::string_view text, int level) const {
+    return std::ranges::count_if(lines_, [&](const LogLine& line) {
+      return (level < 0 || line.level == level) && line.text.find(text) != std::string::npos;
+    });
+  }
+  platform::testing::Gate gate_;
+  std::vector<LogLine> lines_;
+};
+
+}  // namespace quorvel::testing
