@@ -1,10 +1,10 @@
 // How the daemon runs media jobs in worker processes.
 //
-// Starting. Workers are spawned from one long-lived thread of their own: the
-// kernel's parent-death signal fires when the *thread* that created a child
-// ends, and job threads (the global queue's, the metadata loader's) are not
-// promised to live as long as the daemon. The worker's socket end is dup'ed
-// to descriptor 3 in the child and every other descriptor from 3 up is
+// Starting. The worker sets its own parent-death signal, which the kernel
+// sends when the *thread* that spawned it ends, and job threads (the global
+// queue's, the metadata loader's) come and go; so workers are spawned through
+// Subprocess from a thread that outlives them. The worker's socket end is
+// moved to descriptor 3 in the child and every other descriptor from 3 up is
 // closed, so nothing of the daemon (bus socket, database) leaks into it; the
 // signal mask and dispositions are reset to defaults.
 //
@@ -47,7 +47,6 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
-#include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -58,14 +57,11 @@
 #include <cmath>
 #include <cstring>
 #include <filesystem>
-#include <future>
 
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "platform/Log.h"
-#include "platform/SerialQueue.h"
-
-extern char** environ;
+#include "platform/Subprocess.h"
 
 namespace quorvel {
 
@@ -86,36 +82,19 @@ platform::Error workerError(std::string text) {
   return RCMediaError(RCMediaErrorCodeWorkerFailed, std::move(text));
 }
 
-std::string signalName(int signal) {
-  const char* abbreviation = ::sigabbrev_np(signal);
-  return abbreviation ? std::string("SIG") + abbreviation : "signal " + std::to_string(signal);
-}
-
 std::string secondsText(std::chrono::duration<double> seconds) {
   return fmt::format("{:g} s", seconds.count());
-}
-
-platform::SerialQueue& spawnerQueue() {
-  // Lives until the process ends: its thread is every worker's parent.
-  static platform::SerialQueue* queue = new platform::SerialQueue("org.quorvel.media-spawner");
-  return *queue;
 }
 
 }  // namespace
 
 struct RCMediaWorkerClient::Worker {
+  std::optional<platform::Subprocess> process;  // killed and reaped when the worker goes
   pid_t pid = -1;
   int fd = -1;
-  bool reaped = false;
-  int status = 0;
 
   ~Worker() {
     if (fd >= 0) ::close(fd);
-    if (pid > 0 && !reaped) {
-      ::kill(pid, SIGKILL);
-      while (::waitpid(pid, nullptr, 0) < 0 && errno == EINTR) {
-      }
-    }
   }
 
   // Whether an idle worker has gone (exited on its idle timer, or died).
@@ -124,21 +103,14 @@ struct RCMediaWorkerClient::Worker {
     return ::poll(&entry, 1, 0) != 0;
   }
 
-  // Kills (when `kill`) and reaps the process; its exit status lands in status.
-  void reap(bool kill) {
-    if (reaped || pid <= 0) return;
-    if (kill) ::kill(pid, SIGKILL);
-    while (::waitpid(pid, &status, 0) < 0) {
-      if (errno != EINTR) break;
-    }
-    reaped = true;
+  // Kills (when `kill`) and reaps the process; its wait status.
+  int reap(bool kill) {
+    if (!process) return 0;
+    if (kill) process->kill(SIGKILL);
+    return process->wait();
   }
 
-  std::string fate() const {
-    if (WIFSIGNALED(status)) return "died with " + signalName(WTERMSIG(status));
-    if (WIFEXITED(status)) return "exited with status " + std::to_string(WEXITSTATUS(status));
-    return "ended";
-  }
+  std::string fate() { return platform::Subprocess::describeStatus(reap(false)); }
 };
 
 std::string RCMediaWorkerClient::defaultWorkerPath() {
@@ -227,40 +199,20 @@ platform::Result<std::unique_ptr<RCMediaWorkerClient::Worker>> RCMediaWorkerClie
   for (const std::string& directory : options_.extraSandboxDirectories) {
     arguments.push_back("--allow=" + directory);
   }
-  std::vector<char*> argv;
-  argv.reserve(arguments.size() + 1);
-  for (std::string& argument : arguments) argv.push_back(argument.data());
-  argv.push_back(nullptr);
-
-  std::promise<int> spawned;
-  pid_t pid = -1;
-  spawnerQueue().async([&] {
-    posix_spawn_file_actions_t actions;
-    posix_spawnattr_t attributes;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawnattr_init(&attributes);
-    posix_spawn_file_actions_adddup2(&actions, childEnd, kWorkerSocketFd);
-    posix_spawn_file_actions_addclosefrom_np(&actions, kWorkerSocketFd + 1);
-    sigset_t none, defaults;
-    sigemptyset(&none);
-    sigemptyset(&defaults);
-    for (int signal : {SIGPIPE, SIGUSR1, SIGUSR2, SIGHUP, SIGINT, SIGTERM, SIGCHLD}) {
-      sigaddset(&defaults, signal);
-    }
-    posix_spawnattr_setsigmask(&attributes, &none);
-    posix_spawnattr_setsigdefault(&attributes, &defaults);
-    posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
-    int result = ::posix_spawn(&pid, argv[0], &actions, &attributes, argv.data(), environ);
-    posix_spawn_file_actions_destroy(&actions);
-    posix_spawnattr_destroy(&attributes);
-    spawned.set_value(result);
-  });
-  const int result = spawned.get_future().get();
+  // The worker sets its own parent-death signal, so it is spawned from a
+  // thread that lives as long as it does.
+  auto spawned = platform::Subprocess::spawn({.arguments = std::move(arguments),
+                                              .descriptors = {{kWorkerSocketFd, childEnd}},
+                                              .closeFrom = kWorkerSocketFd + 1,
+                                              .outlivesSpawningThread = true});
   ::close(childEnd);
-  if (result != 0) {
-    return platform::fail(workerError(
-        fmt::format("cannot start the media worker {}: {}", workerPath_, std::strerror(result))));
+  if (!spawned) {
+    return platform::fail(
+        workerError(fmt::format("cannot start the media worker {}: {}", workerPath_,
+                                std::strerror(int(spawned.error().code())))));
   }
+  const pid_t pid = spawned->pid();
+  worker->process = std::move(*spawned);
   worker->pid = pid;
   QV_LOG(platform::kLogLevelDebug, "Started {} (pid {})", kWorkerName, pid);
   return worker;
@@ -425,8 +377,8 @@ platform::Result<RCMediaReply> RCMediaWorkerClient::run(RCMediaRequest request,
       }
       // End of file (or a reset): the worker is gone or going.
       worker->reap(false);
-      if (!replied && attempt < kAttempts && WIFEXITED(worker->status) &&
-          WEXITSTATUS(worker->status) == 0) {
+      const int status = worker->reap(false);
+      if (!replied && attempt < kAttempts && WIFEXITED(status) && WEXITSTATUS(status) == 0) {
         break;  // exited idle under the request, which it never read
       }
       failure = workerError(fmt::format("{} {} while {}", kWorkerName, worker->fate(), doing));

@@ -21,6 +21,7 @@
 #include <condition_variable>
 #include <csignal>
 #include <cstdio>
+#include <cstring>
 #include <future>
 #include <mutex>
 #include <optional>
@@ -32,6 +33,7 @@
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
+#include "platform/Subprocess.h"
 #include "tools/quorvelctl/Recordings.h"
 #include "tools/quorvelctl/WaveformPicture.h"
 
@@ -88,29 +90,17 @@ std::optional<platform::URL> parseURL(const std::string& text) {
 
 // Runs `command` and returns its exit status (128 + signal when killed).
 int runCommand(const std::vector<std::string>& command) {
-  std::vector<char*> argv;
-  argv.reserve(command.size() + 1);
-  for (const auto& arg : command) argv.push_back(const_cast<char*>(arg.c_str()));
-  argv.push_back(nullptr);
-  pid_t child = fork();
-  if (child < 0) {
-    std::perror("quorvelctl: fork");
+  auto child = platform::Subprocess::spawn(
+      {.arguments = command, .searchPath = true, .closeFrom = std::nullopt});
+  if (!child) {
+    std::fprintf(stderr, "quorvelctl: cannot run %s: %s\n", command.front().c_str(),
+                 std::strerror(int(child.error().code())));
     return 127;
-  }
-  if (child == 0) {
-    execvp(argv[0], argv.data());
-    std::fprintf(stderr, "quorvelctl: cannot run %s: %s\n", argv[0], std::strerror(errno));
-    _exit(127);
   }
   // While COMMAND runs it owns the terminal's interrupts; we only wait.
   std::signal(SIGINT, SIG_IGN);
   std::signal(SIGQUIT, SIG_IGN);
-  int status = 0;
-  while (waitpid(child, &status, 0) < 0 && errno == EINTR) {
-  }
-  if (WIFEXITED(status)) return WEXITSTATUS(status);
-  if (WIFSIGNALED(status)) return 128 + WTERMSIG(status);
-  return 1;
+  return platform::Subprocess::exitCode(child->wait());
 }
 
 // Hands the token back. The call expects no reply, so a round trip behind
