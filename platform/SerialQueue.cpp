@@ -114,54 +114,94 @@ struct SerialQueue::State {
   // under `mutex`; read without it only by a sync caller spinning for it.
   std::atomic<bool> owned{false};
   bool stopping = false;
+  // The worker thread exists only while it has work or has had some within
+  // kWorkerLinger: `workerRunning` while its loop runs, `worker` the handle of
+  // the latest one (joined when the next one starts, or by the destructor).
+  bool workerRunning = false;
   std::thread::id workerId;
   std::thread worker;
 };
 
+namespace {
+
+// How long an idle worker waits for more work before its thread ends. Long
+// enough that a busy queue keeps its thread, short enough that an idle daemon
+// has none.
+constexpr auto kWorkerLinger = std::chrono::seconds(1);
+
+}  // namespace
+
+void SerialQueue::workerLoop() {
+  State& state = *state_;
+  std::unique_lock lock(state.mutex);
+  for (;;) {
+    const bool woken = state.wake.wait_for(lock, kWorkerLinger, [&] {
+      return (!state.items.empty() && !state.owned) ||
+             (state.stopping && state.items.empty() && !state.owned);
+    });
+    if (!woken && state.items.empty()) break;  // idle for a while: the thread goes
+    if (!woken) continue;            // owned by a sync caller or an adopted run: it hands work back
+    if (state.items.empty()) break;  // stopping and drained
+    Item item = std::move(state.items.front());
+    state.items.pop_front();
+    state.owned = true;
+    if (item.gate != nullptr) {
+      // Hand the queue to the waiting sync caller; it clears `owned`.
+      item.gate->signal = SyncGate::Signal::Granted;
+      item.gate->signalled.notify_one();
+      continue;
+    }
+    lock.unlock();
+    {
+      detail::ScopedCurrentQueue scope(*this);
+      item.task();
+      item.task = nullptr;  // destroy captures while still on the queue
+    }
+    lock.lock();
+    state.owned = false;
+  }
+  state.workerRunning = false;
+  state.workerId = {};
+}
+
+void SerialQueue::wakeWorker(std::unique_lock<std::mutex>& lock) {
+  State& state = *state_;
+  if (state.workerRunning) {
+    state.wake.notify_one();
+    return;
+  }
+  // The previous worker has left its loop; it only has to return.
+  std::thread finished = std::move(state.worker);
+  state.workerRunning = true;
+  state.worker = std::thread([this] { workerLoop(); });
+  state.workerId = state.worker.get_id();
+  if (finished.joinable()) {
+    lock.unlock();
+    finished.join();
+    lock.lock();
+  }
+}
+
 SerialQueue::SerialQueue(std::string label) : state_(std::make_unique<State>()) {
   state_->label = std::move(label);
-  State& state = *state_;
-  state_->worker = std::thread([this, &state] {
-    std::unique_lock lock(state.mutex);
-    for (;;) {
-      state.wake.wait(lock, [&] {
-        return (!state.items.empty() && !state.owned) ||
-               (state.stopping && state.items.empty() && !state.owned);
-      });
-      if (state.items.empty()) return;  // stopping and drained
-      Item item = std::move(state.items.front());
-      state.items.pop_front();
-      state.owned = true;
-      if (item.gate != nullptr) {
-        // Hand the queue to the waiting sync caller; it clears `owned`.
-        item.gate->signal = SyncGate::Signal::Granted;
-        item.gate->signalled.notify_one();
-        continue;
-      }
-      lock.unlock();
-      {
-        detail::ScopedCurrentQueue scope(*this);
-        item.task();
-        item.task = nullptr;  // destroy captures while still on the queue
-      }
-      lock.lock();
-      state.owned = false;
-    }
-  });
-  state_->workerId = state_->worker.get_id();
 }
 
 SerialQueue::~SerialQueue() {
-  QV_MISUSE(std::this_thread::get_id() == state_->workerId || detail::isRunningOnQueue(*this),
-            "SerialQueue '{}' destroyed from its own queue", state_->label);
+  QV_MISUSE(detail::isRunningOnQueue(*this), "SerialQueue '{}' destroyed from its own queue",
+            state_->label);
   // Adopted by this thread: its tasks run now, as the worker would run them.
   if (takeAdopted(this)) runAdopted(*this);
+  std::thread worker;
   {
-    std::lock_guard lock(state_->mutex);
+    std::unique_lock lock(state_->mutex);
+    QV_MISUSE(state_->workerRunning && state_->workerId == std::this_thread::get_id(),
+              "SerialQueue '{}' destroyed from its own queue", state_->label);
     state_->stopping = true;
+    // What is still queued runs before the queue goes, on a worker.
+    if (!state_->items.empty() || state_->workerRunning) wakeWorker(lock);
+    worker = std::move(state_->worker);
   }
-  state_->wake.notify_all();
-  state_->worker.join();
+  if (worker.joinable()) worker.join();
 }
 
 void SerialQueue::async(Task task) { enqueue(std::move(task), false); }
@@ -169,19 +209,16 @@ void SerialQueue::async(Task task) { enqueue(std::move(task), false); }
 void SerialQueue::asyncOnWorker(Task task) { enqueue(std::move(task), true); }
 
 void SerialQueue::enqueue(Task task, bool workerOnly) {
-  bool wake;
-  {
-    std::lock_guard lock(state_->mutex);
-    // An owned queue is passed on by its owner, who looks at the FIFO first.
-    wake = !state_->owned;
-    if (wake && !workerOnly && tAdoption.open && state_->items.empty()) {
-      state_->owned = true;
-      tAdoption.queues.push_back(this);
-      wake = false;
-    }
-    state_->items.push_back(Item{std::move(task), nullptr, workerOnly});
+  std::unique_lock lock(state_->mutex);
+  // An owned queue is passed on by its owner, who looks at the FIFO first.
+  bool wake = !state_->owned;
+  if (wake && !workerOnly && tAdoption.open && state_->items.empty()) {
+    state_->owned = true;
+    tAdoption.queues.push_back(this);
+    wake = false;
   }
-  if (wake) state_->wake.notify_one();
+  state_->items.push_back(Item{std::move(task), nullptr, workerOnly});
+  if (wake) wakeWorker(lock);
 }
 
 void SerialQueue::sync(Task task) {
@@ -225,31 +262,28 @@ void SerialQueue::sync(Task task) {
     }
   }
   struct Release {
-    State& state;
+    SerialQueue& queue;
     ~Release() {
-      bool work;
-      {
-        std::lock_guard lock(state.mutex);
-        state.owned = false;
-        if (!state.items.empty() && state.items.front().gate != nullptr) {
-          // The next in line is another sync caller: wake it to take the
-          // queue, first in line, without a round trip through the worker.
-          // The queue is not handed to it while it sleeps: a caller that
-          // comes back at once (a loop of table updates) would otherwise
-          // find the queue owned by a thread that is not running yet, and
-          // go to sleep in turn, and the two would take turns sleeping.
-          SyncGate* next = state.items.front().gate;
-          state.items.pop_front();
-          next->signal = SyncGate::Signal::Retry;
-          next->signalled.notify_one();
-          return;
-        }
-        work = !state.items.empty() || state.stopping;
+      State& state = *queue.state_;
+      std::unique_lock lock(state.mutex);
+      state.owned = false;
+      if (!state.items.empty() && state.items.front().gate != nullptr) {
+        // The next in line is another sync caller: wake it to take the
+        // queue, first in line, without a round trip through the worker.
+        // The queue is not handed to it while it sleeps: a caller that
+        // comes back at once (a loop of table updates) would otherwise
+        // find the queue owned by a thread that is not running yet, and
+        // go to sleep in turn, and the two would take turns sleeping.
+        SyncGate* next = state.items.front().gate;
+        state.items.pop_front();
+        next->signal = SyncGate::Signal::Retry;
+        next->signalled.notify_one();
+        return;
       }
-      // An idle queue's worker has nothing to do: leave it asleep.
-      if (work) state.wake.notify_one();
+      // An idle queue's worker has nothing to do: leave it asleep (or gone).
+      if (!state.items.empty() || (state.stopping && state.workerRunning)) queue.wakeWorker(lock);
     }
-  } release{state};
+  } release{*this};
   detail::ScopedCurrentQueue scope(*this);
   task();
 }
@@ -264,7 +298,7 @@ void SerialQueue::runAdopted(SerialQueue& queue) {
       state.owned = false;
       // Signalled with the lock held: a stopping queue may be freed as soon
       // as its worker, woken by this, has left.
-      if (!state.items.empty() || state.stopping) state.wake.notify_one();
+      if (!state.items.empty() || (state.stopping && state.workerRunning)) queue.wakeWorker(lock);
       return;
     }
     Item item = std::move(state.items.front());
@@ -305,9 +339,9 @@ SerialQueue::AdoptionScope::~AdoptionScope() {
     // Leaving through an exception: hand the work to the worker instead of
     // running tasks in the middle of unwinding.
     State& state = *queue->state_;
-    std::lock_guard lock(state.mutex);
+    std::unique_lock lock(state.mutex);
     state.owned = false;
-    state.wake.notify_one();
+    if (!state.items.empty() || state.stopping) queue->wakeWorker(lock);
   }
 }
 

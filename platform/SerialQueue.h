@@ -1,6 +1,10 @@
-// SerialQueue: one worker thread running tasks one at a time, FIFO. The
-// owner destroys it; destruction runs the tasks already queued, then joins
-// the thread (never destroy a queue from its own thread).
+// SerialQueue: tasks run one at a time, FIFO. The owner destroys it;
+// destruction runs the tasks already queued, then joins the worker (never
+// destroy a queue from its own thread).
+//
+// The worker thread exists only while asynchronous work is queued (and for a
+// second after, in case more comes): a queue entered only with sync() costs
+// no thread.
 //
 // sync() waits for its turn in the FIFO, then runs the task on the calling
 // thread while the worker holds off; meanwhile the caller counts as running
@@ -13,6 +17,7 @@
 #pragma once
 
 #include <memory>
+#include <mutex>
 #include <string>
 
 #include "platform/DispatchQueue.h"
@@ -64,6 +69,11 @@ class SerialQueue final : public DispatchQueue {
  private:
   struct State;
   void enqueue(Task task, bool workerOnly);
+  // The worker's loop; it returns once the queue has been idle a while.
+  void workerLoop();
+  // Wakes the worker, starting one if none runs. Called with the queue's
+  // mutex held through `lock`, which it may release and take again.
+  void wakeWorker(std::unique_lock<std::mutex>& lock);
   // Runs an adopted queue's tasks on the calling thread (see AdoptionScope).
   static void runAdopted(SerialQueue& queue);
   std::unique_ptr<State> state_;

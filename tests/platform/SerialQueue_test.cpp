@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <barrier>
+#include <filesystem>
 #include <future>
 #include <latch>
 #include <memory>
@@ -91,6 +92,31 @@ TEST(SerialQueueTest, DestructionRunsWhatIsQueuedIncludingWhatTasksQueue) {
     release.set_value();
   }
   EXPECT_EQ(ran.load(), 101);
+}
+
+std::size_t threadCount() {
+  return std::distance(std::filesystem::directory_iterator("/proc/self/task"),
+                       std::filesystem::directory_iterator());
+}
+
+// A queue entered only synchronously costs no thread; a worker started for
+// asynchronous work ends once the queue has been idle a while.
+TEST(SerialQueueTest, NeedsAThreadOnlyWhileAsyncWorkIsQueued) {
+  const std::size_t before = threadCount();
+  SerialQueue queue("test.lazy");
+  for (int i = 0; i < 100; ++i) queue.sync([] {});
+  EXPECT_LE(threadCount(), before);
+  std::promise<std::size_t> during;
+  queue.async([&] { during.set_value(threadCount()); });
+  EXPECT_GE(during.get_future().get(), before + 1);
+  const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (threadCount() > before && std::chrono::steady_clock::now() < until)
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));  // the worker's end has no event
+  EXPECT_LE(threadCount(), before);
+  // A new worker takes what comes later.
+  std::promise<void> again;
+  queue.async([&] { again.set_value(); });
+  again.get_future().get();
 }
 
 TEST(SerialQueueTest, TasksNeverOverlapUnderConcurrentAsyncAndSync) {
