@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <cctype>
-#include <new>
 
 extern "C" {
 #include <libavcodec/avcodec.h>
@@ -67,12 +66,7 @@ AVSampleFormat sampleFormatFor(const AVCodec* codec, int bits) {
 
 }  // namespace
 
-RCAudioEncoder::~RCAudioEncoder() {
-  av_packet_free(&packet_);
-  av_frame_free(&frame_);
-  if (fifo_) av_audio_fifo_free(fifo_);
-  avcodec_free_context(&codec_);
-}
+RCAudioEncoder::~RCAudioEncoder() = default;
 
 platform::Result<std::unique_ptr<RCAudioEncoder>> RCAudioEncoder::open(
     const std::string& path, std::string_view extension, const AVCodecParameters* model) {
@@ -86,11 +80,10 @@ platform::Result<std::unique_ptr<RCAudioEncoder>> RCAudioEncoder::open(
     return platform::fail(RCMediaError(RCMediaErrorCodeUnsupportedFormat,
                                        fmt::format("no audio encoder for \".{}\"", extension)));
   std::unique_ptr<RCAudioEncoder> encoder(new RCAudioEncoder());
-  encoder->codec_ = avcodec_alloc_context3(codec);
-  encoder->frame_ = av_frame_alloc();
-  encoder->packet_ = av_packet_alloc();
-  if (!encoder->codec_ || !encoder->frame_ || !encoder->packet_) throw std::bad_alloc();
-  AVCodecContext* c = encoder->codec_;
+  encoder->codec_ = RCAVOwn<RCAVCodecContextPtr>(avcodec_alloc_context3(codec));
+  encoder->frame_ = RCAVMakeFrame();
+  encoder->packet_ = RCAVMakePacket();
+  AVCodecContext* c = encoder->codec_.get();
   const int bits = bitsOf(model);
   c->sample_rate = supportedRate(codec, model->sample_rate);
   if (model->ch_layout.order == AV_CHANNEL_ORDER_NATIVE)
@@ -117,15 +110,12 @@ platform::Result<std::unique_ptr<RCAudioEncoder>> RCAudioEncoder::open(
       (codec->capabilities & AV_CODEC_CAP_VARIABLE_FRAME_SIZE) || c->frame_size <= 0
           ? 4096
           : c->frame_size;
-  encoder->fifo_ =
-      av_audio_fifo_alloc(c->sample_fmt, c->ch_layout.nb_channels, encoder->frameSize_);
-  if (!encoder->fifo_) throw std::bad_alloc();
+  encoder->fifo_ = RCAVOwn<RCAVAudioFifoPtr>(
+      av_audio_fifo_alloc(c->sample_fmt, c->ch_layout.nb_channels, encoder->frameSize_));
 
-  AVCodecParameters* parameters = avcodec_parameters_alloc();
-  if (!parameters) throw std::bad_alloc();
-  avcodec_parameters_from_context(parameters, c);
-  auto output = RCAudioOutput::open(path, extension, parameters);
-  avcodec_parameters_free(&parameters);
+  auto parameters = RCAVOwn<RCAVCodecParametersPtr>(avcodec_parameters_alloc());
+  avcodec_parameters_from_context(parameters.get(), c);
+  auto output = RCAudioOutput::open(path, extension, parameters.get());
   if (!output) return platform::fail(output.error());
   encoder->output_ = std::move(*output);
   return encoder;
@@ -137,7 +127,7 @@ const AVChannelLayout& RCAudioEncoder::channelLayout() const { return codec_->ch
 
 platform::Status RCAudioEncoder::write(const std::uint8_t* const* data, int count) {
   if (count <= 0) return {};
-  if (av_audio_fifo_write(fifo_, reinterpret_cast<void**>(const_cast<std::uint8_t**>(data)),
+  if (av_audio_fifo_write(fifo_.get(), reinterpret_cast<void**>(const_cast<std::uint8_t**>(data)),
                           count) < count)
     throw std::bad_alloc();
   framesIn_ += count;
@@ -145,34 +135,35 @@ platform::Status RCAudioEncoder::write(const std::uint8_t* const* data, int coun
 }
 
 platform::Status RCAudioEncoder::encodeFromFifo(bool final) {
-  while (av_audio_fifo_size(fifo_) >= frameSize_ || (final && av_audio_fifo_size(fifo_) > 0)) {
-    const int count = std::min(frameSize_, av_audio_fifo_size(fifo_));
-    av_frame_unref(frame_);
+  while (av_audio_fifo_size(fifo_.get()) >= frameSize_ ||
+         (final && av_audio_fifo_size(fifo_.get()) > 0)) {
+    const int count = std::min(frameSize_, av_audio_fifo_size(fifo_.get()));
+    av_frame_unref(frame_.get());
     frame_->nb_samples = count;
     frame_->format = codec_->sample_fmt;
     frame_->sample_rate = codec_->sample_rate;
     av_channel_layout_copy(&frame_->ch_layout, &codec_->ch_layout);
-    if (av_frame_get_buffer(frame_, 0) < 0) throw std::bad_alloc();
-    av_audio_fifo_read(fifo_, reinterpret_cast<void**>(frame_->data), count);
+    if (av_frame_get_buffer(frame_.get(), 0) < 0) throw std::bad_alloc();
+    av_audio_fifo_read(fifo_.get(), reinterpret_cast<void**>(frame_->data), count);
     frame_->pts = nextPts_;
     nextPts_ += count;
-    if (auto encoded = encodeFrame(frame_); !encoded) return encoded;
+    if (auto encoded = encodeFrame(frame_.get()); !encoded) return encoded;
   }
   return {};
 }
 
 platform::Status RCAudioEncoder::encodeFrame(AVFrame* frame) {
-  int result = avcodec_send_frame(codec_, frame);
+  int result = avcodec_send_frame(codec_.get(), frame);
   if (result < 0 && result != AVERROR_EOF)
     return platform::fail(
         RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot encode audio"));
   for (;;) {
-    result = avcodec_receive_packet(codec_, packet_);
+    result = avcodec_receive_packet(codec_.get(), packet_.get());
     if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
     if (result < 0)
       return platform::fail(
           RCMediaErrorFromAV(RCMediaErrorCodeEncodeFailed, result, "cannot encode audio"));
-    if (auto written = output_->writePacket(packet_); !written) return written;
+    if (auto written = output_->writePacket(packet_.get()); !written) return written;
   }
 }
 

@@ -11,18 +11,8 @@
 #include <string>
 #include <string_view>
 
+#include "Quorvel/media/RCFFmpegResource.h"
 #include "platform/Error.h"
-
-extern "C" {
-#include <libavutil/channel_layout.h>
-#include <libavutil/samplefmt.h>
-}
-
-struct AVAudioFifo;
-struct AVCodecContext;
-struct AVCodecParameters;
-struct AVFrame;
-struct AVPacket;
 
 namespace quorvel {
 
@@ -57,11 +47,11 @@ class RCAudioEncoder {
   platform::Status encodeFromFifo(bool final);
   platform::Status encodeFrame(AVFrame* frame);
 
-  AVCodecContext* codec_ = nullptr;
+  RCAVCodecContextPtr codec_;
   std::unique_ptr<RCAudioOutput> output_;
-  AVAudioFifo* fifo_ = nullptr;
-  AVFrame* frame_ = nullptr;
-  AVPacket* packet_ = nullptr;
+  RCAVAudioFifoPtr fifo_;
+  RCAVFramePtr frame_;
+  RCAVPacketPtr packet_;
   int frameSize_ = 0;
   std::int64_t framesIn_ = 0;
   std::int64_t nextPts_ = 0;

@@ -36,15 +36,10 @@ bool RCAudioOutput::supportsExtension(std::string_view extension) {
   return muxerNameFor(extension) != nullptr;
 }
 
-RCAudioOutput::RCAudioOutput(AVFormatContext* format, AVStream* stream, std::string path)
-    : format_(format), stream_(stream), path_(std::move(path)) {}
+RCAudioOutput::RCAudioOutput(RCAVOutputPtr format, AVStream* stream, std::string path)
+    : format_(std::move(format)), stream_(stream), path_(std::move(path)) {}
 
-RCAudioOutput::~RCAudioOutput() {
-  if (format_) {
-    if (format_->pb) avio_closep(&format_->pb);
-    avformat_free_context(format_);
-  }
-}
+RCAudioOutput::~RCAudioOutput() = default;
 
 platform::Result<std::unique_ptr<RCAudioOutput>> RCAudioOutput::open(
     const std::string& path, std::string_view extension, const AVCodecParameters* parameters) {
@@ -53,17 +48,16 @@ platform::Result<std::unique_ptr<RCAudioOutput>> RCAudioOutput::open(
   if (!muxer)
     return platform::fail(RCMediaError(RCMediaErrorCodeUnsupportedFormat,
                                        fmt::format("no audio container for \".{}\"", extension)));
-  AVFormatContext* format = nullptr;
-  int result = avformat_alloc_output_context2(&format, nullptr, muxer, nullptr);
-  if (result < 0 || !format)
+  AVFormatContext* allocated = nullptr;
+  int result = avformat_alloc_output_context2(&allocated, nullptr, muxer, nullptr);
+  if (result < 0 || !allocated)
     return platform::fail(
         RCMediaErrorFromAV(RCMediaErrorCodeUnsupportedFormat, result, "cannot set up the muxer"));
+  RCAVOutputPtr owned(allocated);
+  AVFormatContext* format = owned.get();
   AVStream* stream = avformat_new_stream(format, nullptr);
-  if (!stream) {
-    avformat_free_context(format);
-    throw std::bad_alloc();
-  }
-  std::unique_ptr<RCAudioOutput> output(new RCAudioOutput(format, stream, path));
+  if (!stream) throw std::bad_alloc();
+  std::unique_ptr<RCAudioOutput> output(new RCAudioOutput(std::move(owned), stream, path));
   result = avcodec_parameters_copy(stream->codecpar, parameters);
   if (result < 0) throw std::bad_alloc();
   stream->codecpar->codec_tag = 0;
@@ -90,7 +84,7 @@ platform::Status RCAudioOutput::writeHeaderOnce() {
   AVDictionary* options = nullptr;
   // The files are ours alone: no encoder tag that changes with the library version.
   av_dict_set(&options, "fflags", "+bitexact", 0);
-  const int result = avformat_write_header(format_, &options);
+  const int result = avformat_write_header(format_.get(), &options);
   av_dict_free(&options);
   if (result < 0)
     return platform::fail(
@@ -107,7 +101,7 @@ platform::Status RCAudioOutput::writePacket(AVPacket* packet) {
   packet->stream_index = stream_->index;
   // The muxer may have chosen its own time base when writing the header.
   av_packet_rescale_ts(packet, AVRational{1, stream_->codecpar->sample_rate}, stream_->time_base);
-  const int result = av_write_frame(format_, packet);
+  const int result = av_write_frame(format_.get(), packet);
   av_packet_unref(packet);
   if (result < 0)
     return platform::fail(
@@ -119,7 +113,7 @@ platform::Status RCAudioOutput::finish() {
   if (finished_) return {};
   if (auto header = writeHeaderOnce(); !header) return header;
   finished_ = true;
-  int result = av_write_trailer(format_);
+  int result = av_write_trailer(format_.get());
   const int closed = avio_closep(&format_->pb);
   if (result >= 0) result = closed;
   if (result < 0)

@@ -10,12 +10,8 @@
 #include <string>
 #include <string_view>
 
+#include "Quorvel/media/RCFFmpegResource.h"
 #include "platform/Error.h"
-
-struct AVCodecParameters;
-struct AVFormatContext;
-struct AVPacket;
-struct AVStream;
 
 namespace quorvel {
 
@@ -50,9 +46,9 @@ class RCAudioOutput {
   platform::Status finish();
 
  private:
-  RCAudioOutput(AVFormatContext* format, AVStream* stream, std::string path);
+  RCAudioOutput(RCAVOutputPtr format, AVStream* stream, std::string path);
   platform::Status writeHeaderOnce();
-  AVFormatContext* format_ = nullptr;
+  RCAVOutputPtr format_;
   AVStream* stream_ = nullptr;
   std::string path_;
   bool headerWritten_ = false;

@@ -53,6 +53,7 @@ extern "C" {
 #include "Quorvel/media/RCAudioEncoder.h"
 #include "Quorvel/media/RCAudioOutput.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
+#include "Quorvel/media/RCFFmpegResource.h"
 #include "Quorvel/media/RCMP4Atoms.h"
 #include "Quorvel/media/RCMediaInput.h"
 #include "Quorvel/waveform/RCWaveformBuilder.h"
@@ -62,19 +63,8 @@ extern "C" {
 namespace quorvel {
 namespace {
 
-struct PacketDeleter {
-  void operator()(AVPacket* p) const { av_packet_free(&p); }
-};
-using PacketPtr = std::unique_ptr<AVPacket, PacketDeleter>;
-PacketPtr makePacket() {
-  AVPacket* p = av_packet_alloc();
-  if (!p) throw std::bad_alloc();
-  return PacketPtr(p);
-}
-
-struct ParametersDeleter {
-  void operator()(AVCodecParameters* parameters) const { avcodec_parameters_free(&parameters); }
-};
+using PacketPtr = RCAVPacketPtr;
+PacketPtr makePacket() { return RCAVMakePacket(); }
 
 // One segment's fragment. The first kOpenFragments stay open from the start
 // (opening a long fragment parses its whole index, so most recordings are
@@ -85,7 +75,7 @@ constexpr std::size_t kOpenFragments = 16;
 
 struct Input {
   RCComposerSegment segment;
-  std::unique_ptr<AVCodecParameters, ParametersDeleter> parameters;
+  RCAVCodecParametersPtr parameters;
   std::unique_ptr<RCAudioDecoder> decoder;
 
   platform::Status open() {
@@ -181,22 +171,16 @@ class StreamCopier {
         waveform_(waveform),
         held_(makePacket()) {}
 
-  ~StreamCopier() {
-    av_frame_free(&frame_);
-    avcodec_free_context(&waveformDecoder_);
-  }
-
   platform::Status openWaveformDecoder(const AVCodecParameters* parameters) {
     if (!waveform_) return {};
     const AVCodec* codec = avcodec_find_decoder(parameters->codec_id);
-    waveformDecoder_ = codec ? avcodec_alloc_context3(codec) : nullptr;
-    frame_ = av_frame_alloc();
-    if (!codec || !waveformDecoder_ || !frame_)
-      return platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed, "no AAC decoder"));
-    avcodec_parameters_to_context(waveformDecoder_, parameters);
+    if (!codec) return platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed, "no AAC decoder"));
+    waveformDecoder_ = RCAVOwn<RCAVCodecContextPtr>(avcodec_alloc_context3(codec));
+    frame_ = RCAVMakeFrame();
+    avcodec_parameters_to_context(waveformDecoder_.get(), parameters);
     waveformDecoder_->pkt_timebase = AVRational{1, rate_};
     waveformDecoder_->thread_count = 1;
-    const int result = avcodec_open2(waveformDecoder_, codec, nullptr);
+    const int result = avcodec_open2(waveformDecoder_.get(), codec, nullptr);
     if (result < 0)
       return platform::fail(
           RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result, "cannot open the decoder"));
@@ -307,13 +291,13 @@ class StreamCopier {
     av_packet_free_side_data(copy.get());
     copy->flags &= ~AV_PKT_FLAG_DISCARD;
     const std::int64_t limit = last ? endPts_ : std::numeric_limits<std::int64_t>::max();
-    int result = avcodec_send_packet(waveformDecoder_, copy.get());
-    if (last && result >= 0) result = avcodec_send_packet(waveformDecoder_, nullptr);
+    int result = avcodec_send_packet(waveformDecoder_.get(), copy.get());
+    if (last && result >= 0) result = avcodec_send_packet(waveformDecoder_.get(), nullptr);
     if (result < 0 && result != AVERROR_INVALIDDATA)
       return platform::fail(
           RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result, "cannot decode audio"));
     for (;;) {
-      result = avcodec_receive_frame(waveformDecoder_, frame_);
+      result = avcodec_receive_frame(waveformDecoder_.get(), frame_.get());
       if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
       if (result == AVERROR_INVALIDDATA) continue;
       if (result < 0)
@@ -323,9 +307,9 @@ class StreamCopier {
       const std::int64_t from =
           std::max<std::int64_t>(first, std::max<std::int64_t>(0, decodedUntil_));
       const std::int64_t to = std::min<std::int64_t>(first + frame_->nb_samples, limit);
-      if (to > from) waveform_->append(frame_, int(from - first), int(to - from));
+      if (to > from) waveform_->append(frame_.get(), int(from - first), int(to - from));
       decodedUntil_ = std::max(decodedUntil_, to);
-      av_frame_unref(frame_);
+      av_frame_unref(frame_.get());
     }
   }
 
@@ -333,8 +317,8 @@ class StreamCopier {
   const int rate_;
   const std::int64_t frameSize_;
   RCWaveformBuilder* waveform_;
-  AVCodecContext* waveformDecoder_ = nullptr;
-  AVFrame* frame_ = nullptr;
+  RCAVCodecContextPtr waveformDecoder_;
+  RCAVFramePtr frame_;
   PacketPtr held_;
   bool haveHeld_ = false;
   std::int64_t heldDuration_ = 0;
@@ -360,13 +344,13 @@ struct KeptMetadata {
 
 KeptMetadata readKeptMetadata(const std::string& path) {
   KeptMetadata kept;
-  AVFormatContext* input = nullptr;
-  if (RCOpenMediaInput(&input, path.c_str()) < 0) return kept;
+  AVFormatContext* opened = nullptr;
+  if (RCOpenMediaInput(&opened, path.c_str()) < 0) return kept;
+  RCAVInputPtr input(opened);
   if (const AVDictionaryEntry* entry = av_dict_get(input->metadata, "creation_time", nullptr, 0))
     kept.creationTime = entry->value;
   if (const AVDictionaryEntry* entry = av_dict_get(input->metadata, "title", nullptr, 0))
     kept.title = entry->value;
-  avformat_close_input(&input);
   return kept;
 }
 
@@ -443,14 +427,13 @@ class Converter {
   Converter(RCAudioEncoder& encoder, RCWaveformBuilder* waveform)
       : encoder_(encoder), waveform_(waveform) {}
   ~Converter() {
-    swr_free(&swr_);
     if (buffer_) av_freep(&buffer_[0]);
     av_freep(&buffer_);
   }
 
   // Prepares for frames like `frame`.
   platform::Status configure(const AVFrame* frame) {
-    swr_free(&swr_);
+    swr_.reset();
     inFormat_ = AVSampleFormat(frame->format);
     inRate_ = frame->sample_rate;
     inChannels_ = frame->ch_layout.nb_channels;
@@ -463,10 +446,12 @@ class Converter {
                    av_channel_layout_compare(&inLayout, &encoder_.channelLayout()) == 0;
     int result = 0;
     if (!passThrough_) {
-      result = swr_alloc_set_opts2(&swr_, const_cast<AVChannelLayout*>(&encoder_.channelLayout()),
+      SwrContext* swr = nullptr;
+      result = swr_alloc_set_opts2(&swr, const_cast<AVChannelLayout*>(&encoder_.channelLayout()),
                                    encoder_.sampleFormat(), encoder_.sampleRate(), &inLayout,
                                    inFormat_, inRate_, 0, nullptr);
-      if (result >= 0) result = swr_init(swr_);
+      swr_.reset(swr);
+      if (result >= 0) result = swr_init(swr_.get());
     }
     av_channel_layout_uninit(&inLayout);
     if (result < 0)
@@ -501,10 +486,10 @@ class Converter {
  private:
   platform::Status convert(const std::uint8_t* const* planes, int count) {
     for (;;) {
-      const int capacity = std::max(swr_get_out_samples(swr_, count), 256);
+      const int capacity = std::max(swr_get_out_samples(swr_.get(), count), 256);
       ensureCapacity(capacity);
-      const int produced =
-          swr_convert(swr_, buffer_, capacity, const_cast<const std::uint8_t**>(planes), count);
+      const int produced = swr_convert(swr_.get(), buffer_, capacity,
+                                       const_cast<const std::uint8_t**>(planes), count);
       if (produced < 0)
         return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, produced,
                                                  "cannot convert the fragment's audio"));
@@ -534,7 +519,7 @@ class Converter {
 
   RCAudioEncoder& encoder_;
   RCWaveformBuilder* waveform_;
-  SwrContext* swr_ = nullptr;
+  RCSwrContextPtr swr_;
   bool passThrough_ = false;
   AVSampleFormat inFormat_ = AV_SAMPLE_FMT_NONE;
   int inRate_ = 0;
