@@ -1,7 +1,5 @@
 #include "Quorvel/media/RCAudioDecoder.h"
 
-#include <new>
-
 extern "C" {
 #include <libavcodec/avcodec.h>
 #include <libavformat/avformat.h>
@@ -13,24 +11,18 @@ extern "C" {
 
 namespace quorvel {
 
-RCAudioDecoder::RCAudioDecoder(platform::URL url, AVFormatContext* format, AVStream* stream)
-    : url_(std::move(url)), format_(format), stream_(stream) {}
-
-RCAudioDecoder::~RCAudioDecoder() {
-  av_frame_free(&frame_);
-  avcodec_free_context(&codec_);
-  avformat_close_input(&format_);
-}
+RCAudioDecoder::RCAudioDecoder(platform::URL url, RCAVInputPtr format, AVStream* stream)
+    : url_(std::move(url)), format_(std::move(format)), stream_(stream) {}
 
 platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const platform::URL& url) {
   RCInstallFFmpegLogging();
   const std::string name = url.lastPathComponent();
-  AVFormatContext* format = nullptr;
-  int result = RCOpenMediaInput(&format, url.path().c_str());
+  AVFormatContext* opened = nullptr;
+  int result = RCOpenMediaInput(&opened, url.path().c_str());
   if (result < 0)
     return platform::fail(
         RCMediaErrorFromAV(RCMediaErrorCodeCannotOpen, result, "cannot open " + name));
-  auto closeOnFailure = [&format] { avformat_close_input(&format); };
+  RCAVInputPtr format(opened);
 
   auto findAudio = [&format]() -> AVStream* {
     for (unsigned i = 0; i < format->nb_streams; ++i) {
@@ -44,9 +36,8 @@ platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const pla
                         stream->codecpar->sample_rate > 0 &&
                         stream->codecpar->ch_layout.nb_channels > 0;
   if (!complete) {
-    result = avformat_find_stream_info(format, nullptr);
+    result = avformat_find_stream_info(format.get(), nullptr);
     if (result < 0) {
-      closeOnFailure();
       return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeCannotOpen, result,
                                                "cannot read the streams of " + name));
     }
@@ -54,13 +45,12 @@ platform::Result<std::unique_ptr<RCAudioDecoder>> RCAudioDecoder::open(const pla
   }
   if (!stream || stream->codecpar->codec_id == AV_CODEC_ID_NONE ||
       stream->codecpar->sample_rate <= 0 || stream->codecpar->ch_layout.nb_channels <= 0) {
-    closeOnFailure();
     return platform::fail(
         RCMediaError(RCMediaErrorCodeNoAudioStream, name + " holds no usable audio stream"));
   }
   for (unsigned i = 0; i < format->nb_streams; ++i)
     if (format->streams[i] != stream) format->streams[i]->discard = AVDISCARD_ALL;
-  return std::unique_ptr<RCAudioDecoder>(new RCAudioDecoder(url, format, stream));
+  return std::unique_ptr<RCAudioDecoder>(new RCAudioDecoder(url, std::move(format), stream));
 }
 
 const AVCodecParameters* RCAudioDecoder::codecParameters() const { return stream_->codecpar; }
@@ -75,7 +65,7 @@ double RCAudioDecoder::declaredDurationSeconds() const {
 
 platform::Result<bool> RCAudioDecoder::readPacket(AVPacket* packet) {
   for (;;) {
-    const int result = av_read_frame(format_, packet);
+    const int result = av_read_frame(format_.get(), packet);
     if (result == AVERROR_EOF) return false;
     if (result < 0)
       return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
@@ -99,17 +89,16 @@ platform::Status RCAudioDecoder::openCodec() {
   if (!codec)
     return platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed,
                                        fmt::format("no decoder for the audio of {}", name)));
-  codec_ = avcodec_alloc_context3(codec);
-  frame_ = av_frame_alloc();
-  if (!codec_ || !frame_) throw std::bad_alloc();
-  int result = avcodec_parameters_to_context(codec_, stream_->codecpar);
+  auto context = RCAVOwn<RCAVCodecContextPtr>(avcodec_alloc_context3(codec));
+  if (!frame_) frame_ = RCAVMakeFrame();
+  int result = avcodec_parameters_to_context(context.get(), stream_->codecpar);
   if (result >= 0) {
-    codec_->pkt_timebase = stream_->time_base;
-    codec_->thread_count = 1;
-    result = avcodec_open2(codec_, codec, nullptr);
+    context->pkt_timebase = stream_->time_base;
+    context->thread_count = 1;
+    result = avcodec_open2(context.get(), codec, nullptr);
   }
+  if (result >= 0) codec_ = std::move(context);
   if (result < 0) {
-    avcodec_free_context(&codec_);
     return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                              "cannot open the decoder for " + name));
   }
@@ -120,7 +109,7 @@ platform::Status RCAudioDecoder::decode(const AVPacket* packet, const FrameHandl
   if (auto opened = openCodec(); !opened) return opened;
   if (draining_) return {};
   if (!packet) draining_ = true;
-  int result = avcodec_send_packet(codec_, packet);
+  int result = avcodec_send_packet(codec_.get(), packet);
   if (result < 0 && result != AVERROR_EOF) {
     // A damaged packet: the codec drops it; a file of nothing but damage
     // fails later for holding no audio.
@@ -129,38 +118,31 @@ platform::Status RCAudioDecoder::decode(const AVPacket* packet, const FrameHandl
                                              "cannot decode " + url_.lastPathComponent()));
   }
   for (;;) {
-    result = avcodec_receive_frame(codec_, frame_);
+    result = avcodec_receive_frame(codec_.get(), frame_.get());
     if (result == AVERROR(EAGAIN) || result == AVERROR_EOF) return {};
     if (result == AVERROR_INVALIDDATA) continue;
     if (result < 0)
       return platform::fail(RCMediaErrorFromAV(RCMediaErrorCodeDecodeFailed, result,
                                                "cannot decode " + url_.lastPathComponent()));
-    auto handled = handler(frame_);
-    av_frame_unref(frame_);
+    auto handled = handler(frame_.get());
+    av_frame_unref(frame_.get());
     if (!handled) return handled;
   }
 }
 
-platform::Status RCAudioDecoder::decodeAll(const FrameHandler& handler) {
-  AVPacket* packet = av_packet_alloc();
-  if (!packet) throw std::bad_alloc();
-  platform::Status status;
+platform::Status RCAudioDecoder::decodeAll(const FrameHandler& handler,
+                                           const std::function<bool()>& cancelled) {
+  RCAVPacketPtr packet = RCAVMakePacket();
   for (;;) {
-    auto more = readPacket(packet);
-    if (!more) {
-      status = platform::fail(more.error());
-      break;
-    }
-    if (!*more) {
-      status = decode(nullptr, handler);
-      break;
-    }
-    status = decode(packet, handler);
-    av_packet_unref(packet);
-    if (!status) break;
+    if (cancelled && cancelled())
+      return platform::fail(RCMediaError(RCMediaErrorCodeDecodeFailed, "cancelled"));
+    auto more = readPacket(packet.get());
+    if (!more) return platform::fail(more.error());
+    if (!*more) return decode(nullptr, handler);
+    auto status = decode(packet.get(), handler);
+    av_packet_unref(packet.get());
+    if (!status) return status;
   }
-  av_packet_free(&packet);
-  return status;
 }
 
 }  // namespace quorvel

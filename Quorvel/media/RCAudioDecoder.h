@@ -11,15 +11,9 @@
 #include <functional>
 #include <memory>
 
+#include "Quorvel/media/RCFFmpegResource.h"
 #include "platform/Error.h"
 #include "platform/URL.h"
-
-struct AVCodecContext;
-struct AVCodecParameters;
-struct AVFormatContext;
-struct AVFrame;
-struct AVPacket;
-struct AVStream;
 
 namespace quorvel {
 
@@ -28,7 +22,6 @@ class RCAudioDecoder {
   // Opens `url` and finds its audio stream. The stream's parameters are
   // probed by decoding a little only when the header leaves them incomplete.
   static platform::Result<std::unique_ptr<RCAudioDecoder>> open(const platform::URL& url);
-  ~RCAudioDecoder();
   RCAudioDecoder(const RCAudioDecoder&) = delete;
   RCAudioDecoder& operator=(const RCAudioDecoder&) = delete;
 
@@ -50,15 +43,18 @@ class RCAudioDecoder {
   // codec returns to `handler`, whose failure stops and is returned.
   platform::Status decode(const AVPacket* packet, const FrameHandler& handler);
   // Reads and decodes the whole stream from where it stands, then drains.
-  platform::Status decodeAll(const FrameHandler& handler);
+  // `cancelled`, when given, is asked before each packet; once it answers
+  // true the decoding stops with a DecodeFailed error "cancelled".
+  platform::Status decodeAll(const FrameHandler& handler,
+                             const std::function<bool()>& cancelled = {});
 
  private:
-  RCAudioDecoder(platform::URL url, AVFormatContext* format, AVStream* stream);
+  RCAudioDecoder(platform::URL url, RCAVInputPtr format, AVStream* stream);
   platform::URL url_;
-  AVFormatContext* format_ = nullptr;
+  RCAVInputPtr format_;
   AVStream* stream_ = nullptr;
-  AVCodecContext* codec_ = nullptr;
-  AVFrame* frame_ = nullptr;
+  RCAVCodecContextPtr codec_;
+  RCAVFramePtr frame_;
   bool draining_ = false;
 };
 

@@ -17,22 +17,19 @@ extern "C" {
 #include <new>
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/media/RCAudioDecoder.h"
 #include "Quorvel/media/RCComposer.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
+#include "Quorvel/media/RCFFmpegResource.h"
 #include "Quorvel/media/RCMP4Atoms.h"
 #include "Quorvel/media/RCMediaInput.h"
-#include "Quorvel/waveform/RCWaveformBuilder.h"
+#include "Quorvel/media/RCWaveformDecoding.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
 #include "platform/Log.h"
 
 namespace quorvel {
 namespace {
 
-struct InputDeleter {
-  void operator()(AVFormatContext* context) const { avformat_close_input(&context); }
-};
-using Input = std::unique_ptr<AVFormatContext, InputDeleter>;
+using Input = RCAVInputPtr;
 
 platform::Error assetError(long code, std::string text) {
   return platform::Error(kRCAudioAssetErrorDomain, code, std::move(text));
@@ -176,42 +173,14 @@ platform::Status RCInProcessMediaEngine::compose(
 platform::Status RCInProcessMediaEngine::buildWaveform(const platform::URL& audio,
                                                        const platform::URL& destination,
                                                        const RCMediaProgress& progress) {
-  auto opened = RCAudioDecoder::open(audio);
-  if (!opened) return platform::fail(opened.error());
-  RCAudioDecoder& decoder = **opened;
-  if (auto codec = decoder.openCodec(); !codec) return codec;
-  const std::string name = audio.lastPathComponent();
-  const double declared = decoder.declaredDurationSeconds();
   ProgressThrottle throttle(progress);
-  std::optional<RCWaveformBuilder> builder;
-  auto handle = [&](AVFrame* frame) -> platform::Status {
-    if (!builder) {
-      builder.emplace(frame->sample_rate);
-    } else if (frame->sample_rate != builder->waveform().sampleRate()) {
-      return platform::fail(
-          RCMediaError(RCMediaErrorCodeDecodeFailed, name + " changes its sample rate midway"));
-    }
-    builder->append(frame);
-    if (declared > 0) throttle(double(builder->framesAppended()) / frame->sample_rate / declared);
-    return {};
-  };
-  if (auto decoded = decoder.decodeAll(handle); !decoded) return decoded;
-  if (!builder || builder->framesAppended() == 0) {
-    return platform::fail(
-        RCMediaError(RCMediaErrorCodeDecodeFailed, "no audio could be decoded from " + name));
-  }
-  const int rate = builder->waveform().sampleRate();
-  const double decodedSeconds = double(builder->framesAppended()) / rate;
-  // Decoders round up to whole codec frames; anything shorter than the
-  // declared duration by more than a few frames is missing audio.
-  if (declared > 0 && decodedSeconds < declared - std::max(0.05, 4096.0 / rate)) {
-    return platform::fail(RCMediaError(RCMediaErrorCodeTruncated,
-                                       fmt::format("{} holds {:.3f}s of audio but declares {:.3f}s",
-                                                   name, decodedSeconds, declared)));
-  }
-  builder->finish();
-  if (auto written = RCWriteWaveformFile(builder->waveform(), destination); !written)
-    return written;
+  auto waveform =
+      RCDecodeWaveform(audio, {.onFrame = [&](const RCWaveformBuilder&, double fraction) {
+                         throttle(fraction);
+                         return platform::Status();
+                       }});
+  if (!waveform) return platform::fail(waveform.error());
+  if (auto written = RCWriteWaveformFile(*waveform, destination); !written) return written;
   throttle(1);
   return {};
 }
