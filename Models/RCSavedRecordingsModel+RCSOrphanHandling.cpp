@@ -37,7 +37,6 @@
 // removed.
 #include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -56,6 +55,7 @@
 #include "Quorvel/composition/RCCaptureFormat.h"
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionController.h"
+#include "Quorvel/files/RCDirectoryListing.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
 #include "Quorvel/files/RCFileCreationDate.h"
@@ -103,9 +103,7 @@ std::optional<RCMetadataItem> chooseTitleItem(const std::vector<RCMetadataItem>&
 
 }  // namespace
 
-struct RCSOrphanHandling::Entry {
-  struct stat info {};
-  bool exists = false;
+struct RCSOrphanHandling::Entry : RCFileStatus {
   // In the in-use set when the directory was listed (the set only grows).
   bool inUse = false;
 };
@@ -152,23 +150,20 @@ class RCSOrphanHandling::FileManager {
   // A directory that cannot be listed gives no entries.
   std::vector<platform::URL> list(const RCURLSet& inUse) {
     std::vector<platform::URL> urls;
-    DIR* stream = ::opendir(directory_.c_str());
-    if (!stream) {
-      ORPHAN_LOG("ERROR: cannot list {}: {}", directory_, std::strerror(errno));
+    auto listed = RCListDirectory(directory_);
+    if (!listed) {
+      ORPHAN_LOG("ERROR: cannot list {}: {}", directory_,
+                 std::strerror(int(listed.error().code())));
       return urls;
     }
-    const int fd = ::dirfd(stream);
-    while (const dirent* item = ::readdir(stream)) {
-      std::string_view name = item->d_name;
-      if (name == "." || name == "..") continue;
-      Entry entry;
-      entry.exists = ::fstatat(fd, item->d_name, &entry.info, AT_SYMLINK_NOFOLLOW) == 0;
-      std::string path = directory_ + "/" + std::string(name);
-      entry.inUse = entry.exists && inUse.containsPath(path);
-      entries_.emplace(std::string(name), entry);
+    urls.reserve(listed->size());
+    for (RCDirectoryEntry& item : *listed) {
+      std::string path = directory_ + "/" + item.name;
+      Entry entry{item.status};
+      entry.inUse = entry.exists() && inUse.containsPath(path);
+      entries_.emplace(std::move(item.name), entry);
       urls.push_back(platform::URL::fileURLWithPath(path));
     }
-    ::closedir(stream);
     return urls;
   }
 
@@ -186,9 +181,9 @@ class RCSOrphanHandling::FileManager {
           c = char(c - 'A' + 'a');
         }
       }
-      if (swapped == name || !entry.exists) continue;
+      if (swapped == name || !entry.exists()) continue;
       Entry other = lstatNow(directory_ + "/" + swapped);
-      foldsCase_ = other.exists && other.info.st_dev == entry.info.st_dev &&
+      foldsCase_ = other.exists() && other.info.st_dev == entry.info.st_dev &&
                    other.info.st_ino == entry.info.st_ino;
       break;
     }
@@ -206,16 +201,10 @@ class RCSOrphanHandling::FileManager {
   }
   const std::unordered_map<std::string, Entry>& entries() const { return entries_; }
 
-  static Entry lstatNow(const std::string& path) {
-    Entry entry;
-    entry.exists = ::lstat(path.c_str(), &entry.info) == 0;
-    return entry;
-  }
+  static Entry lstatNow(const std::string& path) { return Entry{RCFileStatus::atPath(path)}; }
   // The file `path` names, through links.
   static Entry statNow(const std::string& path) {
-    Entry entry;
-    entry.exists = ::stat(path.c_str(), &entry.info) == 0;
-    return entry;
+    return Entry{RCFileStatus::atPathFollowing(path)};
   }
 
   // Removes `url` (a file or a whole bundle), never outside the directory.
@@ -447,24 +436,25 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
   // nothing).
   std::unordered_multimap<std::uint64_t, std::string> inUseBySize;
   std::set<Identity> inUseIdentities;
-  auto noteInUse = [&](const std::string& path, const struct stat& info) {
-    inUseIdentities.insert(Identity{info.st_dev, info.st_ino});
-    if (S_ISREG(info.st_mode) && info.st_size > 0) inUseBySize.emplace(info.st_size, path);
+  auto noteInUse = [&](const std::string& path, const RCFileStatus& status) {
+    inUseIdentities.insert(Identity{status.info.st_dev, status.info.st_ino});
+    if (status.isRegularFile() && !status.isEmptyRegularFile())
+      inUseBySize.emplace(status.info.st_size, path);
   };
   auto noteMember = [&](const std::string& path, Entry entry) {
-    if (!entry.exists || S_ISLNK(entry.info.st_mode)) entry = FileManager::statNow(path);
-    if (entry.exists) noteInUse(path, entry.info);
+    if (!entry.exists() || entry.isSymbolicLink()) entry = FileManager::statNow(path);
+    if (entry.exists()) noteInUse(path, entry);
   };
   const std::string prefix = fileManager.directory() + "/";
   for (const auto& [name, entry] : fileManager.entries()) {
-    if (!entry.exists) continue;
+    if (!entry.exists()) continue;
     std::string path = prefix + name;
     if (entry.inUse || inUse.containsPath(path)) noteMember(path, entry);
   }
   for (const std::string& path : fileManager.elsewhere()) noteMember(path, Entry{});
   if (fileManager.foldsCase()) {
     for (const std::string& path : inUse.paths()) {
-      if (!fileManager.entryFor(path).exists) noteMember(path, Entry{});
+      if (!fileManager.entryFor(path).exists()) noteMember(path, Entry{});
     }
   }
   auto forgetInUse = [&](const std::string& path) {
@@ -505,15 +495,15 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
   auto orphanEntry = [&](const platform::URL& url,
                          const char** keptBecause = nullptr) -> std::optional<Entry> {
     Entry listed = fileManager.entryFor(url.path());
-    if (listed.inUse || !listed.exists ||
+    if (listed.inUse || !listed.exists() ||
         !RCCaptureFormat::isFileExtensionSupported(url.pathExtension()) ||
         inUse.containsPath(url.path())) {
       return std::nullopt;
     }
     const char* why = nullptr;
-    if (S_ISLNK(listed.info.st_mode)) {
+    if (listed.isSymbolicLink()) {
       why = "it is a symbolic link";
-    } else if (!S_ISREG(listed.info.st_mode)) {
+    } else if (!listed.isRegularFile()) {
       why = "it is not a regular file";
     } else if (inUseIdentities.contains(Identity{listed.info.st_dev, listed.info.st_ino})) {
       why = "it is the same file as one in use";
@@ -584,7 +574,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
 
     // The duplicate test, sizes first.
     Entry now = FileManager::lstatNow(url.path());
-    if (!now.exists || !S_ISREG(now.info.st_mode)) {
+    if (!now.isRegularFile()) {
       ORPHAN_LOG(
           "Orphaned composed AVURL: '{}' changed during the run; leaving it for the next "
           "one",
@@ -627,7 +617,7 @@ void RCSOrphanHandling::_performOrphanRecoveryAndCleanupOfBareAssetsWithInUseCom
       continue;
     }
     inUse.addPath(url.path());
-    noteInUse(url.path(), now.info);
+    noteInUse(url.path(), now);
     ORPHAN_LOG(
         "Orphaned composed AVURL: '{}' does not have a duplicate in the database or "
         "unsynced assets manifest.  Attempting to insert into the database...",
@@ -699,9 +689,9 @@ void RCSOrphanHandling::removeStaleTemporaryFiles(FileManager& fileManager) {
   // directory or in a bundle. Anything else of that name pattern, or younger
   // than an hour (a compose may still be writing it), stays.
   auto removeIfStale = [&](const platform::URL& url, std::string_view name,
-                           const struct stat& info) {
-    if (!S_ISREG(info.st_mode) || !RCIsAtomicReplaceTempName(name) ||
-        secondsSince(info.st_mtim) < kMinimumTempFileAge) {
+                           const RCFileStatus& status) {
+    if (!status.isRegularFile() || !RCIsAtomicReplaceTempName(name) ||
+        secondsSince(status.info.st_mtim) < kMinimumTempFileAge) {
       return;
     }
     ORPHAN_LOG("Removing '{}', left behind by an interrupted write.", url.path());
@@ -709,30 +699,21 @@ void RCSOrphanHandling::removeStaleTemporaryFiles(FileManager& fileManager) {
   };
   const std::string prefix = fileManager.directory() + "/";
   for (const auto& [name, entry] : fileManager.entries()) {
-    if (!entry.exists) continue;
-    if (!S_ISDIR(entry.info.st_mode)) {
+    if (!entry.exists()) continue;
+    if (!entry.isDirectory()) {
       if (name.front() == '.') {
-        removeIfStale(platform::URL::fileURLWithPath(prefix + name), name, entry.info);
+        removeIfStale(platform::URL::fileURLWithPath(prefix + name), name, entry);
       }
       continue;
     }
     if (!name.ends_with(std::string(".") + RCComposition::kBundleExtension)) continue;
     const platform::URL bundle = platform::URL::fileURLWithPath(prefix + name);
-    const int fd = ::open(bundle.path().c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-    DIR* stream = fd < 0 ? nullptr : ::fdopendir(fd);
-    if (!stream) {
-      if (fd >= 0) ::close(fd);
-      continue;
+    auto hidden = RCListDirectory(
+        bundle.path(),
+        {.noFollow = true, .filter = [](std::string_view member) { return member[0] == '.'; }});
+    for (const RCDirectoryEntry& item : hidden ? *hidden : std::vector<RCDirectoryEntry>()) {
+      removeIfStale(bundle.URLByAppendingPathComponent(item.name), item.name, item.status);
     }
-    while (const dirent* item = ::readdir(stream)) {
-      struct stat info {};
-      if (item->d_name[0] != '.' ||
-          ::fstatat(::dirfd(stream), item->d_name, &info, AT_SYMLINK_NOFOLLOW) != 0) {
-        continue;
-      }
-      removeIfStale(bundle.URLByAppendingPathComponent(item->d_name), item->d_name, info);
-    }
-    ::closedir(stream);
   }
 }
 

@@ -12,6 +12,7 @@
 #include "Quorvel/composition/RCCompositionController.h"
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
@@ -108,9 +109,8 @@ bool GenerateWaveformOperation::run(std::optional<platform::Error>* /*error*/) {
   platform::URL waveformURL = RCWaveform::waveformURLForAVURL(compositionAVURL());
   if (::access(waveformURL.path().c_str(), F_OK) == 0) return true;
   // Waveforms are written only beside recordings' own regular audio files.
-  struct stat info {};
   if (!RCIsURLDirectlyInsideDirectory(compositionAVURL(), RCSavedRecordingsDirectory()) ||
-      ::lstat(compositionAVURL().path().c_str(), &info) != 0 || !S_ISREG(info.st_mode)) {
+      !RCFileStatus::atPath(compositionAVURL().path()).isRegularFile()) {
     QV_LOG(platform::kLogLevelError,
            "ERROR: not computing a waveform for {}: it is not a regular file directly inside the "
            "recordings directory",

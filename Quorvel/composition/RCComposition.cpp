@@ -1,6 +1,5 @@
 #include "Quorvel/composition/RCComposition.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -11,9 +10,11 @@
 
 #include "Quorvel/composition/RCCaptureFormat.h"
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCDirectoryListing.h"
 #include "Quorvel/files/RCDurableFile.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "platform/Log.h"
 
@@ -35,9 +36,8 @@ std::string extensionOf(const std::string& name) {
 }
 
 std::uint64_t regularFileSize(const std::string& path) {
-  struct stat info {};
-  if (::lstat(path.c_str(), &info) != 0 || !S_ISREG(info.st_mode)) return 0;
-  return static_cast<std::uint64_t>(info.st_size);
+  const RCFileStatus status = RCFileStatus::atPath(path);
+  return status.isRegularFile() ? static_cast<std::uint64_t>(status.info.st_size) : 0;
 }
 
 }  // namespace
@@ -60,12 +60,10 @@ platform::Result<std::shared_ptr<RCComposition>> RCComposition::load(
   if (bundle.pathExtension() != kBundleExtension) {
     return platform::fail(refused("the bundle's extension is not .composition"));
   }
-  struct stat info {};
-  if (::lstat(bundle.path().c_str(), &info) != 0) {
-    return platform::fail(platform::posixError(errno, "the bundle"));
-  }
-  if (S_ISLNK(info.st_mode)) return platform::fail(refused("the bundle is a symbolic link"));
-  if (!S_ISDIR(info.st_mode)) return platform::fail(refused("the bundle is not a directory"));
+  const RCFileStatus status = RCFileStatus::atPath(bundle.path());
+  if (!status.exists()) return platform::fail(platform::posixError(status.error, "the bundle"));
+  if (status.isSymbolicLink()) return platform::fail(refused("the bundle is a symbolic link"));
+  if (!status.isDirectory()) return platform::fail(refused("the bundle is not a directory"));
 
   auto text = RCReadFileNoFollow(bundle.path(), RCCompositionManifest::kFileName,
                                  RCCompositionManifest::kMaximumSize);
@@ -79,15 +77,15 @@ platform::Result<std::shared_ptr<RCComposition>> RCComposition::load(
                                   "' is not the audio file of this bundle"));
   }
   for (const RCCompositionManifestFragment& entry : manifest->fragments) {
-    std::string path = bundle.path() + "/" + entry.file;
-    if (::lstat(path.c_str(), &info) != 0) {
-      if (errno == ENOENT) continue;  // gone: the repair drops it
-      return platform::fail(platform::posixError(errno, "fragment " + entry.file));
+    const RCFileStatus fragment = RCFileStatus::atPath(bundle.path() + "/" + entry.file);
+    if (fragment.error == ENOENT) continue;  // gone: the repair drops it
+    if (!fragment.exists()) {
+      return platform::fail(platform::posixError(fragment.error, "fragment " + entry.file));
     }
-    if (S_ISLNK(info.st_mode)) {
+    if (fragment.isSymbolicLink()) {
       return platform::fail(refused("fragment '" + entry.file + "' is a symbolic link"));
     }
-    if (!S_ISREG(info.st_mode)) {
+    if (!fragment.isRegularFile()) {
       return platform::fail(refused("fragment '" + entry.file + "' is not a regular file"));
     }
   }
@@ -172,26 +170,20 @@ void RCComposition::setSavedRecordingURIFromRecoveredRecordingURI(std::string ur
 }
 
 void RCComposition::enumerateOrphanedFragmentsWithBlock(const FragmentVisitor& block) const {
-  RCScopedFd fd(::open(bundleURL_.path().c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  if (!fd) return;
-  DIR* dir = ::fdopendir(fd.get());
-  if (dir == nullptr) return;
-  const int dirFd = fd.release();  // the DIR stream owns it now
-  std::set<std::string> used;
+  std::set<std::string, std::less<>> used;
   for (const auto& entry : manifest_.fragments) used.insert(entry.file);
+  auto listed = RCListDirectory(
+      bundleURL_.path(),
+      {.noFollow = true, .filter = [&used](std::string_view name) {
+         return !used.contains(name) &&
+                RCCaptureFormat::isFileExtensionSupported(extensionOf(std::string(name)));
+       }});
+  if (!listed) return;
   std::vector<std::string> orphans;
-  while (dirent* entry = ::readdir(dir)) {
-    std::string name = entry->d_name;
-    if (used.contains(name) || !RCCaptureFormat::isFileExtensionSupported(extensionOf(name))) {
-      continue;
-    }
-    struct stat info {};
-    if (::fstatat(dirFd, name.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0 || S_ISDIR(info.st_mode)) {
-      continue;
-    }
-    orphans.push_back(std::move(name));
+  for (RCDirectoryEntry& entry : *listed) {
+    if (entry.status.exists() && !entry.status.isDirectory())
+      orphans.push_back(std::move(entry.name));
   }
-  ::closedir(dir);
   std::sort(orphans.begin(), orphans.end());
   bool stop = false;
   for (const std::string& name : orphans) {

@@ -37,7 +37,6 @@
 // no temporary file of a running job can be taken for a leftover.
 #include "Quorvel/composition/RCCompositionController.h"
 
-#include <dirent.h>
 #include <sys/stat.h>
 #include <time.h>
 
@@ -55,8 +54,10 @@
 #include "Quorvel/composition/RCCaptureFormat.h"
 #include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCDirectoryListing.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCFileVersion.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "Quorvel/media/RCAudioAsset.h"
@@ -74,14 +75,11 @@ constexpr double kDurationTolerance = 0.001;
 enum class FileState { Missing, Empty, Present };
 
 FileState fileState(const platform::URL& url) {
-  struct stat info {};
   // Only ENOENT means gone: a file that cannot be looked at now (EACCES,
   // EIO…) is kept, and reading its duration then reports it.
-  if (::lstat(url.path().c_str(), &info) != 0) {
-    return errno == ENOENT ? FileState::Missing : FileState::Present;
-  }
-  if (S_ISREG(info.st_mode) && info.st_size == 0) return FileState::Empty;
-  return FileState::Present;
+  const RCFileStatus status = RCFileStatus::atPath(url.path());
+  if (status.error == ENOENT) return FileState::Missing;
+  return status.isEmptyRegularFile() ? FileState::Empty : FileState::Present;
 }
 
 // What reading a fragment file's audio found.
@@ -147,9 +145,9 @@ ReadingCache& readingCache() {
 
 // The version of the regular file `url` names (following links).
 std::optional<RCFileVersion> versionOf(const platform::URL& url) {
-  struct stat info {};
-  if (::stat(url.path().c_str(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
-  return RCFileVersion::of(info);
+  const RCFileStatus status = RCFileStatus::atPathFollowing(url.path());
+  if (!status.isRegularFile()) return std::nullopt;
+  return RCFileVersion::of(status.info);
 }
 
 // What reading the file found before, when it has not changed since.
@@ -337,17 +335,13 @@ platform::Result<std::unique_ptr<BundleLocks::Lock>> lockBundle(const platform::
 void removeLeftoverTemporaryFiles(const platform::URL& destination) {
   const platform::URL directory = destination.URLByDeletingLastPathComponent();
   const std::string prefix = fmt::format(".{}.", destination.lastPathComponent());
-  std::vector<std::string> leftovers;
-  if (DIR* listing = ::opendir(directory.path().c_str())) {
-    while (const dirent* entry = ::readdir(listing)) {
-      std::string_view name = entry->d_name;
-      if (name.starts_with(prefix) && RCIsAtomicReplaceTempName(name)) {
-        leftovers.emplace_back(name);
-      }
-    }
-    ::closedir(listing);
-  }
-  for (const std::string& name : leftovers) {
+  auto leftovers =
+      RCListDirectory(directory.path(), {.filter = [&prefix](std::string_view name) {
+                        return name.starts_with(prefix) && RCIsAtomicReplaceTempName(name);
+                      }});
+  for (const RCDirectoryEntry& leftover :
+       leftovers ? *leftovers : std::vector<RCDirectoryEntry>()) {
+    const std::string& name = leftover.name;
     platform::URL url = directory.URLByAppendingPathComponent(name);
     if (auto removed = RCRemoveItemInSavedRecordingsDirectory(url); removed) {
       QV_LOG(platform::kLogLevelNotice, "NOTE: removed {}, left by an interrupted compose", name);

@@ -9,6 +9,7 @@
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCFileConfinement.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCReplacementFile.h"
 
 namespace quorvel {
@@ -32,13 +33,14 @@ platform::Result<std::string> RCReadFileNoFollow(std::string_view directory, std
   std::string fileName(name);
   RCScopedFd file(::openat(dir.get(), fileName.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
   if (!file) return platform::fail(platform::posixError(errno, "open " + fileName));
-  struct stat info {};
-  if (::fstat(file.get(), &info) != 0) {
-    return platform::fail(platform::posixError(errno, "stat " + fileName));
+  const RCFileStatus status = RCFileStatus::ofDescriptor(file.get());
+  if (!status.exists()) {
+    return platform::fail(platform::posixError(status.error, "stat " + fileName));
   }
-  if (!S_ISREG(info.st_mode)) {
+  if (!status.isRegularFile()) {
     return platform::fail(RCError(RCErrorCodeNotConfined, fileName + " is not a regular file"));
   }
+  const struct stat& info = status.info;
   if (static_cast<std::size_t>(info.st_size) > maximumSize) {
     return platform::fail(RCError(RCErrorCodeInvalidManifest, fileName + " is too large"));
   }

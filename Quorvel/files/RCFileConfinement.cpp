@@ -5,7 +5,6 @@
 // kernel refuses to follow it.
 #include "Quorvel/files/RCFileConfinement.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -14,6 +13,7 @@
 #include <vector>
 
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCDirectoryListing.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
 
@@ -44,34 +44,23 @@ platform::Status removeTree(int parent, const std::string& name, int depth) {
   if (depth > kMaximumTreeDepth) {
     return platform::fail(RCError(RCErrorCodeNotConfined, "directory tree too deep to remove"));
   }
-  RCScopedFd opened(
-      ::openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  if (!opened) return platform::fail(platform::posixError(errno, "open " + name));
-  DIR* dir = ::fdopendir(opened.get());
-  if (dir == nullptr) return platform::fail(platform::posixError(errno, "read " + name));
-  const int fd = opened.release();  // the DIR stream owns it now
+  int opened = -1;
+  auto entries = RCListDirectoryAt(parent, name, {.noFollow = true}, &opened);
+  if (!entries) return platform::fail(entries.error());
+  RCScopedFd fd(opened);
   platform::Status first;
-  std::vector<std::pair<std::string, bool>> entries;
-  while (dirent* entry = ::readdir(dir)) {
-    std::string child = entry->d_name;
-    if (child == "." || child == "..") continue;
-    struct stat info {};
-    if (::fstatat(fd, child.c_str(), &info, AT_SYMLINK_NOFOLLOW) != 0) {
-      if (errno != ENOENT && first) first = platform::fail(platform::posixError(errno, child));
-      continue;
-    }
-    entries.emplace_back(std::move(child), S_ISDIR(info.st_mode));
-  }
-  for (const auto& [child, isDirectory] : entries) {
+  for (const RCDirectoryEntry& entry : *entries) {
     platform::Status status;
-    if (isDirectory) {
-      status = removeTree(fd, child, depth + 1);
-    } else if (::unlinkat(fd, child.c_str(), 0) != 0 && errno != ENOENT) {
-      status = platform::fail(platform::posixError(errno, "remove " + child));
+    if (!entry.status.exists()) {
+      if (entry.status.error != ENOENT)
+        status = platform::fail(platform::posixError(entry.status.error, entry.name));
+    } else if (entry.status.isDirectory()) {
+      status = removeTree(fd.get(), entry.name, depth + 1);
+    } else if (::unlinkat(fd.get(), entry.name.c_str(), 0) != 0 && errno != ENOENT) {
+      status = platform::fail(platform::posixError(errno, "remove " + entry.name));
     }
     if (!status && first) first = status;
   }
-  ::closedir(dir);
   if (::unlinkat(parent, name.c_str(), AT_REMOVEDIR) != 0 && first) {
     first = platform::fail(platform::posixError(errno, "remove " + name));
   }

@@ -13,6 +13,7 @@
 
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFile.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "platform/Log.h"
 
 namespace quorvel {
@@ -119,20 +120,20 @@ RCMD5Digest RCMD5DigestOfBytes(std::string_view bytes) {
 }
 
 platform::Result<std::optional<RCMD5Digest>> RCMD5DigestOfFile(const std::string& path) {
-  struct stat info {};
-  if (::stat(path.c_str(), &info) != 0) return std::optional<RCMD5Digest>();
-  if (S_ISREG(info.st_mode) && info.st_size == 0) return std::optional<RCMD5Digest>();
+  const RCFileStatus named = RCFileStatus::atPathFollowing(path);
+  if (!named.exists() || named.isEmptyRegularFile()) return std::optional<RCMD5Digest>();
 
   // O_NONBLOCK keeps a FIFO from blocking the open; reading one fails below.
   RCScopedFd file(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
   if (!file) return platform::fail(platform::posixError(errno, "open " + path));
   const int fd = file.get();
-  if (::fstat(fd, &info) != 0) return platform::fail(platform::posixError(errno, "fstat " + path));
-  if (!S_ISREG(info.st_mode)) {
-    return platform::fail(platform::posixError(S_ISDIR(info.st_mode) ? EISDIR : EINVAL,
+  const RCFileStatus opened = RCFileStatus::ofDescriptor(fd);
+  if (!opened.exists()) return platform::fail(platform::posixError(opened.error, "fstat " + path));
+  if (!opened.isRegularFile()) {
+    return platform::fail(platform::posixError(opened.isDirectory() ? EISDIR : EINVAL,
                                                "not a regular file: " + path));
   }
-  if (info.st_size == 0) return std::optional<RCMD5Digest>();
+  if (opened.isEmptyRegularFile()) return std::optional<RCMD5Digest>();
   ::posix_fadvise(fd, 0, 0, POSIX_FADV_SEQUENTIAL);
 
   Digest context;

@@ -12,6 +12,7 @@
 #include <tuple>
 
 #include "Quorvel/files/RCFile.h"
+#include "Quorvel/files/RCFileStatus.h"
 
 namespace quorvel {
 namespace {
@@ -95,13 +96,11 @@ platform::Result<RCSettledRemoval> RCRemoveSettledFile(const std::string& direct
                                                        const std::function<bool()>& stillUnwanted) {
   RCScopedFd parent(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!parent) return platform::fail(platform::posixError(errno, "open " + directory));
-  struct stat named {};
-  if (::fstatat(parent.get(), name.c_str(), &named, AT_SYMLINK_NOFOLLOW) != 0) {
-    if (errno == ENOENT) return RCSettledRemoval::Missing;
-    return platform::fail(platform::posixError(errno, "stat " + name));
-  }
+  const RCFileStatus named = RCFileStatus::at(parent.get(), name.c_str());
+  if (named.error == ENOENT) return RCSettledRemoval::Missing;
+  if (!named.exists()) return platform::fail(platform::posixError(named.error, "stat " + name));
   // Never opened unless regular: opening a FIFO or a device has effects.
-  if (!S_ISREG(named.st_mode)) return RCSettledRemoval::NotARegularFile;
+  if (!named.isRegularFile()) return RCSettledRemoval::NotARegularFile;
   RCScopedFd file(
       ::openat(parent.get(), name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   if (!file) {
@@ -115,21 +114,19 @@ platform::Result<RCSettledRemoval> RCRemoveSettledFile(const std::string& direct
   const int refused = lease.take();
   if (refused == EAGAIN || refused == EBUSY) return RCSettledRemoval::OpenElsewhere;
 
-  struct stat opened {};
-  if (::fstat(file.get(), &opened) != 0) {
-    return platform::fail(platform::posixError(errno, "stat " + name));
-  }
-  if (!S_ISREG(opened.st_mode)) return RCSettledRemoval::NotARegularFile;
-  if (RCFileVersion::of(opened) != examined) return RCSettledRemoval::Changed;
-  if (refused != 0 && secondsSinceLastChange(opened) < minimumQuietSeconds) {
+  const RCFileStatus opened = RCFileStatus::ofDescriptor(file.get());
+  if (!opened.exists()) return platform::fail(platform::posixError(opened.error, "stat " + name));
+  if (!opened.isRegularFile()) return RCSettledRemoval::NotARegularFile;
+  if (RCFileVersion::of(opened.info) != examined) return RCSettledRemoval::Changed;
+  if (refused != 0 && secondsSinceLastChange(opened.info) < minimumQuietSeconds) {
     return RCSettledRemoval::TooRecent;
   }
   if (stillUnwanted && !stillUnwanted()) return RCSettledRemoval::Wanted;
 
   // The name must still lead to the descriptor's file: a rename over it
   // since the open would otherwise remove the newcomer.
-  if (::fstatat(parent.get(), name.c_str(), &named, AT_SYMLINK_NOFOLLOW) != 0 ||
-      !sameFile(named, opened)) {
+  const RCFileStatus now = RCFileStatus::at(parent.get(), name.c_str());
+  if (!now.exists() || !sameFile(now.info, opened.info)) {
     return RCSettledRemoval::Changed;
   }
   if (::unlinkat(parent.get(), name.c_str(), 0) != 0) {

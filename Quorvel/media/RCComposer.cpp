@@ -48,6 +48,7 @@ extern "C" {
 }
 
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCReplacementFile.h"
 #include "Quorvel/media/RCAudioDecoder.h"
 #include "Quorvel/media/RCAudioEncoder.h"
@@ -356,9 +357,8 @@ KeptMetadata readKeptMetadata(const std::string& path) {
 
 KeptMetadata keptMetadataFor(const platform::URL& destination,
                              const std::vector<RCComposerSegment>& segments) {
-  struct stat info {};
   KeptMetadata kept;
-  if (::stat(destination.path().c_str(), &info) == 0 && S_ISREG(info.st_mode))
+  if (RCFileStatus::atPathFollowing(destination.path()).isRegularFile())
     kept = readKeptMetadata(destination.path());
   if (!kept.creationTime)
     kept.creationTime = readKeptMetadata(segments.front().fragmentURL.path()).creationTime;
@@ -376,9 +376,8 @@ platform::Status commitKeepingTitles(RCReplacementFile& file, const platform::UR
                                      const std::string& extension) {
   constexpr int kAttempts = 5;
   for (int attempt = 0;; ++attempt) {
-    struct stat info {};
-    if (::lstat(destination.path().c_str(), &info) != 0 || !S_ISREG(info.st_mode))
-      return file.commit();
+    const RCFileStatus old = RCFileStatus::atPath(destination.path());
+    if (!old.isRegularFile()) return file.commit();
     if (extension == "m4a") {
       auto titles = RCMP4ReadTitleItems(destination.path());
       for (const RCMetadataItem& item : titles ? *titles : std::vector<RCMetadataItem>()) {
@@ -390,7 +389,7 @@ platform::Status commitKeepingTitles(RCReplacementFile& file, const platform::UR
         }
       }
     }
-    auto committed = file.commitReplacing({info.st_dev, info.st_ino});
+    auto committed = file.commitReplacing({old.info.st_dev, old.info.st_ino});
     if (committed || attempt + 1 == kAttempts || committed.error().domain() != RCErrorDomain ||
         committed.error().code() != RCErrorCodeChangedMeanwhile) {
       return committed;

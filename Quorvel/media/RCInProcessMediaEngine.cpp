@@ -17,6 +17,7 @@ extern "C" {
 #include <new>
 
 #include "Quorvel/errors/RCErrors.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/media/RCComposer.h"
 #include "Quorvel/media/RCFFmpegLogging.h"
 #include "Quorvel/media/RCFFmpegResource.h"
@@ -40,11 +41,9 @@ bool isSystemError(int status) { return RCIsSystemAVError(status); }
 // Opens `path` with libavformat. Only regular files: a FIFO or a device
 // would block the open or the reads forever.
 platform::Result<Input> openInput(const std::string& path) {
-  struct stat info {};
-  if (::stat(path.c_str(), &info) != 0) {
-    return platform::fail(platform::posixError(errno, "stat " + path));
-  }
-  if (!S_ISREG(info.st_mode)) return platform::fail(assetError(1, "not a regular file: " + path));
+  const RCFileStatus file = RCFileStatus::atPathFollowing(path);
+  if (!file.exists()) return platform::fail(platform::posixError(file.error, "stat " + path));
+  if (!file.isRegularFile()) return platform::fail(assetError(1, "not a regular file: " + path));
   AVFormatContext* raw = nullptr;
   const int status = RCOpenMediaInput(&raw, path.c_str());
   if (status < 0) {

@@ -14,6 +14,7 @@
 #include <optional>
 
 #include "Quorvel/files/RCFile.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCReplacementFile.h"
 
 namespace quorvel {
@@ -503,10 +504,10 @@ struct LoadedMovie {
 };
 
 platform::Result<LoadedMovie> loadMovie(int fd) {
-  struct stat info {};
-  if (::fstat(fd, &info) != 0) return platform::fail(ioError(errno, "fstat"));
-  if (!S_ISREG(info.st_mode)) return platform::fail(mp4Error(kRCMP4ErrorIO, "not a regular file"));
-  const std::uint64_t fileSize = std::uint64_t(info.st_size);
+  const RCFileStatus status = RCFileStatus::ofDescriptor(fd);
+  if (!status.exists()) return platform::fail(ioError(status.error, "fstat"));
+  if (!status.isRegularFile()) return platform::fail(mp4Error(kRCMP4ErrorIO, "not a regular file"));
+  const std::uint64_t fileSize = std::uint64_t(status.info.st_size);
   auto atoms =
       RCMP4TopLevelAtoms(fileSize, [fd](std::uint64_t offset, std::size_t size, std::uint8_t* out) {
         return RCPreadFully(fd, offset, size, out);

@@ -10,6 +10,7 @@
 
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFile.h"
+#include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCReplacementFile.h"
 
 namespace quorvel {
@@ -106,10 +107,11 @@ platform::Result<RCWaveform> RCDecodeWaveformFile(std::span<const std::uint8_t> 
 platform::Result<RCWaveform> RCReadWaveformFile(const platform::URL& url) {
   RCScopedFd fd(::open(url.path().c_str(), O_RDONLY | O_CLOEXEC));
   if (!fd) return platform::fail(platform::posixError(errno, "cannot open " + url.path()));
-  struct stat info {};
-  if (::fstat(fd.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
+  const RCFileStatus status = RCFileStatus::ofDescriptor(fd.get());
+  if (!status.isRegularFile()) {
     return platform::fail(corrupt(url.lastPathComponent() + " is not a regular file"));
   }
+  const struct stat& info = status.info;
   if (std::uint64_t(info.st_size) > kMaxFileSize) {
     return platform::fail(corrupt(fmt::format("{} bytes is too large", info.st_size)));
   }
