@@ -201,6 +201,17 @@ class BusHarness {
     });
     return [pending] { return pending->done.wait() ? pending->answer : Answer{}; };
   }
+  // Returns once the bus has passed on what the peer sent before: a peer's
+  // messages go out in order, and the bus answers this one after routing them.
+  void flush(const std::string& peer) {
+    auto daemon =
+        sdbus::createProxy(*peers_.at(peer)->bus, "org.freedesktop.DBus", "/org/freedesktop/DBus");
+    Latch answered;
+    daemon->callMethodAsync("GetId")
+        .onInterface("org.freedesktop.DBus")
+        .uponReplyInvoke([&](const sdbus::Error*, std::string) { answered.open(); });
+    answered.wait();
+  }
   // The peer disconnects from the bus.
   void vanish(const std::string& peer) { peers_.erase(peer); }
   // The peers stop servicing their connections first: their threads would
@@ -482,6 +493,26 @@ TEST_F(BusListenerTest, TheBusAnswersOtherInterfacesAndIntrospectionAndSignalsRe
   harness.listener().emitSignal("Changed");
   EXPECT_TRUE(gate.waitUntil([&] { return received == 1; }));
   peer->leaveEventLoop();
+}
+
+// An orderly stop first delivers the calls that have reached the listener:
+// the bus thread is held while a call arrives and the stop is requested.
+TEST_F(BusListenerTest, StopDeliversWhatHasArrived) {
+  Latch entered;
+  Latch release;
+  ASSERT_TRUE(harness.listener().performOnBusThread([&] {
+    entered.open();
+    release.wait();
+  }));
+  ASSERT_TRUE(entered.wait());
+  auto peer = harness.newPeer();
+  auto answer = harness.call(peer, "Echo", {"x"});
+  harness.flush(peer);
+  std::thread stopper([&] { harness.listener().stop(); });
+  while (harness.listener().performOnBusThread([] {})) std::this_thread::yield();
+  release.open();
+  stopper.join();
+  EXPECT_EQ(answer().values, BusValues{"x"});
 }
 
 // A name already taken is the integration test's second daemon.
