@@ -61,63 +61,49 @@ TEST(OperationTest, DependenciesInEveryPlacementFinishFirst) {
   EXPECT_EQ(order, (std::vector<std::string>{"done", "later", "elsewhere", "dependent"}));
 }
 
-TEST(OperationQueueTest, AtMostTheLimitRunAndTheNextStartsWhenOneEnds) {
-  OperationQueue queue;
-  queue.setMaxConcurrentOperationCount(0);  // starts nothing until raised
-  Counter started;
-  Latch gates[3];
-  Operations operations;
-  for (auto& gate : gates) {
-    operations.push_back(blocking(started, gate));
-    queue.addOperation(operations.back());
-  }
-  EXPECT_FALSE(operations[0]->isExecuting());
-  queue.setMaxConcurrentOperationCount(2);
-  started.waitFor(2);
-  EXPECT_TRUE(operations[0]->isExecuting() && operations[1]->isExecuting());
-  EXPECT_FALSE(operations[2]->isExecuting());
-  gates[1].open();
-  started.waitFor(3);
-  EXPECT_TRUE(operations[2]->isExecuting() && operations[1]->isFinished());
-  gates[0].open();
-  gates[2].open();
-  queue.waitUntilAllOperationsAreFinished();
-  EXPECT_EQ(started.value(), 3);
-}
-
-// Suspension holds queued operations and lets running ones finish;
-// destroying the queue then waits for a running one and drops the rest.
-TEST(OperationQueueTest, SuspensionHoldsQueuedOperationsAndDestructionDropsThem) {
+// At most the limit run, and the next starts when one ends; suspension then
+// holds queued operations and lets running ones finish; destroying the
+// queue waits for the one still running and drops those held.
+TEST(OperationQueueTest, LimitSuspensionAndDestruction) {
   Counter started;
   Counter finished;
-  Latch running[2];
+  Latch gates[3];
   Latch open;
   open.open();
+  Operations operations;
   Operations held;
   std::thread opener;
   {
     OperationQueue queue;
-    queue.setMaxConcurrentOperationCount(2);
-    for (auto& gate : running) {
-      auto operation = blocking(started, gate);
-      operation->setCompletionBlock([&] { finished.increment(); });
-      queue.addOperation(operation);
+    queue.setMaxConcurrentOperationCount(0);  // starts nothing until raised
+    for (auto& gate : gates) {
+      operations.push_back(blocking(started, gate));
+      operations.back()->setCompletionBlock([&] { finished.increment(); });
+      queue.addOperation(operations.back());
     }
+    EXPECT_FALSE(operations[0]->isExecuting());
+    queue.setMaxConcurrentOperationCount(2);
     started.waitFor(2);
+    EXPECT_TRUE(operations[0]->isExecuting() && operations[1]->isExecuting());
+    EXPECT_FALSE(operations[2]->isExecuting());
+    gates[1].open();
+    started.waitFor(3);
+    EXPECT_TRUE(operations[2]->isExecuting() && operations[1]->isFinished());
+
     queue.setSuspended(true);
     for (int i = 0; i < 3; ++i) {
       held.push_back(blocking(started, open));
       held.back()->setCompletionBlock([&] { finished.increment(); });
       queue.addOperation(held.back());
     }
-    running[0].open();
-    finished.waitFor(1);  // a running one went on while suspended
-    EXPECT_EQ(started.value(), 2);
+    gates[0].open();
+    finished.waitFor(2);  // a running one went on while suspended
+    EXPECT_EQ(started.value(), 3);
     for (const auto& operation : held) EXPECT_TRUE(operation->isReady());
-    opener = std::thread([&] { running[1].open(); });  // races the destruction
+    opener = std::thread([&] { gates[2].open(); });  // races the destruction
   }
   opener.join();
-  EXPECT_EQ(finished.value(), 2);
+  EXPECT_EQ(finished.value(), 3);
   for (const auto& operation : held)
     EXPECT_FALSE(operation->isExecuting() || operation->isFinished());
 }

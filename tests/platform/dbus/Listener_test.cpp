@@ -88,38 +88,21 @@ struct Recorder : ListenerDelegate {
       });
     };
     InterfaceDescription description{kInterface, {}, {{"Changed", "", {}}}};
-    description.methods = {
-        {"Echo",
-         "s",
-         {"text"},
-         "s",
-         {"echo"},
-         false,
-         [record](IncomingCall call) {
+    description.methods.push_back(
+        {"Echo", "s", {"text"}, "s", {"echo"}, false, [record](IncomingCall call) {
            record(call);
            call.reply(BusValues(call.arguments()));
-         }},
-        {"Hold",
-         "",
-         {},
-         "(siss)",
-         {"token"},
-         false,
-         [this, record](IncomingCall call) {
+         }});
+    description.methods.push_back(
+        {"Hold", "", {}, "(siss)", {"token"}, false, [this, record](IncomingCall call) {
            record(call);
            gate.update([&] { held.push_back(std::move(call)); });
-         }},
-        {"End",
-         "(siss)",
-         {"token"},
-         "",
-         {},
-         true,
-         [record](IncomingCall call) {
+         }});
+    description.methods.push_back(
+        {"End", "(siss)", {"token"}, "", {}, true, [record](IncomingCall call) {
            record(call);
            call.reply();  // does nothing: no reply expected
-         }},
-    };
+         }});
     return description;
   }
 };
