@@ -62,9 +62,10 @@ TEST(SerialQueueTest, AsyncRunsOffTheCallersThreadAndDestructionRunsWhatIsQueued
 
 // Producers queue work across queues, half of them async from inside
 // adoption scopes (as an event loop does), the others async and sync, so
-// adopted runs race the workers and the sync callers: each queue's tasks never overlap, and each
-// producer's tasks on a queue run in the order it queued them. The plain
-// counters are touched only on their queue, so TSan flags any overlap too.
+// adopted runs race the workers and the sync callers: each queue's tasks
+// never overlap, and each producer's tasks on a queue run in the order it
+// queued them. The plain counters are touched only on their queue, so TSan
+// flags any overlap too.
 TEST(SerialQueueStressTest, TasksOfAQueueNeverOverlapAndKeepEachProducersOrder) {
   constexpr int kQueues = 8;
   constexpr int kProducers = 4;
