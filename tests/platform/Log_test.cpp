@@ -1,35 +1,13 @@
 // The log convention: "[tag] message", levels against the threshold, sink.
+#include "platform/Log.h"
+
 #include <gtest/gtest.h>
 
-#include <mutex>
-#include <string>
-#include <vector>
-
-#include "platform/Log.h"
 #include "platform/URL.h"
+#include "tests/support/LogCapture.h"
 
 namespace platform {
 namespace {
-
-struct CapturedLine {
-  int level;
-  std::string text;
-};
-
-class LogTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    setConsoleLogging(false);
-    setLogSinkForTesting([this](int level, std::string_view text) {
-      lines_.push_back({level, std::string(text)});
-    });
-  }
-  void TearDown() override {
-    setLogSinkForTesting(nullptr);
-    setLogThreshold(kLogLevelNotice);
-  }
-  std::vector<CapturedLine> lines_;
-};
 
 // The tag is the file name up to its first dot.
 static_assert(logTagForFile("/src/quorveld/SavedRecordingService.Connections.cpp") ==
@@ -37,7 +15,8 @@ static_assert(logTagForFile("/src/quorveld/SavedRecordingService.Connections.cpp
 static_assert(logTagForFile("Models/RCSavedRecordingsModel+RCSOrphanHandling.cpp") ==
               "RCSavedRecordingsModel+RCSOrphanHandling");
 
-TEST_F(LogTest, ThresholdFiltersTracingUnlessVerboseWithoutFormattingDroppedLines) {
+TEST(LogTest, ThresholdFiltersTracingUnlessVerboseWithoutFormattingDroppedLines) {
+  quorvel::testing::LogCapture log(kLogLevelNotice);
   int formatted = 0;
   auto count = [&formatted] { return ++formatted; };
   QV_LOG(kLogLevelDebug, "hidden {}", count());
@@ -45,9 +24,9 @@ TEST_F(LogTest, ThresholdFiltersTracingUnlessVerboseWithoutFormattingDroppedLine
   QV_LOG(kLogLevelError, "shown");
   setLogThreshold(kLogLevelDebug);
   QV_LOG(kLogLevelDebug, "now shown {}", URL::fileURLWithPath("/a b"));
-  ASSERT_EQ(lines_.size(), 2u);
-  EXPECT_EQ(lines_[0].text, "[Log_test] shown");
-  EXPECT_EQ(lines_[1].text, "[Log_test] now shown file:///a%20b");
+  EXPECT_EQ(log.lines(), (std::vector<quorvel::testing::LogLine>{
+                             {kLogLevelError, "[Log_test] shown"},
+                             {kLogLevelDebug, "[Log_test] now shown file:///a%20b"}}));
 }
 
 }  // namespace

@@ -7,66 +7,26 @@
 
 #include <algorithm>
 #include <atomic>
-#include <latch>
 #include <mutex>
 #include <random>
 #include <thread>
 #include <vector>
 
+#include "tests/support/Gate.h"
+
 namespace platform {
 namespace {
 
-// A count that tests wait on instead of sleeping.
-class Counter {
- public:
-  void increment() {
-    ++count_;
-    count_.notify_all();
-  }
-  void waitFor(int atLeast) {
-    for (int now = count_.load(); now < atLeast; now = count_.load()) count_.wait(now);
-  }
-  int value() const { return count_.load(); }
+using testing::Counter;
+using testing::Latch;
+using Operations = std::vector<std::shared_ptr<Operation>>;
 
- private:
-  std::atomic<int> count_{0};
-};
-
-// A gate that blocked operations wait at until the test opens it.
-struct Gate : std::latch {
-  Gate() : std::latch(1) {}
-  void open() { count_down(); }
-};
-
-// Records its start, then blocks until its gate opens.
-class BlockingOperation : public Operation {
- public:
-  BlockingOperation(Counter& started, Gate& gate) : started_(started), gate_(gate) {}
-  void main() override {
-    started_.increment();
-    gate_.wait();
-  }
-
- private:
-  Counter& started_;
-  Gate& gate_;
-};
-
-// How often main and the completion block run is the stress test's business.
-TEST(OperationTest, ExecutingDuringMainAndFinishedBeforeTheCompletionBlock) {
-  OperationQueue queue;
-  std::atomic<bool> executingInMain{false};
-  std::atomic<bool> finishedInCompletion{false};
-  std::shared_ptr<Operation> operation;
-  operation = std::make_shared<BlockOperation>(
-      [&] { executingInMain = operation->isExecuting() && !operation->isFinished(); });
-  operation->setCompletionBlock(
-      [&] { finishedInCompletion = operation->isFinished() && !operation->isExecuting(); });
-  queue.addOperation(operation);
-  queue.waitUntilAllOperationsAreFinished();
-  EXPECT_TRUE(executingInMain.load());
-  EXPECT_TRUE(finishedInCompletion.load());
-  EXPECT_EQ(queue.operationCount(), 0u);
+// An operation that counts its start, then blocks until `gate` opens.
+std::shared_ptr<Operation> blocking(Counter& started, Latch& gate) {
+  return std::make_shared<BlockOperation>([&] {
+    started.increment();
+    gate.wait();
+  });
 }
 
 TEST(OperationTest, DependenciesInEveryPlacementFinishFirst) {
@@ -80,17 +40,13 @@ TEST(OperationTest, DependenciesInEveryPlacementFinishFirst) {
       order.push_back(name);
     });
   };
-  // Already finished before the dependent exists.
-  auto done = record("done");
+  auto done = record("done");  // finished before the dependent exists
   queue.addOperation(done);
   queue.waitUntilAllOperationsAreFinished();
-
   auto later = record("later");          // same queue, queued after its dependent
   auto elsewhere = record("elsewhere");  // another queue
   auto dependent = record("dependent");
-  dependent->addDependency(done);
-  dependent->addDependency(later);
-  dependent->addDependency(elsewhere);
+  for (const auto& dependency : {done, later, elsewhere}) dependent->addDependency(dependency);
   other.setSuspended(true);
   Counter laterDone;
   later->setCompletionBlock([&] { laterDone.increment(); });
@@ -98,98 +54,58 @@ TEST(OperationTest, DependenciesInEveryPlacementFinishFirst) {
   queue.addOperation(later);
   other.addOperation(elsewhere);
   laterDone.waitFor(1);  // the dependent still waits for "elsewhere"
-  EXPECT_FALSE(dependent->isReady());
-  EXPECT_FALSE(dependent->isExecuting());
-  EXPECT_FALSE(dependent->isFinished());
+  EXPECT_FALSE(dependent->isReady() || dependent->isExecuting() || dependent->isFinished());
   other.setSuspended(false);
   other.waitUntilAllOperationsAreFinished();
   queue.waitUntilAllOperationsAreFinished();
   EXPECT_EQ(order, (std::vector<std::string>{"done", "later", "elsewhere", "dependent"}));
 }
 
-TEST(OperationQueueTest, AtMostTheLimitRunAndTheNextStartsWhenOneEnds) {
-  OperationQueue queue;
-  queue.setMaxConcurrentOperationCount(0);  // starts nothing until raised
-  Counter started;
-  Gate gates[3];
-  std::vector<std::shared_ptr<Operation>> operations;
-  for (auto& gate : gates) {
-    operations.push_back(std::make_shared<BlockingOperation>(started, gate));
-    queue.addOperation(operations.back());
-  }
-  EXPECT_FALSE(operations[0]->isExecuting());
-  queue.setMaxConcurrentOperationCount(2);
-  started.waitFor(2);
-  EXPECT_TRUE(operations[0]->isExecuting());
-  EXPECT_TRUE(operations[1]->isExecuting());
-  EXPECT_FALSE(operations[2]->isExecuting());
-  gates[1].open();
-  started.waitFor(3);
-  EXPECT_TRUE(operations[2]->isExecuting());
-  EXPECT_TRUE(operations[1]->isFinished());
-  gates[0].open();
-  gates[2].open();
-  queue.waitUntilAllOperationsAreFinished();
-  EXPECT_EQ(started.value(), 3);
-}
-
-TEST(OperationQueueTest, SuspensionHoldsQueuedOperationsAndLetsRunningOnesFinish) {
-  OperationQueue queue;
-  queue.setMaxConcurrentOperationCount(2);
+// At most the limit run, and the next starts when one ends; suspension then
+// holds queued operations and lets running ones finish; destroying the
+// queue waits for the one still running and drops those held.
+TEST(OperationQueueTest, LimitSuspensionAndDestruction) {
   Counter started;
   Counter finished;
-  Gate running[2];
-  Gate open;
+  Latch gates[3];
+  Latch open;
   open.open();
-  for (auto& gate : running) {
-    auto operation = std::make_shared<BlockingOperation>(started, gate);
-    operation->setCompletionBlock([&] { finished.increment(); });
-    queue.addOperation(operation);
-  }
-  started.waitFor(2);
-  queue.setSuspended(true);
-  std::vector<std::shared_ptr<Operation>> held;
-  for (int i = 0; i < 3; ++i) {
-    held.push_back(std::make_shared<BlockingOperation>(started, open));
-    held.back()->setCompletionBlock([&] { finished.increment(); });
-    queue.addOperation(held.back());
-  }
-  running[0].open();
-  running[1].open();
-  finished.waitFor(2);  // the running ones went on while suspended
-  EXPECT_EQ(started.value(), 2);
-  for (const auto& operation : held) {
-    EXPECT_TRUE(operation->isReady());
-    EXPECT_FALSE(operation->isExecuting());
-  }
-  queue.setSuspended(false);
-  queue.waitUntilAllOperationsAreFinished();
-  EXPECT_EQ(started.value(), 5);
-  EXPECT_EQ(finished.value(), 5);
-}
-
-TEST(OperationQueueTest, DestructionWaitsForRunningOperationsAndDropsQueuedOnes) {
-  Counter started;
-  Gate gate;
-  std::atomic<int> completions{0};
-  auto running = std::make_shared<BlockingOperation>(started, gate);
-  running->setCompletionBlock([&] { ++completions; });
-  auto queued =
-      std::make_shared<BlockOperation>([] { ADD_FAILURE() << "a dropped operation ran"; });
+  Operations operations;
+  Operations held;
+  std::thread opener;
   {
     OperationQueue queue;
-    queue.setMaxConcurrentOperationCount(1);
-    queue.addOperation(running);
-    started.waitFor(1);
+    queue.setMaxConcurrentOperationCount(0);  // starts nothing until raised
+    for (auto& gate : gates) {
+      operations.push_back(blocking(started, gate));
+      operations.back()->setCompletionBlock([&] { finished.increment(); });
+      queue.addOperation(operations.back());
+    }
+    EXPECT_FALSE(operations[0]->isExecuting());
+    queue.setMaxConcurrentOperationCount(2);
+    started.waitFor(2);
+    EXPECT_TRUE(operations[0]->isExecuting() && operations[1]->isExecuting());
+    EXPECT_FALSE(operations[2]->isExecuting());
+    gates[1].open();
+    started.waitFor(3);
+    EXPECT_TRUE(operations[2]->isExecuting() && operations[1]->isFinished());
+
     queue.setSuspended(true);
-    queue.addOperation(queued);
-    std::thread opener([&] { gate.open(); });
-    opener.join();
+    for (int i = 0; i < 3; ++i) {
+      held.push_back(blocking(started, open));
+      held.back()->setCompletionBlock([&] { finished.increment(); });
+      queue.addOperation(held.back());
+    }
+    gates[0].open();
+    finished.waitFor(2);  // a running one went on while suspended
+    EXPECT_EQ(started.value(), 3);
+    for (const auto& operation : held) EXPECT_TRUE(operation->isReady());
+    opener = std::thread([&] { gates[2].open(); });  // races the destruction
   }
-  EXPECT_TRUE(running->isFinished());
-  EXPECT_EQ(completions.load(), 1);
-  EXPECT_FALSE(queued->isExecuting());
-  EXPECT_FALSE(queued->isFinished());
+  opener.join();
+  EXPECT_EQ(finished.value(), 3);
+  for (const auto& operation : held)
+    EXPECT_FALSE(operation->isExecuting() || operation->isFinished());
 }
 
 TEST(OperationQueueDeathTest, AddingAnOperationTwiceAborts) {
@@ -206,22 +122,22 @@ TEST(OperationQueueDeathTest, AddingAnOperationTwiceAborts) {
 }
 
 // Random dependency graphs: no operation starts before its dependencies
-// finished, the limit is never exceeded, every completion block runs once,
-// while another thread suspends and resumes the queue at random.
+// finished, the limit is never exceeded, main (executing) and then the
+// completion block (finished) run once each, while another thread suspends
+// and resumes the queue at random.
 TEST(OperationQueueStressTest, RandomGraphsHonourDependenciesLimitAndCompletions) {
   constexpr int kOperations = 300;
   for (int limit : {1, 2, 3}) {
     for (unsigned seed = 1; seed <= 4; ++seed) {
-      SCOPED_TRACE(testing::Message() << "limit " << limit << " seed " << seed);
+      SCOPED_TRACE(::testing::Message() << "limit " << limit << " seed " << seed);
       std::mt19937 random(seed * 7919 + limit);
       OperationQueue queue;
       queue.setMaxConcurrentOperationCount(limit);
       std::atomic<int> running{0};
       std::atomic<int> maxRunning{0};
-      std::atomic<int> earlyStarts{0};
-      std::vector<std::atomic<int>> mains(kOperations);
-      std::vector<std::atomic<int>> completions(kOperations);
-      std::vector<std::shared_ptr<Operation>> operations(kOperations);
+      std::atomic<int> faults{0};                       // early starts and wrong states
+      std::vector<std::atomic<int>> runs(kOperations);  // mains and completions
+      Operations operations(kOperations);
       for (int i = 0; i < kOperations; ++i) {
         operations[i] = std::make_shared<BlockOperation>([&, i] {
           const int now = ++running;
@@ -229,20 +145,23 @@ TEST(OperationQueueStressTest, RandomGraphsHonourDependenciesLimitAndCompletions
           while (now > seen && !maxRunning.compare_exchange_weak(seen, now)) {
           }
           for (const auto& dependency : operations[i]->dependencies()) {
-            if (!dependency->isFinished()) ++earlyStarts;
+            if (!dependency->isFinished()) ++faults;
           }
-          ++mains[i];
+          if (!operations[i]->isExecuting() || operations[i]->isFinished()) ++faults;
+          runs[i] += 1;
           std::this_thread::yield();
           --running;
         });
-        operations[i]->setCompletionBlock([&, i] { ++completions[i]; });
+        operations[i]->setCompletionBlock([&, i] {
+          runs[i] += 1000;
+          if (!operations[i]->isFinished() || operations[i]->isExecuting()) ++faults;
+        });
       }
       // Dependencies point at earlier-created operations (no cycles); some
       // are wired before queueing, some after (under suspension).
       std::vector<std::pair<int, int>> lateEdges;
       for (int i = 1; i < kOperations; ++i) {
-        const int count = std::uniform_int_distribution<int>(0, 3)(random);
-        for (int k = 0; k < count; ++k) {
+        for (int k = std::uniform_int_distribution<int>(0, 3)(random); k > 0; --k) {
           const int dependency = std::uniform_int_distribution<int>(0, i - 1)(random);
           if (random() % 4 == 0) {
             lateEdges.emplace_back(i, dependency);
@@ -271,11 +190,11 @@ TEST(OperationQueueStressTest, RandomGraphsHonourDependenciesLimitAndCompletions
       adding = false;
       toggler.join();
       queue.waitUntilAllOperationsAreFinished();
-      EXPECT_EQ(earlyStarts.load(), 0);
+      EXPECT_EQ(faults.load(), 0);
+      EXPECT_EQ(queue.operationCount(), 0u);
       EXPECT_LE(maxRunning.load(), limit);
       for (int i = 0; i < kOperations; ++i) {
-        ASSERT_EQ(mains[i].load(), 1) << "operation " << i;
-        ASSERT_EQ(completions[i].load(), 1) << "operation " << i;
+        ASSERT_EQ(runs[i].load(), 1001) << "operation " << i;
         ASSERT_TRUE(operations[i]->isFinished());
       }
     }

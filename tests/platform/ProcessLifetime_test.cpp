@@ -10,121 +10,92 @@
 namespace platform {
 namespace {
 
-using std::chrono::milliseconds;
-using std::chrono::seconds;
+using namespace std::chrono_literals;
 
-class ProcessLifetimeTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    lifetime_.setIdleHandler([this] {
-      EXPECT_TRUE(queue_.isCurrent());
-      ++idleExits_;
+struct Lifetime {
+  ManualClock clock;
+  MainQueue queue{clock};
+  ProcessLifetime lifetime{queue};
+  int idleExits = 0;
+  Lifetime() {
+    lifetime.setIdleHandler([this] {
+      EXPECT_TRUE(queue.isCurrent());
+      ++idleExits;
     });
   }
-  // Moves time on and runs whatever became due.
-  void advance(Duration by) {
-    clock_.advance(by);
-    queue_.runUntilIdle();
-  }
-
-  ManualClock clock_;
-  MainQueue queue_{clock_};
-  ProcessLifetime lifetime_{queue_};
-  int idleExits_ = 0;
 };
 
-TEST_F(ProcessLifetimeTest, NeverExitsBeforeEnablingOrWithAZeroPeriod) {
-  lifetime_.beginTransaction();
-  lifetime_.endTransaction();
-  advance(seconds(3600));
-  EXPECT_EQ(idleExits_, 0);
-  lifetime_.setIdleExitAfter(Duration::zero());
-  lifetime_.enableTransactions();
-  lifetime_.beginTransaction();
-  lifetime_.endTransaction();
-  advance(seconds(86400));
-  EXPECT_EQ(idleExits_, 0);
-  EXPECT_EQ(queue_.pendingCount(), 0u);
+// Each step acts, then moves the clock on by `advance` and runs what became
+// due, then expects `exits` idle exits so far. A Period step sets the idle
+// period to `advance` instead, and the clock stays.
+enum class Do { Nothing, Begin, End, Enable, Period };
+struct Step {
+  Do action;
+  Duration advance;
+  int exits;
+};
+
+TEST(ProcessLifetimeTest, TheIdleHandlerRunsOnceAfterAFullIdlePeriodWithoutATransaction) {
+  const struct {
+    const char* name;
+    std::vector<Step> steps;
+  } timelines[] = {
+      // clang-format off
+      {"never before enabling, nor with a zero period",
+       {{Do::Begin, 0s, 0}, {Do::End, 3600s, 0}, {Do::Period, 0s, 0}, {Do::Enable, 0s, 0},
+        {Do::Begin, 0s, 0}, {Do::End, 86400s, 0}}},
+      {"the default 30 s after enabling, once",
+       {{Do::Enable, 30s - 1ms, 0}, {Do::Nothing, 1ms, 1}, {Do::Nothing, 300s, 1}}},
+      {"counted from the last end; a begin just before the deadline cancels it",
+       {{Do::Period, 10s, 0}, {Do::Enable, 0s, 0}, {Do::Begin, 100s, 0}, {Do::End, 9s, 0},
+        {Do::Begin, 5s, 0}, {Do::End, 9s, 0}, {Do::Nothing, 1s, 1}}},
+      {"a begin and end inside the period restart it",
+       {{Do::Period, 10s, 0}, {Do::Enable, 6s, 0}, {Do::Begin, 0s, 0}, {Do::End, 6s, 0},
+        {Do::Nothing, 4s, 1}}},
+      {"a new period while idle restarts the countdown",
+       {{Do::Enable, 20s, 0}, {Do::Period, 5s, 0}, {Do::Nothing, 4s, 0}, {Do::Nothing, 1s, 1}}},
+      // clang-format on
+  };
+  for (const auto& timeline : timelines) {
+    SCOPED_TRACE(timeline.name);
+    Lifetime t;
+    bool held = false;
+    for (std::size_t i = 0; i < timeline.steps.size(); ++i) {
+      const Step& step = timeline.steps[i];
+      if (step.action == Do::Begin) t.lifetime.beginTransaction();
+      if (step.action == Do::End) t.lifetime.endTransaction();
+      if (step.action == Do::Enable) t.lifetime.enableTransactions();
+      if (step.action == Do::Period) t.lifetime.setIdleExitAfter(step.advance);
+      held = step.action == Do::Begin || (held && step.action != Do::End);
+      if (step.action != Do::Period) t.clock.advance(step.advance);
+      t.queue.runUntilIdle();
+      EXPECT_EQ(t.idleExits, step.exits) << "step " << i;
+      EXPECT_EQ(t.lifetime.isInTransaction(), held) << "step " << i;
+    }
+  }
 }
 
-TEST_F(ProcessLifetimeTest, IdleForTheDefaultThirtySecondsAfterEnablingRunsTheHandlerOnce) {
-  lifetime_.enableTransactions();
-  advance(seconds(30) - milliseconds(1));
-  EXPECT_EQ(idleExits_, 0);
-  advance(milliseconds(1));
-  EXPECT_EQ(idleExits_, 1);
-  advance(seconds(300));
-  EXPECT_EQ(idleExits_, 1);
-}
+TEST(ProcessLifetimeTest, AHandlerMayBeginAgainAndWaitersForNoTransactionRunOnce) {
+  Lifetime t;
+  t.lifetime.setIdleExitAfter(1s);
+  t.lifetime.setIdleHandler([&] { t.lifetime.beginTransaction(); });
+  t.lifetime.enableTransactions();
+  t.clock.advance(1s);
+  t.queue.runUntilIdle();
+  EXPECT_TRUE(t.lifetime.isInTransaction());
 
-TEST_F(ProcessLifetimeTest, TheIdlePeriodCountsFromTheLastEnd) {
-  lifetime_.setIdleExitAfter(seconds(10));
-  lifetime_.enableTransactions();
-  lifetime_.beginTransaction();
-  EXPECT_TRUE(lifetime_.isInTransaction());
-  advance(seconds(100));  // held: never idle
-  EXPECT_EQ(idleExits_, 0);
-  lifetime_.endTransaction();
-  EXPECT_FALSE(lifetime_.isInTransaction());
-  advance(seconds(9));
-  lifetime_.beginTransaction();  // just before the deadline: cancels it
-  advance(seconds(5));
-  EXPECT_EQ(idleExits_, 0);
-  lifetime_.endTransaction();
-  advance(seconds(9));
-  EXPECT_EQ(idleExits_, 0);
-  advance(seconds(1));
-  EXPECT_EQ(idleExits_, 1);
-}
-
-TEST_F(ProcessLifetimeTest, ABeginAndEndInsideThePeriodRestartsIt) {
-  lifetime_.setIdleExitAfter(seconds(10));
-  lifetime_.enableTransactions();
-  advance(seconds(6));
-  lifetime_.beginTransaction();
-  lifetime_.endTransaction();  // the earlier timer (due at 10 s) is stale now
-  advance(seconds(6));
-  EXPECT_EQ(idleExits_, 0);
-  advance(seconds(4));
-  EXPECT_EQ(idleExits_, 1);
-}
-
-TEST_F(ProcessLifetimeTest, ChangingThePeriodWhileIdleRestartsTheCountdown) {
-  lifetime_.enableTransactions();
-  advance(seconds(20));
-  lifetime_.setIdleExitAfter(seconds(5));
-  advance(seconds(4));
-  EXPECT_EQ(idleExits_, 0);
-  advance(seconds(1));
-  EXPECT_EQ(idleExits_, 1);
-}
-
-TEST_F(ProcessLifetimeTest, AHandlerMayBeginAgain) {
-  lifetime_.setIdleExitAfter(seconds(1));
-  lifetime_.setIdleHandler([this] {
-    ++idleExits_;
-    lifetime_.beginTransaction();
-  });
-  lifetime_.enableTransactions();
-  advance(seconds(1));
-  EXPECT_EQ(idleExits_, 1);
-  EXPECT_TRUE(lifetime_.isInTransaction());
-}
-
-TEST_F(ProcessLifetimeTest, WaitersForNoTransactionRunOnceWhenTheRootEnds) {
   int ran = 0;
-  lifetime_.whenNoTransaction([&] { ++ran; });  // none held: at once
-  EXPECT_EQ(ran, 1);
-  lifetime_.beginTransaction();
-  lifetime_.whenNoTransaction([&] {
-    EXPECT_FALSE(lifetime_.isInTransaction());
+  t.lifetime.whenNoTransaction([&] {
+    EXPECT_FALSE(t.lifetime.isInTransaction());
     ++ran;
   });
+  EXPECT_EQ(ran, 0);
+  t.lifetime.endTransaction();
   EXPECT_EQ(ran, 1);
-  lifetime_.endTransaction();
-  EXPECT_EQ(ran, 2);
-  lifetime_.beginTransaction();
-  lifetime_.endTransaction();
+  t.lifetime.beginTransaction();
+  t.lifetime.endTransaction();
+  EXPECT_EQ(ran, 1);
+  t.lifetime.whenNoTransaction([&] { ++ran; });  // none held: at once
   EXPECT_EQ(ran, 2);
 }
 

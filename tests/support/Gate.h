@@ -34,4 +34,49 @@ class Gate {
   std::condition_variable changed_;
 };
 
+// Latch: a one-shot event. Work that must hold on waits in wait(), which
+// returns whether the test opened it within kWait. open() wakes the waiters
+// with the lock held, so a waiter may destroy the latch as soon as it returns.
+class Latch {
+ public:
+  void open() {
+    std::lock_guard lock(mutex_);
+    open_ = true;
+    opened_.notify_all();
+  }
+  bool wait() {
+    std::unique_lock lock(mutex_);
+    return opened_.wait_for(lock, kWait, [this] { return open_; });
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable opened_;
+  bool open_ = false;
+};
+
+// Counter: a count the test waits on; waitFor() returns whether it reached
+// `atLeast` within kWait. Safe to destroy once a wait returned, as Latch.
+class Counter {
+ public:
+  void increment() {
+    std::lock_guard lock(mutex_);
+    ++count_;
+    changed_.notify_all();
+  }
+  bool waitFor(int atLeast) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, kWait, [&] { return count_ >= atLeast; });
+  }
+  int value() {
+    std::lock_guard lock(mutex_);
+    return count_;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  int count_ = 0;
+};
+
 }  // namespace platform::testing
