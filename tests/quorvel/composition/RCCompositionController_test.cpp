@@ -319,7 +319,8 @@ TEST_P(CompositionControllerTest, AnUnreadableFragmentIsLeftOutAndKeptUntilItRea
     const std::string bytes = testing::readFile(damaged);
     c.damage(damaged);
     auto controller = controllerFor(editor->composedAVURL());
-
+    // A capture cut off is found by the repair that runs when its session ends.
+    if (c.openEnded) controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
     ASSERT_TRUE(compose(*controller, /*deleteFragments=*/true));
     EXPECT_NEAR(durationOf(editor->composedAVURL()), 0.75, 0.05);
     const std::string leftOut = "WARNING: leaving fragment '" +

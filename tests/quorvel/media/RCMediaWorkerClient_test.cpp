@@ -281,6 +281,11 @@ TEST_F(MediaWorkerClientTest, AFaultyWorkerFailsTheComposeWithWhatWentWrongAndNo
     EXPECT_EQ(composed.error(), RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
     EXPECT_TRUE(composed.error().localizedDescription().starts_with(c.error))
         << composed.error().localizedDescription();
+    // Without a working worker, every job fails: a probe too.
+    if (c.script) {
+      auto probe = worker->client().probe(file("a.m4a"));
+      EXPECT_TRUE(!probe && probe.error() == RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
+    }
     EXPECT_TRUE(worker->client().workerPids().empty());
     EXPECT_EQ(controller->composition()->decomposedFragments().size(), 2u);
     EXPECT_FALSE(fs::exists(editor->composedAVURL().path()));
