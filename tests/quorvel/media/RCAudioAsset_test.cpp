@@ -149,22 +149,24 @@ TEST_F(RCAudioAssetTest, ManyConcurrentLoadsEachCompleteExactlyOnce) {
   std::vector<std::atomic<int>> calls(kLoads);
   std::atomic<int> failures{0};
   int done = 0;  // guarded by gate
-  platform::testing::Gate gate;
+  // Shared with the callbacks: the last one may still be notifying when the
+  // wait below returns.
+  auto gate = std::make_shared<platform::testing::Gate>();
   std::vector<std::jthread> threads;
   for (int t = 0; t < kThreads; ++t) {
     threads.emplace_back([&, t] {
       for (int index = t * kPerThread; index < (t + 1) * kPerThread; ++index) {
-        (index % 2 ? a : b)->loadCommonMetadataAsync([&, index](auto result) {
+        (index % 2 ? a : b)->loadCommonMetadataAsync([&, gate, index](auto result) {
           if (!result || (index % 2 && result->titleItems.size() != 1)) ++failures;
           if (!RCAssetMetadataLoader::shared().isCurrent()) ++failures;
           calls[index].fetch_add(1);
-          gate.update([&] { ++done; });
+          gate->update([&] { ++done; });
         });
       }
     });
   }
   threads.clear();
-  ASSERT_TRUE(gate.waitUntil([&] { return done == kLoads; }));
+  ASSERT_TRUE(gate->waitUntil([&] { return done == kLoads; }));
   EXPECT_EQ(failures.load(), 0);
   for (auto& count : calls) EXPECT_EQ(count.load(), 1);
 }
