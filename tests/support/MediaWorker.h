@@ -10,10 +10,6 @@
 
 namespace quorvel::testing {
 
-inline std::string mediaWorkerPath() {
-  return std::string(QUORVEL_BINARY_DIR) + "/bin/quorvel-media";
-}
-
 // Installs a worker client as the process's media engine until destroyed,
 // then the in-process engine again.
 class ScopedMediaWorkerEngine {
@@ -27,9 +23,7 @@ class ScopedMediaWorkerEngine {
   ScopedMediaWorkerEngine& operator=(const ScopedMediaWorkerEngine&) = delete;
 
   static RCMediaWorkerClient::Options defaults() {
-    RCMediaWorkerClient::Options options;
-    options.workerPath = mediaWorkerPath();
-    return options;
+    return {.workerPath = std::string(QUORVEL_BINARY_DIR) + "/bin/quorvel-media"};
   }
   RCMediaWorkerClient& client() const { return *client_; }
 

@@ -11,30 +11,21 @@ namespace quorvel::testing {
 class RecordingsDirectoryTest : public TempDirectoryTest {
  protected:
   void SetUp() override {
-    TempDirectoryTest::SetUp();
-    root_ = dir_;
-    recordings_ = root_ / "Recordings";
     RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
     RCSavedRecordingsModel::resetSharedModelsForTesting();
     // Asking for the directory creates it.
     ASSERT_EQ(RCSavedRecordingsModel::savedRecordingsDirectory(), recordings_.string());
-    platform::setConsoleLogging(false);
   }
   void TearDown() override {
     RCSavedRecordingsModel::resetSharedModelsForTesting();
     RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
-    TempDirectoryTest::TearDown();
-  }
-  std::vector<std::string> logLines() {
-    std::lock_guard lock(logMutex_);
-    return log_;
   }
   std::string recordingsPath(std::string_view name) const {
     return (recordings_ / std::string(name)).string();
   }
 
-  std::filesystem::path root_;
-  std::filesystem::path recordings_;
+  std::filesystem::path root_ = dir_;
+  std::filesystem::path recordings_ = root_ / "Recordings";
 };
 
 }  // namespace quorvel::testing

@@ -1,27 +1,24 @@
 // A private temporary directory per test, whole-file reads and writes, and
-// captured log lines ("<level> <text>") while the test runs.
+// the log lines written while the test runs.
 #pragma once
 
 #include <gtest/gtest.h>
-#include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
-#include <mutex>
-#include <sstream>
 #include <string>
 #include <vector>
 
-#include "platform/Log.h"
 #include "platform/URL.h"
+#include "tests/support/LogCapture.h"
+#include "tests/support/ScopedTempDir.h"
 
 namespace quorvel::testing {
 
 inline std::string readFile(const std::filesystem::path& path) {
   std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return {std::istreambuf_iterator<char>(in), {}};
 }
 
 inline void writeFile(const std::filesystem::path& path, const std::string& contents) {
@@ -31,43 +28,26 @@ inline void writeFile(const std::filesystem::path& path, const std::string& cont
 
 class TempDirectoryTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    dir_ = std::filesystem::temp_directory_path() /
-           ("qv-" + std::to_string(::getpid()) + "-" +
-            ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    std::filesystem::remove_all(dir_);
-    std::filesystem::create_directories(dir_);
-    platform::setLogThreshold(7);
-    platform::setLogSinkForTesting([this](int level, std::string_view text) {
-      std::lock_guard lock(logMutex_);
-      log_.push_back(std::to_string(level) + " " + std::string(text));
-    });
-  }
-  void TearDown() override {
-    platform::setLogSinkForTesting(nullptr);
-    platform::setLogThreshold(6);
-    std::filesystem::remove_all(dir_);
-  }
   std::string path(const std::string& name) const { return (dir_ / name).string(); }
   platform::URL url(const std::string& name) const {
     return platform::URL::fileURLWithPath(path(name));
   }
-  // Whether a captured line contains (or, with `prefix`, starts with) `text`.
+  // The captured lines, each as "<level> <text>".
+  std::vector<std::string> logLines() {
+    std::vector<std::string> lines;
+    for (const LogLine& line : log_.lines())
+      lines.push_back(std::to_string(line.level) + " " + line.text);
+    return lines;
+  }
+  // Whether a captured line contains (or, with `prefix`, its "<level> <text>"
+  // starts with) `text`.
   bool logged(std::string_view text, bool prefix = false) {
-    std::lock_guard lock(logMutex_);
-    for (const auto& line : log_)
-      if (prefix ? line.starts_with(text) : line.find(text) != std::string::npos) return true;
-    return false;
+    if (!prefix) return log_.contains(text);
+    return std::ranges::any_of(logLines(),
+                               [&](const auto& line) { return line.starts_with(text); });
   }
   // How many captured lines of log level `level` contain `text`.
-  std::size_t loggedCount(std::string_view text, int level) {
-    std::lock_guard lock(logMutex_);
-    const std::string levelPrefix = std::to_string(level) + " ";
-    std::size_t count = 0;
-    for (const auto& line : log_)
-      count += line.starts_with(levelPrefix) && line.find(text) != std::string::npos;
-    return count;
-  }
+  std::size_t loggedCount(std::string_view text, int level) { return log_.count(text, level); }
   // Names of the hidden (temporary) files left in the directory.
   std::vector<std::string> hiddenFiles() const {
     std::vector<std::string> names;
@@ -77,9 +57,9 @@ class TempDirectoryTest : public ::testing::Test {
     return names;
   }
 
-  std::filesystem::path dir_;
-  std::mutex logMutex_;
-  std::vector<std::string> log_;
+  ScopedTempDir temp_;
+  std::filesystem::path dir_ = temp_.path();
+  LogCapture log_;
 };
 
 }  // namespace quorvel::testing

@@ -104,13 +104,109 @@ TEST(CompositionManifestTest, RefusesEveryMalformedShapeWithAReason) {
   EXPECT_FALSE(RCCompositionManifest::parse(std::string(5 * 1024 * 1024, ' ')));
 }
 
-TEST_F(CompositionTest, LoadsAValidBundleAndNamesItsFilesInsideTheDirectory) {
+TEST_F(CompositionTest, BundlesThatMustNotLoadAreRefusedLoggedAndLeftUntouched) {
+  const fs::path outside = root_ / "outside", secret = outside / "secret.m4a";
+  writeFile(secret, "secret");
+  auto manifestText = [](const std::string& composed, const std::string& fragmentFile) {
+    RCCompositionManifest manifest;
+    manifest.composedName = composed;
+    manifest.fragments = {{fragmentFile, {0, 1}, 0, 1.0, false}};
+    return manifest.serialize();
+  };
+  struct Case {
+    std::string name;
+    std::string manifest;                              // written into the bundle
+    std::function<void(const fs::path& bundle)> make;  // or what makes the bundle
+    std::string reason;
+  };
+  auto linkManifest = [&](const fs::path& b) {
+    fs::create_directories(b);
+    writeFile(outside / "manifest.json", manifestText("LinkedManifest.m4a", "f.m4a"));
+    fs::create_symlink(outside / "manifest.json", b / "manifest.json");
+  };
+  auto linkBundle = [&](const fs::path& b) {
+    writeFile(outside / "manifest.json", manifestText("LinkedBundle.m4a", "f.m4a"));
+    fs::create_directory_symlink(outside, b);
+  };
+  const std::string wrongTypes =
+      R"({"formatVersion":1,"composedAVURL":"WrongTypes.m4a","composedDuration":"1",)"
+      R"("savedRecordingURI":null,"fragments":[]})";
+  for (const Case& c : std::vector<Case>{
+           {"NotJSON", "{{{", {}, "not JSON"},
+           {"WrongTypes", wrongTypes, {}, "composedDuration is not a number"},
+           {"NoManifest", "", [](const fs::path& b) { fs::create_directories(b); },
+            "manifest.json"},
+           {"OtherRecording",
+            manifestText("Someone Else.m4a", "f.m4a"),
+            {},
+            "not the audio file of this bundle"},
+           {"LinkedFragment", "",
+            [&](const fs::path& b) {
+              writeFile(b / "manifest.json", manifestText("LinkedFragment.m4a", "f.m4a"));
+              fs::create_symlink(secret, b / "f.m4a");
+            },
+            "symbolic link"},
+           {"EscapingFragment",
+            manifestText("EscapingFragment.m4a", "../../outside/secret.m4a"),
+            {},
+            "not a plain file name"},
+           {"AbsoluteFragment",
+            manifestText("AbsoluteFragment.m4a", secret.string()),
+            {},
+            "not a plain file name"},
+           {"DirectoryFragment", "",
+            [&](const fs::path& b) {
+              writeFile(b / "manifest.json", manifestText("DirectoryFragment.m4a", "f.m4a"));
+              fs::create_directories(b / "f.m4a");
+            },
+            "not a regular file"},
+           {"LinkedManifest", "", linkManifest, "manifest.json"},
+           {"LinkedBundle", "", linkBundle, "symbolic link"},
+       }) {
+    SCOPED_TRACE(c.name);
+    const fs::path bundle = recordings_ / (c.name + ".composition");
+    c.make ? c.make(bundle) : writeFile(bundle / "manifest.json", c.manifest);
+    const std::string before = fs::is_regular_file(fs::symlink_status(bundle / "manifest.json"))
+                                   ? readFile(bundle / "manifest.json")
+                                   : "";
+    auto loaded = RCComposition::load(platform::URL::fileURLWithPath(bundle.string()));
+    ASSERT_FALSE(loaded);
+    EXPECT_NE(loaded.error().description().find(c.reason), std::string::npos) << loaded.error();
+    // So neither the repair nor composing ever reads or removes what it names.
+    auto controller = RCCompositionController::compositionControllerForComposedAVURL(
+        platform::URL::fileURLWithPath((recordings_ / (c.name + ".m4a")).string()));
+    EXPECT_FALSE(controller->composition());
+    EXPECT_TRUE(logged("ERROR: cannot load the composition '" + c.name + ".composition'"));
+    controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
+    EXPECT_FALSE(controller->composeNow(/*deleteFragments=*/true, false));
+    if (!before.empty()) {
+      EXPECT_EQ(readFile(bundle / "manifest.json"), before);
+    }
+  }
+  EXPECT_EQ(readFile(secret), "secret");
+
+  // A good bundle outside the recordings directory does not load either.
+  writeFile(root_ / "Foreign.composition/manifest.json", manifestText("Foreign.m4a", "f.m4a"));
+  auto loaded =
+      RCComposition::load(platform::URL::fileURLWithPath((root_ / "Foreign.composition").string()));
+  ASSERT_FALSE(loaded);
+  EXPECT_NE(loaded.error().localizedDescription().find("not directly inside"), std::string::npos);
+}
+
+// Orphaned fragments are capture files the manifest no longer uses.
+TEST_F(CompositionTest, LoadsAValidBundleNamesItsFilesInsideTheDirectoryAndFindsOrphans) {
   fs::path bundle = recordings_ / "Walk.composition";
   writeFile(bundle / "manifest.json", twoFragments().serialize());
   writeFile(bundle / "a.m4a", std::string(1000, 'a'));
   writeFile(bundle / "b.wav", std::string(234, 'b'));
   writeFile(recordings_ / "Walk.m4a", std::string(50, 'w'));
   writeFile(recordings_ / "Walk.waveform", std::string(7, 'v'));
+  writeFile(bundle / "c.m4a", "orphan");
+  writeFile(bundle / "b.flac", "orphan: b.wav is the one in use");
+  writeFile(bundle / "notes.txt", "not audio");
+  writeFile(bundle / "D.M4A", "other case: not a capture extension");
+  fs::create_directories(bundle / "dir.wav");
+  fs::create_symlink(root_ / "nowhere", bundle / "dangling.wav");
 
   auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
       platform::URL::fileURLWithPath(bundle.string() + "/"));
@@ -131,129 +227,16 @@ TEST_F(CompositionTest, LoadsAValidBundleAndNamesItsFilesInsideTheDirectory) {
   EXPECT_NE(composition->debugDescription().find("b.wav at 2.000+0.000 uses 0.000+open"),
             std::string::npos)
       << composition->debugDescription();
-}
 
-TEST_F(CompositionTest, BundlesThatMustNotLoadAreRefusedLoggedAndLeftUntouched) {
-  fs::path outside = root_ / "outside";
-  writeFile(outside / "secret.m4a", "secret");
-  struct Case {
-    std::string name;
-    std::function<void(const fs::path& bundle)> make;
-    std::string reason;
+  auto orphans = [](const RCComposition& composition) {
+    std::vector<std::string> names;
+    composition.enumerateOrphanedFragmentsWithBlock(
+        [&](const RCCompositionFragment& fragment, bool&) {
+          names.push_back(fragment.AVOutputURL().lastPathComponent());
+        });
+    return names;
   };
-  auto manifestText = [](const std::string& composed, const std::string& fragmentFile) {
-    RCCompositionManifest manifest;
-    manifest.composedName = composed;
-    manifest.fragments = {{fragmentFile, {0, 1}, 0, 1.0, false}};
-    return manifest.serialize();
-  };
-  std::vector<Case> cases = {
-      {"NotJSON", [](const fs::path& b) { writeFile(b / "manifest.json", "{{{"); }, "not JSON"},
-      {"WrongTypes",
-       [](const fs::path& b) {
-         writeFile(b / "manifest.json",
-                   R"({"formatVersion":1,"composedAVURL":"WrongTypes.m4a","composedDuration":"1",)"
-                   R"("savedRecordingURI":null,"fragments":[]})");
-       },
-       "composedDuration is not a number"},
-      {"NoManifest", [](const fs::path& b) { fs::create_directories(b); }, "manifest.json"},
-      {"OtherRecording",
-       [&](const fs::path& b) {
-         writeFile(b / "manifest.json", manifestText("Someone Else.m4a", "f.m4a"));
-       },
-       "not the audio file of this bundle"},
-      {"LinkedFragment",
-       [&](const fs::path& b) {
-         writeFile(b / "manifest.json", manifestText("LinkedFragment.m4a", "f.m4a"));
-         fs::create_symlink(outside / "secret.m4a", b / "f.m4a");
-       },
-       "symbolic link"},
-      {"EscapingFragment",
-       [&](const fs::path& b) {
-         writeFile(b / "manifest.json",
-                   manifestText("EscapingFragment.m4a", "../../outside/secret.m4a"));
-       },
-       "not a plain file name"},
-      {"AbsoluteFragment",
-       [&](const fs::path& b) {
-         writeFile(b / "manifest.json",
-                   manifestText("AbsoluteFragment.m4a", (outside / "secret.m4a").string()));
-       },
-       "not a plain file name"},
-      {"DirectoryFragment",
-       [&](const fs::path& b) {
-         writeFile(b / "manifest.json", manifestText("DirectoryFragment.m4a", "f.m4a"));
-         fs::create_directories(b / "f.m4a");
-       },
-       "not a regular file"},
-      {"LinkedManifest",
-       [&](const fs::path& b) {
-         fs::create_directories(b);
-         writeFile(outside / "manifest.json", manifestText("LinkedManifest.m4a", "f.m4a"));
-         fs::create_symlink(outside / "manifest.json", b / "manifest.json");
-       },
-       "manifest.json"},
-      {"LinkedBundle",
-       [&](const fs::path& b) {
-         writeFile(outside / "manifest.json", manifestText("LinkedBundle.m4a", "f.m4a"));
-         fs::create_directory_symlink(outside, b);
-       },
-       "symbolic link"},
-  };
-  for (const Case& c : cases) {
-    fs::path bundle = recordings_ / (c.name + ".composition");
-    c.make(bundle);
-    std::string before = fs::is_regular_file(fs::symlink_status(bundle / "manifest.json"))
-                             ? readFile(bundle / "manifest.json")
-                             : "";
-    auto loaded = RCComposition::load(platform::URL::fileURLWithPath(bundle.string()));
-    ASSERT_FALSE(loaded) << c.name;
-    EXPECT_NE(loaded.error().description().find(c.reason), std::string::npos)
-        << c.name << ": " << loaded.error();
-    EXPECT_FALSE(RCComposition::compositionLoadedFromCompositionBundleURL(
-        platform::URL::fileURLWithPath(bundle.string())));
-    EXPECT_TRUE(logged("ERROR: cannot load the composition '" + c.name + ".composition'"))
-        << c.name;
-    // So neither the repair nor composing ever reads or removes what it names.
-    auto controller = RCCompositionController::compositionControllerForComposedAVURL(
-        platform::URL::fileURLWithPath((recordings_ / (c.name + ".m4a")).string()));
-    EXPECT_FALSE(controller->composition()) << c.name;
-    controller->rcs_repairDecomposedFragmentMetadataIfNecessary();
-    EXPECT_FALSE(controller->composeNow(/*deleteFragments=*/true, false)) << c.name;
-    if (!before.empty()) {
-      EXPECT_EQ(readFile(bundle / "manifest.json"), before) << c.name;
-    }
-  }
-  EXPECT_EQ(readFile(outside / "secret.m4a"), "secret");
-
-  // A good bundle outside the recordings directory does not load either.
-  fs::path foreign = root_ / "Foreign.composition";
-  writeFile(foreign / "manifest.json", manifestText("Foreign.m4a", "f.m4a"));
-  auto loaded = RCComposition::load(platform::URL::fileURLWithPath(foreign.string()));
-  ASSERT_FALSE(loaded);
-  EXPECT_NE(loaded.error().localizedDescription().find("not directly inside"), std::string::npos);
-}
-
-TEST_F(CompositionTest, OrphanedFragmentsAreCaptureFilesTheManifestNoLongerUses) {
-  fs::path bundle = recordings_ / "Walk.composition";
-  writeFile(bundle / "manifest.json", twoFragments().serialize());
-  writeFile(bundle / "a.m4a", "used");
-  writeFile(bundle / "c.m4a", "orphan");
-  writeFile(bundle / "b.flac", "orphan: b.wav is the one in use");
-  writeFile(bundle / "notes.txt", "not audio");
-  writeFile(bundle / "D.M4A", "other case: not a capture extension");
-  fs::create_directories(bundle / "dir.wav");
-  fs::create_symlink(root_ / "nowhere", bundle / "dangling.wav");
-  auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
-      platform::URL::fileURLWithPath(bundle.string()));
-  ASSERT_TRUE(composition);
-
-  std::vector<std::string> orphans;
-  composition->enumerateOrphanedFragmentsWithBlock(
-      [&](const RCCompositionFragment& fragment, bool&) {
-        orphans.push_back(fragment.AVOutputURL().lastPathComponent());
-      });
-  EXPECT_EQ(orphans, (std::vector<std::string>{"b.flac", "c.m4a", "dangling.wav"}));
+  EXPECT_EQ(orphans(*composition), (std::vector<std::string>{"b.flac", "c.m4a", "dangling.wav"}));
 
   // Deleting them goes through the confined removal; the walk stops when asked.
   int visited = 0;
@@ -263,23 +246,16 @@ TEST_F(CompositionTest, OrphanedFragmentsAreCaptureFilesTheManifestNoLongerUses)
         stop = ++visited == 2;
       });
   EXPECT_EQ(visited, 2);
-  EXPECT_FALSE(fs::exists(bundle / "b.flac"));
-  EXPECT_FALSE(fs::exists(bundle / "c.m4a"));
-  EXPECT_TRUE(fs::is_symlink(bundle / "dangling.wav"));
-  EXPECT_TRUE(fs::exists(bundle / "a.m4a"));
+  EXPECT_EQ(orphans(*composition), std::vector<std::string>{"dangling.wav"});
   EXPECT_TRUE(fs::exists(bundle / "notes.txt"));
 
   // A fragment the manifest stops using becomes an orphan.
   RCCompositionManifest fewer = composition->manifest();
   fewer.fragments.erase(fewer.fragments.begin());
-  RCComposition changed(composition->bundleURL(), fewer);
-  ASSERT_TRUE(changed.saveMetadataToDefaultLocation());
-  orphans.clear();
-  RCComposition::compositionLoadedFromCompositionBundleURL(composition->bundleURL())
-      ->enumerateOrphanedFragmentsWithBlock([&](const RCCompositionFragment& fragment, bool&) {
-        orphans.push_back(fragment.AVOutputURL().lastPathComponent());
-      });
-  EXPECT_EQ(orphans, (std::vector<std::string>{"a.m4a", "dangling.wav"}));
+  ASSERT_TRUE(RCComposition(composition->bundleURL(), fewer).saveMetadataToDefaultLocation());
+  EXPECT_EQ(
+      orphans(*RCComposition::compositionLoadedFromCompositionBundleURL(composition->bundleURL())),
+      (std::vector<std::string>{"a.m4a", "dangling.wav"}));
 }
 
 }  // namespace

@@ -15,34 +15,13 @@
 #include "Quorvel/errors/RCErrors.h"
 #include "platform/SerialQueue.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
+#include "tests/support/ScopedEnvironment.h"
 
 namespace quorvel {
 namespace {
 
+namespace fs = std::filesystem;
 using testing::RecordingsDirectoryTest;
-
-class ScopedEnvironment {
- public:
-  ScopedEnvironment(const char* name, const char* value) : name_(name) {
-    if (const char* old = std::getenv(name)) old_ = old;
-    if (value) {
-      ::setenv(name, value, 1);
-    } else {
-      ::unsetenv(name);
-    }
-  }
-  ~ScopedEnvironment() {
-    if (old_) {
-      ::setenv(name_, old_->c_str(), 1);
-    } else {
-      ::unsetenv(name_);
-    }
-  }
-
- private:
-  const char* name_;
-  std::optional<std::string> old_;
-};
 
 std::shared_ptr<RCSavedRecordingsModel> openModel(const std::string& directory) {
   auto model = RCSavedRecordingsModel::modelWithDirectory(directory);
@@ -64,27 +43,23 @@ using RecordingsModelTest = RecordingsDirectoryTest;
 
 TEST_F(RecordingsModelTest, DirectoryComesFromSettingThenEnvironmentThenXDGThenHomeAndIsCreated) {
   RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
-  {
-    ScopedEnvironment dir("QUORVEL_RECORDINGS_DIR", (root_ / "env/./a/../Recs").c_str());
-    EXPECT_EQ(RCSavedRecordingsModel::savedRecordingsDirectory(), (root_ / "env/Recs").string());
-    EXPECT_TRUE(std::filesystem::is_directory(root_ / "env/Recs"));
-  }
-  {
-    ScopedEnvironment dir("QUORVEL_RECORDINGS_DIR", nullptr);
-    ScopedEnvironment xdg("XDG_DATA_HOME", (root_ / "xdg").c_str());
-    EXPECT_EQ(RCSavedRecordingsModel::savedRecordingsDirectory(),
-              (root_ / "xdg/quorvel/Recordings").string());
-    EXPECT_TRUE(std::filesystem::is_directory(root_ / "xdg/quorvel/Recordings"));
-  }
-  {
-    ScopedEnvironment dir("QUORVEL_RECORDINGS_DIR", nullptr);
-    ScopedEnvironment xdg("XDG_DATA_HOME", "relative/is/ignored");
-    ScopedEnvironment home("HOME", (root_ / "home").c_str());
-    EXPECT_EQ(RCSavedRecordingsModel::savedRecordingsDirectory(),
-              (root_ / "home/.local/share/quorvel/Recordings").string());
+  const std::string env = (root_ / "env/./a/../Recs").string(), xdg = (root_ / "xdg").string(),
+                    home = (root_ / "home").string();
+  struct Case {
+    const char *dir, *xdg, *home;
+    fs::path expected;
+  };
+  for (const Case& c : {Case{env.c_str(), xdg.c_str(), home.c_str(), root_ / "env/Recs"},
+                        {nullptr, xdg.c_str(), home.c_str(), root_ / "xdg/quorvel/Recordings"},
+                        {nullptr, "relative/is/ignored", home.c_str(),
+                         root_ / "home/.local/share/quorvel/Recordings"}}) {
+    testing::ScopedEnvironment scoped{
+        {"QUORVEL_RECORDINGS_DIR", c.dir}, {"XDG_DATA_HOME", c.xdg}, {"HOME", c.home}};
+    EXPECT_EQ(RCSavedRecordingsModel::savedRecordingsDirectory(), c.expected.string());
+    EXPECT_TRUE(fs::is_directory(c.expected));
   }
   RCSavedRecordingsModel::setSavedRecordingsDirectory((root_ / "set").string());
-  ScopedEnvironment dir("QUORVEL_RECORDINGS_DIR", (root_ / "env").c_str());
+  testing::ScopedEnvironment dir{{"QUORVEL_RECORDINGS_DIR", env.c_str()}};
   EXPECT_EQ(RCSavedRecordingsModel::savedRecordingsDirectory(), (root_ / "set").string());
 }
 
@@ -188,7 +163,7 @@ TEST_F(RecordingsModelTest, UnusableDatabasesAreReportedAndLeftExactlyAsTheyWere
        RCErrorCodeDatabaseUnrecognized},
   };
   for (const Case& c : cases) {
-    std::filesystem::remove(path);
+    fs::remove(path);
     c.make();
     std::string before = testing::readFile(path);
     auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_);
@@ -197,7 +172,7 @@ TEST_F(RecordingsModelTest, UnusableDatabasesAreReportedAndLeftExactlyAsTheyWere
     EXPECT_EQ(model.error().code(), c.expected) << c.name << ": " << model.error();
     EXPECT_NE(model.error().localizedDescription().find("Recordings.db"), std::string::npos);
     EXPECT_TRUE(testing::readFile(path) == before) << c.name << ": the file was changed";
-    EXPECT_FALSE(std::filesystem::exists(path + "-wal")) << c.name;
+    EXPECT_FALSE(fs::exists(path + "-wal")) << c.name;
   }
   EXPECT_TRUE(logged("ERROR: cannot use the recordings database"));
 }
@@ -218,22 +193,19 @@ TEST_F(RecordingsModelTest, SharedModelIsOnePerQueueAndDirectory) {
 }
 
 TEST_F(RecordingsModelTest, AutoTraceLogsEveryStatementAtLevel7) {
-  ScopedEnvironment trace("SQLITE_AUTO_TRACE", "1");
-  auto model = openModel(recordings_);
-  model->insertRecordingWithAudioFile(recordingsPath("Traced.m4a"), 2, platform::Date::now());
-  bool sawInsert = false;
-  for (const auto& line : logLines()) {
-    if (line.starts_with("7 [RCSQLiteDatabase] SQL: INSERT INTO recordings") &&
-        line.find("'Traced'") != std::string::npos) {
-      sawInsert = true;
-    }
-  }
-  EXPECT_TRUE(sawInsert);
-  ScopedEnvironment off("SQLITE_AUTO_TRACE", nullptr);
+  testing::ScopedEnvironment trace{{"SQLITE_AUTO_TRACE", "1"}};
+  openModel(recordings_)
+      ->insertRecordingWithAudioFile(recordingsPath("Traced.m4a"), 2, platform::Date::now());
+  EXPECT_TRUE(std::ranges::any_of(log_.lines(), [](const testing::LogLine& line) {
+    return line.level == platform::kLogLevelDebug &&
+           line.text.starts_with("[RCSQLiteDatabase] SQL: INSERT INTO recordings") &&
+           line.text.contains("'Traced'");
+  }));
+  trace.unset("SQLITE_AUTO_TRACE");
   auto quiet = openModel(recordings_);
-  std::size_t before = logLines().size();
+  const std::size_t before = log_.lines().size();
   allRecordings(*quiet);
-  EXPECT_EQ(logLines().size(), before);
+  EXPECT_EQ(log_.lines().size(), before);
 }
 
 TEST_F(RecordingsModelTest, AWriterHoldingTheLockDelaysButDoesNotLoseAnInsert) {

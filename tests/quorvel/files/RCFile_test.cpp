@@ -26,14 +26,6 @@ namespace {
 namespace fs = std::filesystem;
 using RCFileTest = testing::TempDirectoryTest;
 
-int temporaryFilesIn(const fs::path& directory) {
-  int count = 0;
-  for (const auto& entry : fs::directory_iterator(directory)) {
-    if (RCIsAtomicReplaceTempName(entry.path().filename().string())) ++count;
-  }
-  return count;
-}
-
 TEST_F(RCFileTest, AFailedReplacementLeavesTheOldFileAndNoTemporaryFile) {
   const fs::path target = dir_ / "waveform.bin";
   testing::writeFile(target, "old");
@@ -54,25 +46,26 @@ TEST_F(RCFileTest, AFailedReplacementLeavesTheOldFileAndNoTemporaryFile) {
     EXPECT_EQ(written.error().code(), EFBIG);
   }
   EXPECT_EQ(testing::readFile(target), "old");
-  EXPECT_EQ(temporaryFilesIn(dir_), 0);
+  EXPECT_TRUE(hiddenFiles().empty());
 
   // The rename fails: the destination is a directory now.
   fs::create_directories(dir_ / "manifest.json" / "inside");
   EXPECT_FALSE(RCWriteFileAtomically(dir_.string(), "manifest.json", "new"));
   EXPECT_TRUE(fs::is_directory(dir_ / "manifest.json" / "inside"));
-  EXPECT_EQ(temporaryFilesIn(dir_), 0);
+  EXPECT_TRUE(hiddenFiles().empty());
 
   // An abandoned replacement removes its temporary file; a committed one
   // leaves only the destination.
   {
     auto file = RCReplacementFile::create(url);
     ASSERT_TRUE(file);
-    EXPECT_EQ(temporaryFilesIn(dir_), 1);
+    const auto hidden = hiddenFiles();
+    EXPECT_TRUE(hidden.size() == 1 && RCIsAtomicReplaceTempName(hidden[0]));
   }
-  EXPECT_EQ(temporaryFilesIn(dir_), 0);
+  EXPECT_TRUE(hiddenFiles().empty());
   ASSERT_TRUE(RCReplacementFile::replace(url, "new"));
   EXPECT_EQ(testing::readFile(target), "new");
-  EXPECT_EQ(temporaryFilesIn(dir_), 0);
+  EXPECT_TRUE(hiddenFiles().empty());
 }
 
 // Two writers of one file (a compose and a title write): the one that
@@ -98,7 +91,7 @@ TEST_F(RCFileTest, AGuardedReplacementNeverUndoesAnotherWriter) {
   ASSERT_TRUE(titled->write("new audio, new title"));
   ASSERT_TRUE(titled->commitReplacing(identity()));
   EXPECT_EQ(testing::readFile(target), "new audio, new title");
-  EXPECT_EQ(temporaryFilesIn(dir_), 0);
+  EXPECT_TRUE(hiddenFiles().empty());
 }
 
 TEST(RCFileNamesTest, TemporaryNamesAreRecognisedAndNothingElseIs) {

@@ -49,6 +49,14 @@ std::map<std::string, std::string> libavformatTags(const std::string& path) {
   return tags;
 }
 
+using Items = std::vector<RCMetadataItem>;
+
+// The title items the atom reader finds in `file` (none when it fails).
+Items titles(const std::string& file) {
+  auto items = RCMP4ReadTitleItems(file);
+  EXPECT_TRUE(items) << items.error();
+  return items.value_or(Items{});
+}
 std::size_t atomPosition(const std::string& bytes, const char* type) {
   auto atoms = RCMP4TopLevelAtoms(bytes.size(),
                                   [&](std::uint64_t offset, std::size_t size, std::uint8_t* out) {
@@ -63,32 +71,26 @@ std::size_t atomPosition(const std::string& bytes, const char* type) {
   return std::string::npos;
 }
 
-// Byte images of hand-built atoms.
-void be16(std::string& out, std::uint16_t v) { out += {char(v >> 8), char(v)}; }
-void be32(std::string& out, std::uint32_t v) {
-  for (int s = 24; s >= 0; s -= 8) out.push_back(char(v >> s));
+// Byte images of hand-built atoms: big-endian words, an atom, a QuickTime
+// text entry (length, language code, text), an iTunes-style value (type,
+// locale, bytes).
+std::string be(std::initializer_list<std::uint32_t> words, int bytes = 4) {
+  std::string out;
+  for (std::uint32_t v : words)
+    for (int s = 8 * (bytes - 1); s >= 0; s -= 8) out.push_back(char(v >> s));
+  return out;
 }
 std::string atom(const char* type, const std::string& payload) {
-  std::string out;
-  be32(out, std::uint32_t(payload.size() + 8));
-  return out + type + payload;
+  return be({std::uint32_t(payload.size() + 8)}) + type + payload;
 }
-// A QuickTime text entry: length, language code, text.
 std::string textEntry(std::uint16_t language, const std::string& text) {
-  std::string out;
-  be16(out, std::uint16_t(text.size()));
-  be16(out, language);
-  return out + text;
+  return be({std::uint32_t(text.size()), language}, 2) + text;
 }
 std::uint16_t packedISO(const char* code) {
   return std::uint16_t((code[0] - 0x60) << 10 | (code[1] - 0x60) << 5 | (code[2] - 0x60));
 }
-// An iTunes-style value: type, locale, bytes.
 std::string dataAtom(std::uint32_t type, const std::string& value) {
-  std::string payload;
-  be32(payload, type);
-  be32(payload, 0);
-  return atom("data", payload + value);
+  return atom("data", be({type, 0}) + value);
 }
 std::span<const std::uint8_t> bytesOf(const std::string& bytes) {
   return {reinterpret_cast<const std::uint8_t*>(bytes.data()), bytes.size()};
@@ -106,15 +108,15 @@ TEST_F(RCMP4AtomsTest, LanguagesSideBySideInBothLayoutsKeepTheAudio) {
     auto before = decodeToPCM(file);
     ASSERT_TRUE(before);
 
+    // A single tagged title is one item, though libavformat shows it untagged too.
     ASSERT_TRUE(RCMP4WriteTitle(file, "Spaziergang", "deu"));
+    EXPECT_EQ(libavformatTags(file)["title"], "Spaziergang");
+    EXPECT_EQ(titles(file), (Items{{"Spaziergang", "deu"}}));
     ASSERT_TRUE(RCMP4WriteTitle(file, "A walk", "eng"));
     ASSERT_TRUE(RCMP4WriteTitle(file, "Promenade", "fr"));  // BCP-47 becomes "fra"
     ASSERT_TRUE(RCMP4WriteTitle(file, "Gang", "ger"));      // the same language as "deu"
 
-    auto items = RCMP4ReadTitleItems(file);
-    ASSERT_TRUE(items) << items.error();
-    EXPECT_EQ(*items, (std::vector<RCMetadataItem>{
-                          {"Gang", "deu"}, {"A walk", "eng"}, {"Promenade", "fra"}}));
+    EXPECT_EQ(titles(file), (Items{{"Gang", "deu"}, {"A walk", "eng"}, {"Promenade", "fra"}}));
 
     auto tags = libavformatTags(file);
     EXPECT_EQ(tags["title-deu"], "Gang");
@@ -136,17 +138,6 @@ TEST_F(RCMP4AtomsTest, LanguagesSideBySideInBothLayoutsKeepTheAudio) {
   }
 }
 
-TEST_F(RCMP4AtomsTest, ASingleTaggedTitleIsOneItemThoughLibavformatShowsTwo) {
-  const std::string file = path("one.m4a");
-  ASSERT_TRUE(writeTone(file, 0.5, "m4a"));
-  ASSERT_TRUE(RCMP4WriteTitle(file, "Nur Deutsch", "deu"));
-  auto tags = libavformatTags(file);
-  EXPECT_EQ(tags["title"], "Nur Deutsch");  // the blur the atom reader exists for
-  auto items = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(items);
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Nur Deutsch", "deu"}}));
-}
-
 TEST_F(RCMP4AtomsTest, UntaggedTitlesFromTheMuxerAndOursAreOneTitle) {
   // The muxer writes an untagged title as an iTunes-style item.
   const std::string file = path("muxed.m4a");
@@ -154,22 +145,20 @@ TEST_F(RCMP4AtomsTest, UntaggedTitlesFromTheMuxerAndOursAreOneTitle) {
   tone.seconds = 0.5;
   tone.metadata = {{"title", "From the muxer"}};
   ASSERT_TRUE(writeTone(file, tone));
-  auto items = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(items);
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"From the muxer", ""}}));
+  const auto mode = fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read;
+  fs::permissions(file, mode);
+  EXPECT_EQ(titles(file), (Items{{"From the muxer", ""}}));
 
   ASSERT_TRUE(RCMP4WriteTitle(file, "Tagged", "deu"));
-  items = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(items);
-  EXPECT_EQ(items->size(), 2u);
+  EXPECT_EQ(titles(file), (Items{{"From the muxer", ""}, {"Tagged", "deu"}}));
 
   // Writing the untagged title replaces the muxer's rather than adding one.
   ASSERT_TRUE(RCMP4WriteTitle(file, "", ""));
   ASSERT_TRUE(RCMP4WriteTitle(file, "Ours", ""));
-  items = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(items);
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Tagged", "deu"}, {"Ours", ""}}));
+  EXPECT_EQ(titles(file), (Items{{"Tagged", "deu"}, {"Ours", ""}}));
   EXPECT_EQ(libavformatTags(file)["title-deu"], "Tagged");
+  // Permissions survive the replacements.
+  EXPECT_EQ(fs::status(file).permissions() & fs::perms::all, mode);
 }
 
 TEST_F(RCMP4AtomsTest, TitlesWrittenByTheFFmpegCommandLineAreRead) {
@@ -180,27 +169,19 @@ TEST_F(RCMP4AtomsTest, TitlesWrittenByTheFFmpegCommandLineAreRead) {
       "-metadata title=Plain '" +
       file + "'";
   ASSERT_EQ(std::system(command.c_str()), 0);
-  auto items = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(items);
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Plain", ""}}));
+  EXPECT_EQ(titles(file), (Items{{"Plain", ""}}));
   ASSERT_TRUE(RCMP4WriteTitle(file, "Hallo", "deu"));
-  items = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(items);
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Plain", ""}, {"Hallo", "deu"}}));
+  EXPECT_EQ(titles(file), (Items{{"Plain", ""}, {"Hallo", "deu"}}));
 }
 
 TEST_F(RCMP4AtomsTest, RefusedFilesAreLeftAsTheyWere) {
-  const std::string text = path("text.m4a");
-  std::ofstream(text) << "just some text, not a movie\n";
-  const std::string truncated = path("truncated.m4a");
-  ASSERT_TRUE(writeTone(truncated, 1.0, "m4a"));  // movie header at the end
-  fs::resize_file(truncated, fs::file_size(truncated) - 100);
-  const std::string flac = path("tone.flac");
-  ASSERT_TRUE(writeTone(flac, 0.2, "flac"));
-  const std::string empty = path("empty.m4a");
-  std::ofstream(empty).flush();
-
-  for (const std::string& file : {text, truncated, flac, empty}) {
+  testing::writeFile(path("text.m4a"), "just some text, not a movie\n");
+  testing::writeFile(path("empty.m4a"), "");
+  ASSERT_TRUE(writeTone(path("cut.m4a"), 1.0, "m4a"));  // movie header at the end
+  fs::resize_file(path("cut.m4a"), fs::file_size(path("cut.m4a")) - 100);
+  ASSERT_TRUE(writeTone(path("tone.flac"), 0.2, "flac"));
+  for (const std::string& file :
+       {path("text.m4a"), path("cut.m4a"), path("tone.flac"), path("empty.m4a")}) {
     SCOPED_TRACE(file);
     const std::string before = readFile(file);
     auto status = RCMP4WriteTitle(file, "x", "deu");
@@ -218,15 +199,6 @@ TEST_F(RCMP4AtomsTest, RefusedFilesAreLeftAsTheyWere) {
   EXPECT_FALSE(RCMP4WriteTitle(good, std::string(70000, 'x'), "deu"));
 }
 
-TEST_F(RCMP4AtomsTest, PermissionsSurviveTheReplacement) {
-  const std::string file = path("mode.m4a");
-  ASSERT_TRUE(writeTone(file, 0.2, "m4a"));
-  fs::permissions(file, fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read);
-  ASSERT_TRUE(RCMP4WriteTitle(file, "x", "eng"));
-  EXPECT_EQ(fs::status(file).permissions() & fs::perms::all,
-            fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read);
-}
-
 TEST_F(RCMP4AtomsTest, ProbeAsksLibavformatWhenTheMovieHoldsNoTitle) {
   // A title in a top-level meta atom after the audio: libavformat reads it,
   // the movie atom holds none.
@@ -235,12 +207,10 @@ TEST_F(RCMP4AtomsTest, ProbeAsksLibavformatWhenTheMovieHoldsNoTitle) {
   const std::string hdlr = atom("hdlr", std::string(8, '\0') + "mdirappl" + std::string(9, '\0'));
   std::ofstream(file, std::ios::app | std::ios::binary)
       << atom("meta", "\0\0\0\0"s + hdlr + atom("ilst", atom("\xA9nam", dataAtom(1, "Oben"))));
-  auto atoms = RCMP4ReadTitleItems(file);
-  ASSERT_TRUE(atoms) << atoms.error();
-  EXPECT_TRUE(atoms->empty());
+  EXPECT_TRUE(titles(file).empty());
   auto probe = RCInProcessMediaEngine().probe(platform::URL::fileURLWithPath(file));
   ASSERT_TRUE(probe) << probe.error();
-  EXPECT_EQ(probe->titleItems, (std::vector<RCMetadataItem>{{"Oben", ""}}));
+  EXPECT_EQ(probe->titleItems, (Items{{"Oben", ""}}));
 }
 
 TEST(RCMP4AtomsImageTest, TextIsDecodedAsTheContainerSaysAndKeptUnlessReplaced) {
@@ -255,11 +225,11 @@ TEST(RCMP4AtomsImageTest, TextIsDecodedAsTheContainerSaysAndKeptUnlessReplaced) 
       atom("moov", atom("udta", mac + utf16 + oddLE + badUTF8 + atom("meta", "\0\0\0\0"s + ilst)));
   auto items = RCMP4TitleItemsInMovie(bytesOf(moov));
   ASSERT_TRUE(items) << items.error();
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"Café", "deu"},
-                                                 {"Hi", "eng"},
-                                                 {"A\uFFFD", "fra"},
-                                                 {"x\uFFFDy", "ita"},
-                                                 {"Ü\uFFFD", ""}}));
+  EXPECT_EQ(*items, (Items{{"Café", "deu"},
+                           {"Hi", "eng"},
+                           {"A\uFFFD", "fra"},
+                           {"x\uFFFDy", "ita"},
+                           {"Ü\uFFFD", ""}}));
 
   // Replacing the Mac entry stores UTF-8 under an ISO code; the others stay
   // as they were, byte for byte.
@@ -288,39 +258,27 @@ TEST(RCMP4AtomsImageTest, AnEntryWhoseTextBeginsWithDataStaysText) {
   EXPECT_EQ(*twice, *once);
   auto items = RCMP4TitleItemsInMovie(*twice);
   ASSERT_TRUE(items);
-  EXPECT_EQ(*items,
-            (std::vector<RCMetadataItem>{{"Hi", "eng"}, {"data and more", "fra"}, {"T", ""}}));
+  EXPECT_EQ(*items, (Items{{"Hi", "eng"}, {"data and more", "fra"}, {"T", ""}}));
 }
 
 TEST(RCMP4AtomsImageTest, ChunkOffsetsMoveOnlyBehindTheMovie) {
   // A hand-built file: ftyp, moov with one stco holding offsets before and
   // after the movie, then mdat.
-  std::string stco;
-  be32(stco, 0);
-  be32(stco, 3);
-  be32(stco, 4);      // inside ftyp: before the movie, stays
-  be32(stco, 500);    // in mdat
-  be32(stco, 70000);  // far beyond
+  // Offsets inside ftyp (before the movie, it stays), in mdat and far beyond.
+  auto stco = [](std::uint32_t shift) {
+    return atom("stco", be({0, 3, 4, 500 + shift, 70000 + shift}));
+  };
   const std::string moov =
-      atom("moov", atom("trak", atom("mdia", atom("minf", atom("stbl", atom("stco", stco))))));
+      atom("moov", atom("trak", atom("mdia", atom("minf", atom("stbl", stco(0))))));
   const std::string file = atom("ftyp", "M4A ") + moov + atom("mdat", std::string(600, '\0'));
   auto image = RCMP4FileImageWithTitle(bytesOf(file), "T", "eng");
   ASSERT_TRUE(image) << image.error();
   const std::int64_t delta = std::int64_t(image->size()) - std::int64_t(file.size());
   EXPECT_EQ(delta, 8 + 8 + 4 + 1);  // udta + ©nam headers, length and language, "T"
-  std::string out(image->begin(), image->end());
-  const std::size_t at = out.find("stco") + 4 + 8;
-  auto read32 = [&](std::size_t p) {
-    return std::uint32_t(std::uint8_t(out[p])) << 24 |
-           std::uint32_t(std::uint8_t(out[p + 1])) << 16 |
-           std::uint32_t(std::uint8_t(out[p + 2])) << 8 | std::uint8_t(out[p + 3]);
-  };
-  EXPECT_EQ(read32(at), 4u);
-  EXPECT_EQ(read32(at + 4), 500u + delta);
-  EXPECT_EQ(read32(at + 8), 70000u + delta);
+  EXPECT_NE(std::string(image->begin(), image->end()).find(stco(delta)), std::string::npos);
   auto items = RCMP4TitleItemsInFileImage(*image);
   ASSERT_TRUE(items);
-  EXPECT_EQ(*items, (std::vector<RCMetadataItem>{{"T", "eng"}}));
+  EXPECT_EQ(*items, (Items{{"T", "eng"}}));
 }
 
 }  // namespace

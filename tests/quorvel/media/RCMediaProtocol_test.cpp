@@ -42,91 +42,82 @@ TEST(MediaProtocolTest, FramesSplitAnywhereComeOutWholeAndOversizedOnesAreRefuse
   EXPECT_EQ(refused.error(), RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
 }
 
+RCMediaRequest throughTheWire(const RCMediaRequest& request) {
+  auto decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(request));
+  EXPECT_TRUE(decoded) << decoded.error();
+  return decoded.value_or(RCMediaRequest{});
+}
+RCMediaReply decodedReply(const std::string& body) {
+  auto decoded = RCMediaDecodeReply(body);
+  EXPECT_TRUE(decoded) << decoded.error();
+  return decoded.value_or(RCMediaReply{});
+}
+
 TEST(MediaProtocolTest, RequestsAndRepliesSurviveTheTrip) {
   // Any byte of a Linux file name, and titles in any script.
-  platform::URL odd = platform::URL::fileURLWithPath("/rec/\xff\x01 Walk %20#?.m4a");
-  RCMediaRequest compose;
-  compose.id = 42;
-  compose.kind = RCMediaJobKind::Compose;
-  compose.url = odd;
-  compose.segments = {{odd, 0.25, 1.5}, {platform::URL::fileURLWithPath("/b.flac"), 0, 0.5}};
+  const platform::URL odd = platform::URL::fileURLWithPath("/rec/\xff\x01 Walk %20#?.m4a"),
+                      flac = platform::URL::fileURLWithPath("/b.flac");
+  RCMediaRequest compose{.id = 42, .kind = RCMediaJobKind::Compose, .url = odd};
+  compose.segments = {{odd, 0.25, 1.5}, {flac, 0, 0.5}};
   compose.destination = platform::URL::fileURLWithPath("/rec/Walk.waveform");
-  auto decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(compose));
-  ASSERT_TRUE(decoded) << decoded.error();
-  EXPECT_EQ(decoded->id, 42u);
-  EXPECT_EQ(decoded->kind, RCMediaJobKind::Compose);
-  EXPECT_EQ(decoded->url, odd);
-  ASSERT_EQ(decoded->segments.size(), 2u);
-  EXPECT_EQ(decoded->segments[0].fragmentURL, odd);
-  EXPECT_EQ(decoded->segments[0].contentStart, 0.25);
-  EXPECT_EQ(decoded->segments[1].contentDuration, 0.5);
-  EXPECT_EQ(decoded->destination, compose.destination);
+  RCMediaRequest decoded = throughTheWire(compose);
+  EXPECT_EQ(decoded.id, 42u);
+  EXPECT_EQ(decoded.kind, RCMediaJobKind::Compose);
+  EXPECT_EQ(decoded.url, odd);
+  ASSERT_EQ(decoded.segments.size(), 2u);
+  EXPECT_EQ(decoded.segments[0].fragmentURL, odd);
+  EXPECT_EQ(decoded.segments[0].contentStart, 0.25);
+  EXPECT_EQ(decoded.segments[1].contentDuration, 0.5);
+  EXPECT_EQ(decoded.destination, compose.destination);
 
-  RCMediaRequest title;
-  title.kind = RCMediaJobKind::WriteTitle;
-  title.url = odd;
-  title.title = "Spaziergang \xc3\xbc";
-  title.language = "deu";
-  decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(title));
-  ASSERT_TRUE(decoded);
-  EXPECT_EQ(decoded->title, title.title);
-  EXPECT_EQ(decoded->language, "deu");
+  decoded = throughTheWire({.kind = RCMediaJobKind::WriteTitle,
+                            .url = odd,
+                            .title = "Spaziergang \xc3\xbc",
+                            .language = "deu"});
+  EXPECT_EQ(decoded.title, "Spaziergang \xc3\xbc");
+  EXPECT_EQ(decoded.language, "deu");
+  decoded = throughTheWire({.kind = RCMediaJobKind::ProbeMany, .urls = {odd, flac}});
+  EXPECT_EQ(decoded.kind, RCMediaJobKind::ProbeMany);
+  EXPECT_EQ(decoded.urls, (std::vector{odd, flac}));
 
-  RCMediaProbe probe;
-  probe.playable = true;
-  probe.duration = std::nan("");
-  probe.containerName = "wav";
+  RCMediaProbe probe{.playable = true, .duration = std::nan(""), .containerName = "wav"};
   probe.titleItems = {{"Walk", ""}, {"Spaziergang", "ger"}};
   probe.creationDate = platform::Date::dateWithTimeIntervalSince1970(1577934245.5);
-  auto reply = RCMediaDecodeReply(RCMediaEncodeResult(7, &probe));
-  ASSERT_TRUE(reply) << reply.error();
-  EXPECT_EQ(reply->kind, RCMediaReply::Kind::Result);
-  ASSERT_TRUE(reply->probe);
-  EXPECT_TRUE(std::isnan(reply->probe->duration));
-  EXPECT_EQ(reply->probe->titleItems, probe.titleItems);
-  EXPECT_DOUBLE_EQ(reply->probe->creationDate->timeIntervalSince1970(), 1577934245.5);
+  RCMediaReply reply = decodedReply(RCMediaEncodeResult(7, &probe));
+  EXPECT_EQ(reply.kind, RCMediaReply::Kind::Result);
+  ASSERT_TRUE(reply.probe);
+  EXPECT_TRUE(std::isnan(reply.probe->duration));
+  EXPECT_EQ(reply.probe->titleItems, probe.titleItems);
+  EXPECT_DOUBLE_EQ(reply.probe->creationDate->timeIntervalSince1970(), 1577934245.5);
 
-  RCMediaRequest batch;
-  batch.kind = RCMediaJobKind::ProbeMany;
-  batch.urls = {odd, platform::URL::fileURLWithPath("/b.flac")};
-  decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(batch));
-  ASSERT_TRUE(decoded) << decoded.error();
-  EXPECT_EQ(decoded->kind, RCMediaJobKind::ProbeMany);
-  EXPECT_EQ(decoded->urls, batch.urls);
-
-  reply = RCMediaDecodeReply(RCMediaEncodeItem(7, 63, probe));
-  ASSERT_TRUE(reply) << reply.error();
-  EXPECT_EQ(reply->kind, RCMediaReply::Kind::Item);
-  EXPECT_EQ(reply->index, 63u);
-  ASSERT_TRUE(reply->probe);
-  EXPECT_EQ(reply->probe->titleItems, probe.titleItems);
-  reply = RCMediaDecodeReply(
+  reply = decodedReply(RCMediaEncodeItem(7, 63, probe));
+  EXPECT_EQ(reply.kind, RCMediaReply::Kind::Item);
+  EXPECT_EQ(reply.index, 63u);
+  ASSERT_TRUE(reply.probe);
+  EXPECT_EQ(reply.probe->titleItems, probe.titleItems);
+  reply = decodedReply(
       RCMediaEncodeItem(7, 1, platform::fail(platform::posixError(ENOENT, "stat /a"))));
-  ASSERT_TRUE(reply) << reply.error();
-  EXPECT_EQ(reply->index, 1u);
-  EXPECT_FALSE(reply->probe);
-  EXPECT_EQ(*reply->error, platform::posixError(ENOENT, ""));
+  EXPECT_EQ(reply.index, 1u);
+  EXPECT_FALSE(reply.probe);
+  EXPECT_EQ(reply.error, platform::posixError(ENOENT, ""));
 
-  reply = RCMediaDecodeReply(RCMediaEncodeError(
+  reply = decodedReply(RCMediaEncodeError(
       8, platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorNoMovie, std::string(10000, 'm'))));
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->kind, RCMediaReply::Kind::Error);
-  EXPECT_EQ(*reply->error, platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorNoMovie));
-  EXPECT_EQ(reply->error->localizedDescription().size(), 4096u);  // long messages are cut
+  EXPECT_EQ(reply.kind, RCMediaReply::Kind::Error);
+  EXPECT_EQ(reply.error, platform::Error(kRCMP4ErrorDomain, kRCMP4ErrorNoMovie));
+  EXPECT_EQ(reply.error->localizedDescription().size(), 4096u);  // long messages are cut
 
   // A compose that blames a segment: the index and what was found both arrive.
-  reply = RCMediaDecodeReply(RCMediaEncodeError(
+  reply = decodedReply(RCMediaEncodeError(
       10, RCComposerSegmentError(3, RCMediaError(RCMediaErrorCodeTruncated, "b.m4a ends early"))));
-  ASSERT_TRUE(reply) << reply.error();
-  EXPECT_EQ(RCComposerFailedSegment(*reply->error), 3u);
-  ASSERT_NE(reply->error->underlyingError(), nullptr);
-  EXPECT_EQ(*reply->error->underlyingError(), RCMediaError(RCMediaErrorCodeTruncated, ""));
-  EXPECT_EQ(reply->error->underlyingError()->localizedDescription(), "b.m4a ends early");
+  EXPECT_EQ(RCComposerFailedSegment(*reply.error), 3u);
+  ASSERT_NE(reply.error->underlyingError(), nullptr);
+  EXPECT_EQ(*reply.error->underlyingError(), RCMediaError(RCMediaErrorCodeTruncated, ""));
+  EXPECT_EQ(reply.error->underlyingError()->localizedDescription(), "b.m4a ends early");
 
-  reply = RCMediaDecodeReply(RCMediaEncodeProgress(9, 0.5));
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->kind, RCMediaReply::Kind::Progress);
-  EXPECT_EQ(reply->progress, 0.5);
+  reply = decodedReply(RCMediaEncodeProgress(9, 0.5));
+  EXPECT_EQ(reply.kind, RCMediaReply::Kind::Progress);
+  EXPECT_EQ(reply.progress, 0.5);
 }
 
 TEST(MediaProtocolTest, MalformedMessagesAreErrorValues) {

@@ -2,13 +2,9 @@
 // data source over real audio: its flushes are observed as replacements of the
 // waveform file (inotify), its failures over damaged input.
 #include <gtest/gtest.h>
-#include <sys/inotify.h>
-#include <unistd.h>
 
 #include <atomic>
-#include <cmath>
 #include <filesystem>
-#include <fstream>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -18,6 +14,7 @@
 #include "Quorvel/waveform/RCWaveform.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/DirectoryWatch.h"
 #include "tests/support/TempDirectory.h"
 
 namespace quorvel {
@@ -26,109 +23,90 @@ namespace {
 using testing::writeTone;
 namespace fs = std::filesystem;
 
-std::vector<std::uint8_t> le32(std::initializer_list<std::int64_t> words) {
+// Little-endian 32-bit words, then 16-bit values.
+std::vector<std::uint8_t> le(std::initializer_list<std::int64_t> words,
+                             std::initializer_list<int> values = {}) {
   std::vector<std::uint8_t> out;
   for (std::int64_t w : words)
-    for (int s = 0; s < 32; s += 8) out.push_back(std::uint8_t((std::uint64_t(w) >> s) & 0xff));
+    for (int s = 0; s < 32; s += 8) out.push_back(std::uint8_t(std::uint64_t(w) >> s));
+  for (int v : values) out.insert(out.end(), {std::uint8_t(v), std::uint8_t(v >> 8)});
   return out;
-}
-void append16(std::vector<std::uint8_t>& out, std::initializer_list<int> values) {
-  for (int v : values) {
-    out.push_back(std::uint8_t(v & 0xff));
-    out.push_back(std::uint8_t((v >> 8) & 0xff));
-  }
 }
 
 TEST(RCWaveformFileTest, ReadsHandMadeFilesOfEveryVariant) {
-  // Version 2, 16-bit, two channels, two pixels: values cover sign and byte order.
-  auto v2 = le32({2, 0, 44100, 256, 2, 2});
-  append16(v2, {-32768, 32767, -2, 258, -1, 0, 0, 1});
-  auto parsed = RCDecodeWaveformFile(v2);
-  ASSERT_TRUE(parsed) << parsed.error();
-  EXPECT_EQ(parsed->sampleRate(), 44100);
-  EXPECT_EQ(parsed->samplesPerPixel(), 256);
-  EXPECT_EQ(parsed->channels(), 2);
-  EXPECT_EQ(parsed->bits(), 16);
-  ASSERT_EQ(parsed->length(), 2u);
-  EXPECT_EQ(parsed->min(0, 0), -32768);
-  EXPECT_EQ(parsed->max(0, 0), 32767);
-  EXPECT_EQ(parsed->min(0, 1), -2);
-  EXPECT_EQ(parsed->max(0, 1), 258);
-  EXPECT_EQ(parsed->max(1, 1), 1);
-  EXPECT_EQ(RCEncodeWaveformFile(*parsed), std::string(v2.begin(), v2.end()));
-
-  // Version 2, 8-bit (flag bit 0).
-  auto v8 = le32({2, 1, 8000, 64, 1, 1});
-  v8.push_back(0x80);  // -128
-  v8.push_back(0x7f);  // 127
-  parsed = RCDecodeWaveformFile(v8);
-  ASSERT_TRUE(parsed) << parsed.error();
-  EXPECT_EQ(parsed->bits(), 8);
-  EXPECT_EQ(parsed->min(0, 0), -128);
-  EXPECT_EQ(parsed->max(0, 0), 127);
-  EXPECT_EQ(RCEncodeWaveformFile(*parsed), std::string(v8.begin(), v8.end()));
-
-  // Version 1: no channel count, one channel.
-  auto v1 = le32({1, 0, 48000, 512, 1});
-  append16(v1, {-5, 5});
-  parsed = RCDecodeWaveformFile(v1);
-  ASSERT_TRUE(parsed) << parsed.error();
-  EXPECT_EQ(parsed->channels(), 1);
-  EXPECT_EQ(parsed->max(0, 0), 5);
-
-  // An empty waveform is valid.
-  EXPECT_TRUE(RCDecodeWaveformFile(le32({2, 0, 44100, 256, 0, 1})));
-}
-
-TEST(RCWaveformFileTest, RejectsDamagedHeadersAndSizesWithoutAllocating) {
-  auto valid = le32({2, 0, 44100, 256, 1, 1});
-  append16(valid, {-3, 3});
   struct Case {
     const char* what;
     std::vector<std::uint8_t> bytes;
+    int sampleRate, channels, bits;
+    std::vector<std::int16_t> data;
+    bool reencodes;  // to the same bytes: version 1 is written as version 2
   };
+  auto eightBit = le({2, 1, 8000, 64, 1, 1});  // flag bit 0
+  eightBit.insert(eightBit.end(), {0x80, 0x7f});
+  for (const Case& c : std::vector<Case>{
+           // Values cover sign and byte order.
+           {"v2",
+            le({2, 0, 44100, 256, 2, 2}, {-32768, 32767, -2, 258, -1, 0, 0, 1}),
+            44100,
+            2,
+            16,
+            {-32768, 32767, -2, 258, -1, 0, 0, 1},
+            true},
+           {"8-bit", eightBit, 8000, 1, 8, {-128, 127}, true},
+           {"v1, no channel count",
+            le({1, 0, 48000, 512, 1}, {-5, 5}),
+            48000,
+            1,
+            16,
+            {-5, 5},
+            false},
+           {"empty", le({2, 0, 44100, 256, 0, 1}), 44100, 1, 16, {}, true},
+       }) {
+    SCOPED_TRACE(c.what);
+    auto parsed = RCDecodeWaveformFile(c.bytes);
+    ASSERT_TRUE(parsed) << parsed.error();
+    EXPECT_EQ(parsed->sampleRate(), c.sampleRate);
+    EXPECT_EQ(parsed->channels(), c.channels);
+    EXPECT_EQ(parsed->bits(), c.bits);
+    EXPECT_TRUE(std::ranges::equal(parsed->data(), c.data));
+    if (c.reencodes) {
+      EXPECT_EQ(RCEncodeWaveformFile(*parsed), std::string(c.bytes.begin(), c.bytes.end()));
+    }
+  }
+}
+
+TEST(RCWaveformFileTest, RejectsDamagedHeadersAndSizesWithoutAllocating) {
+  const auto valid = le({2, 0, 44100, 256, 1, 1}, {-3, 3});
   auto with = [&](std::size_t offset, std::int64_t word) {
-    auto bytes = valid;
-    auto w = le32({word});
+    auto bytes = valid, w = le({word});
     std::copy(w.begin(), w.end(), bytes.begin() + offset);
     return bytes;
   };
-  std::vector<Case> cases = {
-      {"empty", {}},
-      {"half a header", std::vector<std::uint8_t>(valid.begin(), valid.begin() + 10)},
-      {"v2 header cut before channels",
-       std::vector<std::uint8_t>(valid.begin(), valid.begin() + 22)},
-      {"data one byte short", std::vector<std::uint8_t>(valid.begin(), valid.end() - 1)},
-      {"one byte too many",
-       [&] {
-         auto b = valid;
-         b.push_back(0);
-         return b;
-       }()},
-      {"version 0", with(0, 0)},
-      {"version 3", with(0, 3)},
-      {"negative version", with(0, -2)},
-      {"unknown flag", with(4, 2)},
-      {"zero sample rate", with(8, 0)},
-      {"negative sample rate", with(8, -44100)},
-      {"zero samples per pixel", with(12, 0)},
-      {"length far beyond the data", with(16, 0xffffffff)},
-      {"zero channels", with(20, 0)},
-      {"25 channels", with(20, 25)},
-      {"negative channels", with(20, -1)},
-      {"minimum above maximum",
-       [&] {
-         auto b = le32({2, 0, 44100, 256, 1, 1});
-         append16(b, {3, -3});
-         return b;
-       }()},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.what);
-    auto parsed = RCDecodeWaveformFile(c.bytes);
+  auto longer = valid;
+  longer.push_back(0);
+  for (const auto& [what, bytes] : std::vector<std::pair<const char*, std::vector<std::uint8_t>>>{
+           {"empty", {}},
+           {"half a header", {valid.begin(), valid.begin() + 10}},
+           {"v2 header cut before channels", {valid.begin(), valid.begin() + 22}},
+           {"data one byte short", {valid.begin(), valid.end() - 1}},
+           {"one byte too many", longer},
+           {"version 0", with(0, 0)},
+           {"version 3", with(0, 3)},
+           {"negative version", with(0, -2)},
+           {"unknown flag", with(4, 2)},
+           {"zero sample rate", with(8, 0)},
+           {"negative sample rate", with(8, -44100)},
+           {"zero samples per pixel", with(12, 0)},
+           {"length far beyond the data", with(16, 0xffffffff)},
+           {"zero channels", with(20, 0)},
+           {"25 channels", with(20, 25)},
+           {"negative channels", with(20, -1)},
+           {"minimum above maximum", le({2, 0, 44100, 256, 1, 1}, {3, -3})},
+       }) {
+    SCOPED_TRACE(what);
+    auto parsed = RCDecodeWaveformFile(bytes);
     ASSERT_FALSE(parsed);
-    EXPECT_EQ(parsed.error().domain(), kRCMediaErrorDomain);
-    EXPECT_EQ(parsed.error().code(), long(RCMediaErrorCodeCorruptWaveform));
+    EXPECT_EQ(parsed.error(), RCMediaError(RCMediaErrorCodeCorruptWaveform, ""));
   }
 }
 
@@ -138,10 +116,8 @@ TEST_F(RCWaveformFilesTest, RoundTripsThroughFilesAndNamesThemAfterTheAudio) {
   RCWaveform waveform(48000, 128, 3, 16);
   for (int p = 0; p < 1000; ++p) {
     std::vector<std::int16_t> pixel;
-    for (int c = 0; c < 3; ++c) {
-      pixel.push_back(std::int16_t(-p * (c + 1)));
-      pixel.push_back(std::int16_t(p * (c + 1)));
-    }
+    for (int c = 1; c <= 3; ++c)
+      pixel.insert(pixel.end(), {std::int16_t(-p * c), std::int16_t(p * c)});
     waveform.appendPixel(pixel);
   }
   ASSERT_TRUE(RCWriteWaveformFile(waveform, url("w.waveform")));
@@ -149,89 +125,51 @@ TEST_F(RCWaveformFilesTest, RoundTripsThroughFilesAndNamesThemAfterTheAudio) {
   ASSERT_TRUE(read) << read.error();
   EXPECT_EQ(*read, waveform);
   EXPECT_NEAR(read->durationSeconds(), 1000.0 * 128 / 48000, 1e-9);
-
   EXPECT_FALSE(RCReadWaveformFile(url("missing")));
   EXPECT_FALSE(RCReadWaveformFile(platform::URL::fileURLWithPath(dir_.string())));
   // Nothing but the file itself is left beside it.
   EXPECT_EQ(std::distance(fs::directory_iterator(dir_), fs::directory_iterator()), 1);
 
-  using platform::URL;
-  EXPECT_EQ(RCWaveform::waveformURLForAVURL(URL::fileURLWithPath("/r/My Talk.m4a")).path(),
-            "/r/My Talk.waveform");
-  EXPECT_EQ(RCWaveform::waveformURLForAVURL(URL::fileURLWithPath("/r/a.b.flac")).path(),
-            "/r/a.b.waveform");
-  EXPECT_EQ(RCWaveform::waveformURLForAVURL(URL::fileURLWithPath("/r/plain")).path(),
-            "/r/plain.waveform");
+  for (const auto& [audio, expected] : {std::pair{"/r/My Talk.m4a", "/r/My Talk.waveform"},
+                                        {"/r/a.b.flac", "/r/a.b.waveform"},
+                                        {"/r/plain", "/r/plain.waveform"}}) {
+    EXPECT_EQ(RCWaveform::waveformURLForAVURL(platform::URL::fileURLWithPath(audio)).path(),
+              expected);
+  }
 }
-
-// --- The data source ---------------------------------------------------------
 
 using WaveformDataSourceTest = testing::TempDirectoryTest;
 
-// Watches a directory for replacements of the file `name`: a hidden temporary
-// file is created and then renamed onto `name`. Writing `name` in place would
-// show up as a modification of it.
-class ReplacementWatch {
- public:
-  ReplacementWatch(const fs::path& dir, std::string name) : name_(std::move(name)) {
-    fd_ = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
-    inotify_add_watch(fd_, dir.c_str(), IN_MOVED_TO | IN_CREATE | IN_MODIFY);
-  }
-  ~ReplacementWatch() { ::close(fd_); }
-  // Reads what the kernel queued so far (a rename is queued before rename()
-  // returns, so nothing is missed once the work has finished).
-  void drain() {
-    alignas(inotify_event) char buffer[16384];
-    for (;;) {
-      const ssize_t n = ::read(fd_, buffer, sizeof buffer);
-      if (n <= 0) return;
-      for (char* p = buffer; p < buffer + n;) {
-        auto* event = reinterpret_cast<inotify_event*>(p);
-        const std::string file = event->len ? event->name : "";
-        if (event->mask & IN_CREATE) tempCreated_ = tempCreated_ || file.starts_with(".");
-        if ((event->mask & IN_MOVED_TO) && file == name_) {
-          if (tempCreated_) ++replacements_;
-          tempCreated_ = false;
-        }
-        if ((event->mask & IN_MODIFY) && file == name_) ++inPlaceWrites_;
-        p += sizeof(inotify_event) + event->len;
-      }
-    }
-  }
-  int replacements() { return drain(), replacements_; }
-  int inPlaceWrites() { return drain(), inPlaceWrites_; }
-
- private:
-  int fd_ = -1;
-  std::string name_;
-  bool tempCreated_ = false;
-  int replacements_ = 0;
-  int inPlaceWrites_ = 0;
-};
-
 // Intermediate saves go to the side file (here after every decoded frame);
-// the waveform file itself is written once, whole, and the side file is gone.
+// the waveform file itself is written once, whole (a hidden temporary file
+// renamed onto it, never written in place), and the side file is gone.
 TEST_F(WaveformDataSourceTest, FlushesToASideFileAndWritesTheWaveformOnceAtTheEnd) {
   ASSERT_TRUE(writeTone(path("tone.m4a"), 3.0, "m4a", 44100, 1, 441.0, 0.5));
-  ReplacementWatch watch(dir_, "tone.waveform");
+  testing::DirectoryWatch watch(dir_);
   RCFileInputWaveformDataSource source(url("tone.m4a"), true, 0);
   std::vector<double> flushedSeconds;
   bool sideFilesMatched = true;
   source.setFlushHandler([&](const RCWaveform& saved) {
     flushedSeconds.push_back(saved.durationSeconds());
     auto onDisk = RCReadWaveformFile(source.partialWaveformURL());
-    sideFilesMatched = sideFilesMatched && onDisk && *onDisk == saved;
-    sideFilesMatched = sideFilesMatched && !fs::exists(source.waveformURL().path());
+    sideFilesMatched =
+        sideFilesMatched && onDisk && *onDisk == saved && !fs::exists(source.waveformURL().path());
   });
   source.beginLoading();
   ASSERT_TRUE(source.waitUntilFinished());
   EXPECT_FALSE(source.error());
 
   ASSERT_GT(flushedSeconds.size(), 10u);
-  EXPECT_TRUE(std::is_sorted(flushedSeconds.begin(), flushedSeconds.end()));
+  EXPECT_TRUE(std::ranges::is_sorted(flushedSeconds));
   EXPECT_TRUE(sideFilesMatched);
-  EXPECT_EQ(watch.replacements(), 1);
-  EXPECT_EQ(watch.inPlaceWrites(), 0);
+  int replacements = 0, inPlaceWrites = 0;
+  for (const auto& event : watch.events()) {
+    if (event.name != "tone.waveform") continue;
+    replacements += bool(event.mask & IN_MOVED_TO);
+    inPlaceWrites += bool(event.mask & (IN_CREATE | IN_MODIFY));
+  }
+  EXPECT_EQ(replacements, 1);
+  EXPECT_EQ(inPlaceWrites, 0);
   EXPECT_FALSE(fs::exists(source.partialWaveformURL().path()));
   auto final = RCReadWaveformFile(source.waveformURL());
   ASSERT_TRUE(final) << final.error();
@@ -257,19 +195,16 @@ TEST_F(WaveformDataSourceTest, ConcurrentSourcesOfOneRecordingNeverExposeAHalfFi
   for (auto& source : sources) source->beginLoading();
   // Read the file while the sources replace it over and over: every read
   // sees a whole waveform (or no file yet), never a torn one.
+  const platform::URL waveformURL = RCWaveform::waveformURLForAVURL(url("shared.m4a"));
   std::atomic<bool> done{false};
   int reads = 0, torn = 0;
   std::thread reader([&] {
-    const platform::URL waveformURL = RCWaveform::waveformURLForAVURL(url("shared.m4a"));
     // Until the sources are done and at least one read saw a whole file: on
     // a loaded machine the sources may all finish before the first read.
-    int late = 0;  // reads after the sources were done
-    while (!done || (reads == 0 && ++late < 1000)) {
+    for (int late = 0; !done || (reads == 0 && ++late < 1000);) {
       auto read = RCReadWaveformFile(waveformURL);
-      if (read)
-        ++reads;
-      else if (read.error().domain() == kRCMediaErrorDomain)
-        ++torn;
+      reads += bool(read);
+      torn += !read && read.error().domain() == kRCMediaErrorDomain;
     }
   });
   for (auto& source : sources) EXPECT_TRUE(source->waitUntilFinished());
@@ -277,35 +212,29 @@ TEST_F(WaveformDataSourceTest, ConcurrentSourcesOfOneRecordingNeverExposeAHalfFi
   reader.join();
   EXPECT_EQ(torn, 0);
   EXPECT_GT(reads, 0);
-  auto final = RCReadWaveformFile(RCWaveform::waveformURLForAVURL(url("shared.m4a")));
+  auto final = RCReadWaveformFile(waveformURL);
   ASSERT_TRUE(final);
   EXPECT_EQ(*final, sources.front()->waveform());
   EXPECT_TRUE(hiddenFiles().empty());
 }
 
 TEST_F(WaveformDataSourceTest, ComputesEveryFormatAndKeepsItInMemoryWhenNotSaving) {
-  struct Case {
-    std::string name;
-    std::string format;
-    int rate;
-    int channels;
-  };
-  for (const Case& c : {Case{"a.flac", "flac", 48000, 2}, Case{"b.wav", "wav", 22050, 1},
-                        Case{"c.m4a", "m4a", 48000, 2}}) {
-    SCOPED_TRACE(c.name);
-    ASSERT_TRUE(writeTone(path(c.name), 1.25, c.format, c.rate, c.channels, 300, 0.25));
-    RCFileInputWaveformDataSource source(url(c.name), false, 0.1);
+  for (const auto& [name, rate, channels] :
+       {std::tuple{"a.flac", 48000, 2}, {"b.wav", 22050, 1}, {"c.m4a", 48000, 2}}) {
+    SCOPED_TRACE(name);
+    ASSERT_TRUE(writeTone(path(name), 1.25, fs::path(name).extension().string().substr(1), rate,
+                          channels, 300, 0.25));
+    RCFileInputWaveformDataSource source(url(name), false, 0.1);
     int flushes = 0;
     source.setFlushHandler([&](const RCWaveform&) { ++flushes; });
     source.beginLoading();
     ASSERT_TRUE(source.waitUntilFinished());
     EXPECT_EQ(flushes, 0);
-    EXPECT_FALSE(fs::exists(RCWaveform::waveformURLForAVURL(url(c.name)).path()));
-    EXPECT_EQ(source.waveform().sampleRate(), c.rate);
+    EXPECT_FALSE(fs::exists(source.waveformURL().path()));
+    EXPECT_EQ(source.waveform().sampleRate(), rate);
     EXPECT_EQ(source.waveform().channels(), 1);
     EXPECT_NEAR(source.waveform().durationSeconds(), 1.25, 0.03);
-    const std::size_t middle = source.waveform().length() / 2;
-    EXPECT_NEAR(source.waveform().max(middle, 0), 8192, 1300);
+    EXPECT_NEAR(source.waveform().max(source.waveform().length() / 2, 0), 8192, 1300);
   }
 }
 
