@@ -9,7 +9,10 @@
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
+#include <string_view>
 
+#include "Quorvel/files/RCFileStatus.h"
+#include "Quorvel/files/RCReplacementFile.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
 
 namespace quorvelctl {
@@ -78,25 +81,38 @@ platform::Status writeWaveformPNG(const quorvel::RCWaveform& waveform, WaveformP
   image.width = png_uint_32(size.width);
   image.height = png_uint_32(size.height);
   image.format = PNG_FORMAT_RGB;
-  // Written beside the destination, then renamed over it: a failed write
-  // never leaves half a picture under the requested name.
-  const std::string temporary = path + ".partial";
-  const bool written = png_image_write_to_file(&image, temporary.c_str(), /*convert_to_8bit=*/0,
-                                               pixels.data(), /*row_stride=*/0,
-                                               /*colormap=*/nullptr) != 0;
+  png_alloc_size_t length = 0;
+  std::vector<std::uint8_t> bytes;
+  bool written = png_image_write_get_memory_size(image, length, /*convert_to_8bit=*/0,
+                                                 pixels.data(), /*row_stride=*/0,
+                                                 /*colormap=*/nullptr) != 0;
+  if (written) {
+    bytes.resize(length);
+    written =
+        png_image_write_to_memory(&image, bytes.data(), &length, 0, pixels.data(), 0, nullptr) != 0;
+  }
   const std::string message = image.message;
   png_image_free(&image);
   if (!written) {
-    std::remove(temporary.c_str());
     return platform::fail(platform::Error(platform::kPOSIXErrorDomain, EIO,
                                           fmt::format("cannot write {}: {}", path, message)));
   }
-  if (std::rename(temporary.c_str(), path.c_str()) != 0) {
+  const std::string_view contents(reinterpret_cast<const char*>(bytes.data()), length);
+  // A terminal, a pipe or a device is written to as it is; a file is
+  // replaced atomically, so a failed write never leaves half a picture
+  // under the requested name.
+  const quorvel::RCFileStatus existing = quorvel::RCFileStatus::atPathFollowing(path);
+  if (existing.exists() && !existing.isRegularFile()) {
+    std::FILE* out = std::fopen(path.c_str(), "wb");
+    const bool ok = out && std::fwrite(contents.data(), 1, contents.size(), out) == contents.size();
     const int error = errno;
-    std::remove(temporary.c_str());
-    return platform::fail(platform::posixError(error, "cannot write " + path));
+    if (out && std::fclose(out) != 0 && ok)
+      return platform::fail(platform::posixError(errno, path));
+    if (!ok) return platform::fail(platform::posixError(error, "cannot write " + path));
+    return {};
   }
-  return {};
+  const auto url = platform::URL::fileURLWithPath(std::filesystem::absolute(path).string());
+  return quorvel::RCReplacementFile::replace(url, contents);
 }
 
 int drawWaveform(const std::string& text, const std::string& png, WaveformPictureSize size) {
