@@ -27,8 +27,8 @@ bool SavedRecordingService::shouldAcceptNewConnection(
     platform::Listener&, std::shared_ptr<platform::Connection> newConnection) {
   // The listener publishes the service interface with the service behind
   // every method, so the exported object and interfaces need no setting
-  // per connection; every call of this peer reaches
-  // connectionHandleInvocation().
+  // per connection; every call of this peer reaches its method's handler
+  // in SavedRecordingServiceBusEdge.
   rcs_setValid(*newConnection, true);
 
   std::weak_ptr<platform::Connection> weakConnection = newConnection;

@@ -104,14 +104,15 @@ void SavedRecordingService::_postExportingCompositionAVURLsChanged() {
 
 void SavedRecordingService::prepareToExportCompositionAVURL(
     std::optional<platform::URL> compositionAVURL, bool cacheWaveform,
-    AccessRequestHandler accessRequestHandler) {
+    AccessRequestHandler accessRequestHandler,
+    std::shared_ptr<platform::Connection> xpcConnection) {
   if (!_checkPrepareRequest("prepareToExportCompositionAVURL:cacheWaveform:accessRequestHandler:",
-                            "export", compositionAVURL, accessRequestHandler)) {
+                            "export", compositionAVURL, accessRequestHandler, xpcConnection)) {
     return;
   }
   _performOnServiceQueue(
       [this, self = shared_from_this(), url = std::move(*compositionAVURL), cacheWaveform,
-       connection = rcs_currentConnection(), reply = std::move(accessRequestHandler)]() mutable {
+       connection = std::move(xpcConnection), reply = std::move(accessRequestHandler)]() mutable {
         _onServiceQueueOpenAccessSessionNamed(
             "export", url, /*exclusive=*/false, std::move(connection),
             [this, self, url, cacheWaveform, reply = std::move(reply)](

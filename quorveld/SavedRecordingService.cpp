@@ -8,6 +8,7 @@
 // root transaction, and with it the process's reason to stay, ends with the
 // last of these.
 #include "quorveld/SavedRecordingService.h"
+#include "quorveld/SavedRecordingServiceBusEdge.h"
 
 #include <fmt/format.h>
 
@@ -104,8 +105,8 @@ platform::Status SavedRecordingService::start() {
   startupKeepAlive->endTransactionOnDate(platform::Date::dateWithTimeIntervalSinceNow(2.0));
 
   // Launch events are signals on the bus; the exported interface subscribes
-  // to them (see _exportedInterface) and they reach _handleLaunchEvent on
-  // the main queue.
+  // to them (see SavedRecordingServiceBusEdge) and they reach
+  // _handleLaunchEvent on the main queue.
 
   auto orphanKeepAlive = RCSXPCTransaction::initWithName("Keep-alive for orphan handling");
   orphanKeepAlive->beginTransaction();
@@ -119,7 +120,8 @@ platform::Status SavedRecordingService::start() {
   });
 
   if (_xpcListener) return {};
-  _xpcListener = _listenerFactory(RCSSavedRecordingServiceMachServiceName, _exportedInterface());
+  _xpcListener = _listenerFactory(RCSSavedRecordingServiceMachServiceName,
+                                  SavedRecordingServiceBusEdge::interfaceFor(weak_from_this()));
   _xpcListener->setDelegate(this);
   QV_LOG(platform::kLogLevelNotice, "Starting service '{}'",
          RCSSavedRecordingServiceMachServiceName);

@@ -8,7 +8,7 @@
 //   SavedRecordingService.Connections.cpp  accepting connections, their end,
 //                                          delivery, _performOnServiceQueue
 //   SavedRecordingService.Interface.cpp    the ten requests' entry checks
-//   SavedRecordingService.Invocation.cpp   turning bus calls into requests
+// and SavedRecordingServiceBusEdge turns bus calls into those requests.
 //   SavedRecordingService.Sessions.cpp     access requests, deferral, the
 //                                          close procedure, disconnection
 //   SavedRecordingService.OrphanHandling.cpp  fragment cleanup and its holds,
@@ -41,6 +41,7 @@
 #include "platform/dbus/Listener.h"
 #include "quorveld/AssetAccessSessionController.h"
 #include "quorveld/AssetExportController.h"
+#include "quorveld/RCSAdditions.h"
 
 namespace quorvel {
 
@@ -107,26 +108,33 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   bool shouldAcceptNewConnection(platform::Listener& listener,
                                  std::shared_ptr<platform::Connection> newConnection) override;
   void listenerDidLoseBus(platform::Listener& listener) override;
-  // Delivery of one call: decode it and invoke the request it names.
-  void connectionHandleInvocation(const std::shared_ptr<platform::Connection>& connection,
-                                  platform::IncomingCall invocation);
 
   // The ten requests (delivery thread). An empty handler is a call that
-  // expects no reply; an empty URL or token is a missing one.
-  void prepareToCaptureToCompositionAVURL(std::optional<platform::URL> compositionAVURL,
-                                          AccessRequestHandler accessRequestHandler);
-  void prepareToPreviewCompositionAVURL(std::optional<platform::URL> compositionAVURL,
-                                        AccessRequestHandler accessRequestHandler);
-  void prepareToExportCompositionAVURL(std::optional<platform::URL> compositionAVURL,
-                                       bool cacheWaveform,
-                                       AccessRequestHandler accessRequestHandler);
-  void prepareToTrimCompositionAVURL(std::optional<platform::URL> compositionAVURL,
-                                     AccessRequestHandler accessRequestHandler);
-  void endAccessSessionWithToken(std::optional<RCSSavedRecordingAccessToken> accessToken);
+  // expects no reply; an empty URL or token is a missing one. Those that
+  // need the calling connection take it explicitly, by default the one
+  // whose call is being delivered on this thread.
+  void prepareToCaptureToCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
+  void prepareToPreviewCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
+  void prepareToExportCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL, bool cacheWaveform,
+      AccessRequestHandler accessRequestHandler,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
+  void prepareToTrimCompositionAVURL(
+      std::optional<platform::URL> compositionAVURL, AccessRequestHandler accessRequestHandler,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
+  void endAccessSessionWithToken(
+      std::optional<RCSSavedRecordingAccessToken> accessToken,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
   void disableOrphanedFragmentCleanupForCompositionAVURL(
-      std::optional<platform::URL> compositionAVURL, CompletionHandler completionBlock);
+      std::optional<platform::URL> compositionAVURL, CompletionHandler completionBlock,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
   void enableOrphanedFragmentCleanupForCompositionAVURL(
-      std::optional<platform::URL> compositionAVURL);
+      std::optional<platform::URL> compositionAVURL,
+      std::shared_ptr<platform::Connection> xpcConnection = rcs_currentConnection());
   void disableOrphanHandlingWithCompletionBlock(CompletionHandler completionBlock);
   void enableOrphanHandlingWithCompletionBlock(CompletionHandler completionBlock);
   void fetchExportingCompositionAVURLs(URLSetHandler reply);
@@ -262,19 +270,20 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   void _init(bool watchDebugSignal);
   void _setupSignalHandler();
   void _tearDownSignalHandler();
-  void _logMissingParameter(const char* parameter, const char* selector);
+  void _logMissingParameter(
+      const char* parameter, const char* selector,
+      const std::shared_ptr<platform::Connection>& xpcConnection = rcs_currentConnection());
   // A prepare request's arrival line and required-parameter checks. True
   // when the request may go on; otherwise it was answered or dropped.
   bool _checkPrepareRequest(const char* selector, const char* kind,
-                            const std::optional<platform::URL>& url, AccessRequestHandler& handler);
+                            const std::optional<platform::URL>& url, AccessRequestHandler& handler,
+                            const std::shared_ptr<platform::Connection>& xpcConnection);
   // The capture, preview and trimming requests: entry checks here, the open
   // step on the service serial queue with the calling connection.
   void _prepareAccessSession(const char* selector, const char* kind, const char* sessionName,
                              bool exclusive, std::optional<platform::URL> compositionAVURL,
-                             AccessRequestHandler accessRequestHandler);
-  // The service interface with each method routed to
-  // connectionHandleInvocation().
-  platform::InterfaceDescription _exportedInterface();
+                             AccessRequestHandler accessRequestHandler,
+                             std::shared_ptr<platform::Connection> xpcConnection);
 
   void _onServiceQueueRunDeferredAccessRequest(const std::string& name,
                                                const platform::URL& compositionAVURL,

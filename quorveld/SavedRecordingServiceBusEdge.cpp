@@ -1,0 +1,203 @@
+// Decoding: a string that is not a file URL or absolute path is a missing
+// URL; the "no token" tuple is a missing token, and a tuple that names no
+// possible token (an identifier that is not a UUID) an unknown one, like a
+// token whose session has ended; a call sent without expecting a reply is a
+// missing reply callback. The calling connection is passed to the request
+// explicitly. Each reply callback owns its call and answers it.
+#include "quorveld/SavedRecordingServiceBusEdge.h"
+
+#include <fmt/format.h>
+
+#include <string_view>
+#include <utility>
+
+#include "Quorvel/service/RCSSavedRecordingServiceConnection.h"
+#include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
+#include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
+#include "platform/Log.h"
+#include "platform/MainQueue.h"
+#include "platform/Misuse.h"
+#include "quorveld/SavedRecordingService.h"
+
+namespace quorvel {
+
+namespace {
+
+constexpr std::string_view kBusErrorPrefix = "org.freedesktop.DBus.Error.";
+// The broadcast that stands for the platform's launch events.
+constexpr const char* kLaunchEventInterface = "org.quorvel.Events1";
+constexpr const char* kLaunchEventMember = "Event";
+
+void answerError(platform::IncomingCall& call, const platform::Error& error) {
+  if (error.domain().starts_with(kBusErrorPrefix)) {
+    call.replyError(error.domain(), error.localizedDescription());
+    return;
+  }
+  RCSDBusError busError = RCSDBusErrorFromError(error);
+  call.replyError(busError.name, busError.message);
+}
+
+std::optional<platform::URL> urlArgument(const platform::IncomingCall& call) {
+  return platform::URL::fromFileURLStringOrPath(call.arguments().at(0).asString());
+}
+
+RCSSavedRecordingAccessToken::Tuple tokenArgument(const platform::IncomingCall& call) {
+  const auto& fields = call.arguments().at(0).fields();
+  return {fields.at(0).asString(), fields.at(1).asInt32(), fields.at(2).asString(),
+          fields.at(3).asString()};
+}
+
+platform::BusValue tokenValue(const RCSSavedRecordingAccessToken::Tuple& tuple) {
+  const auto& [name, type, url, identifier] = tuple;
+  return platform::BusValue::structure({name, type, url, identifier});
+}
+
+SavedRecordingService::AccessRequestHandler accessRequestHandlerFor(platform::IncomingCall call) {
+  if (call.noReplyExpected()) return {};
+  return [call = std::move(call)](std::optional<RCSSavedRecordingAccessToken> token,
+                                  std::optional<platform::Error> error) mutable {
+    if (error) return answerError(call, *error);
+    call.reply(
+        {tokenValue(token ? token->toTuple() : RCSSavedRecordingAccessToken::noTokenTuple())});
+  };
+}
+
+SavedRecordingService::CompletionHandler completionHandlerFor(platform::IncomingCall call) {
+  if (call.noReplyExpected()) return {};
+  return [call = std::move(call)](std::optional<platform::Error> error) mutable {
+    if (error) return answerError(call, *error);
+    call.reply();
+  };
+}
+
+SavedRecordingService::URLSetHandler urlSetHandlerFor(platform::IncomingCall call) {
+  if (call.noReplyExpected()) return {};
+  return [call = std::move(call)](std::set<platform::URL> urls) mutable {
+    std::vector<std::string> strings;
+    strings.reserve(urls.size());
+    for (const auto& url : urls) strings.push_back(url.absoluteString());
+    call.reply({platform::BusValue(std::move(strings))});
+  };
+}
+
+using Handler = void (*)(SavedRecordingService& service, platform::IncomingCall call);
+
+void prepareToCapture(SavedRecordingService& service, platform::IncomingCall call) {
+  auto url = urlArgument(call);
+  auto connection = call.connection();
+  service.prepareToCaptureToCompositionAVURL(
+      std::move(url), accessRequestHandlerFor(std::move(call)), std::move(connection));
+}
+
+void prepareToPreview(SavedRecordingService& service, platform::IncomingCall call) {
+  auto url = urlArgument(call);
+  auto connection = call.connection();
+  service.prepareToPreviewCompositionAVURL(std::move(url), accessRequestHandlerFor(std::move(call)),
+                                           std::move(connection));
+}
+
+void prepareToExport(SavedRecordingService& service, platform::IncomingCall call) {
+  auto url = urlArgument(call);
+  const bool cacheWaveform = call.arguments().at(1).asBool();
+  auto connection = call.connection();
+  service.prepareToExportCompositionAVURL(std::move(url), cacheWaveform,
+                                          accessRequestHandlerFor(std::move(call)),
+                                          std::move(connection));
+}
+
+void prepareToTrim(SavedRecordingService& service, platform::IncomingCall call) {
+  auto url = urlArgument(call);
+  auto connection = call.connection();
+  service.prepareToTrimCompositionAVURL(std::move(url), accessRequestHandlerFor(std::move(call)),
+                                        std::move(connection));
+}
+
+void endAccessSession(SavedRecordingService& service, platform::IncomingCall call) {
+  auto tuple = tokenArgument(call);
+  if (tuple == RCSSavedRecordingAccessToken::noTokenTuple()) {
+    service.endAccessSessionWithToken(std::nullopt, call.connection());
+  } else if (auto token = RCSSavedRecordingAccessToken::fromTuple(tuple)) {
+    service.endAccessSessionWithToken(std::move(token), call.connection());
+  } else {
+    QV_LOG(platform::kLogLevelDebug, "Ending access session: {}.",
+           RCSSavedRecordingAccessToken::debugDescriptionOfTuple(tuple));
+  }
+}
+
+void disableOrphanedFragmentCleanup(SavedRecordingService& service, platform::IncomingCall call) {
+  auto url = urlArgument(call);
+  auto connection = call.connection();
+  service.disableOrphanedFragmentCleanupForCompositionAVURL(
+      std::move(url), completionHandlerFor(std::move(call)), std::move(connection));
+}
+
+void enableOrphanedFragmentCleanup(SavedRecordingService& service, platform::IncomingCall call) {
+  service.enableOrphanedFragmentCleanupForCompositionAVURL(urlArgument(call), call.connection());
+}
+
+void disableOrphanHandling(SavedRecordingService& service, platform::IncomingCall call) {
+  service.disableOrphanHandlingWithCompletionBlock(completionHandlerFor(std::move(call)));
+}
+
+void enableOrphanHandling(SavedRecordingService& service, platform::IncomingCall call) {
+  service.enableOrphanHandlingWithCompletionBlock(completionHandlerFor(std::move(call)));
+}
+
+void fetchExportingCompositionAVURLs(SavedRecordingService& service, platform::IncomingCall call) {
+  service.fetchExportingCompositionAVURLs(urlSetHandlerFor(std::move(call)));
+}
+
+constexpr std::pair<std::string_view, Handler> kHandlers[] = {
+    {RCSMethodPrepareToCapture, prepareToCapture},
+    {RCSMethodPrepareToPreview, prepareToPreview},
+    {RCSMethodPrepareToExport, prepareToExport},
+    {RCSMethodPrepareToTrim, prepareToTrim},
+    {RCSMethodEndAccessSession, endAccessSession},
+    {RCSMethodDisableOrphanedFragmentCleanup, disableOrphanedFragmentCleanup},
+    {RCSMethodEnableOrphanedFragmentCleanup, enableOrphanedFragmentCleanup},
+    {RCSMethodDisableOrphanHandling, disableOrphanHandling},
+    {RCSMethodEnableOrphanHandling, enableOrphanHandling},
+    {RCSMethodFetchExportingCompositionAVURLs, fetchExportingCompositionAVURLs},
+};
+
+Handler handlerFor(std::string_view method) {
+  for (const auto& [name, handler] : kHandlers) {
+    if (name == method) return handler;
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+platform::InterfaceDescription SavedRecordingServiceBusEdge::interfaceFor(
+    std::weak_ptr<SavedRecordingService> service) {
+  platform::InterfaceDescription interface = RCSSavedRecordingServiceConnection::serviceInterface();
+  for (auto& method : interface.methods) {
+    Handler handler = handlerFor(method.name);
+    QV_MISUSE(handler == nullptr, "no handler for the method {}", method.name);
+    method.handler = [service, handler](platform::IncomingCall call) {
+      if (auto strong = service.lock()) handler(*strong, std::move(call));
+    };
+  }
+  // Launch events: each named event is posted in-process on the main queue.
+  interface.matches.push_back(platform::SignalMatch{
+      .interface = kLaunchEventInterface,
+      .member = kLaunchEventMember,
+      .signature = "s",
+      .handler =
+          [service](const platform::BusValues& arguments) {
+            platform::mainQueue().async([service, name = arguments.at(0).asString()] {
+              if (auto strong = service.lock()) strong->_handleLaunchEvent(name);
+            });
+          },
+      .mismatchHandler =
+          [service] {
+            platform::mainQueue().async([service] {
+              if (auto strong = service.lock()) strong->_handleLaunchEvent(std::nullopt);
+            });
+          },
+  });
+  return interface;
+}
+
+}  // namespace quorvel
