@@ -20,9 +20,9 @@ extern "C" {
 }
 
 #include "Quorvel/files/RCRecordingsDirectory.h"
-#include "Quorvel/media/RCAudioDecoder.h"
-#include "Quorvel/media/RCComposer.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
+#include "QuorvelMedia/RCAudioDecoder.h"
+#include "QuorvelMedia/RCComposer.h"
 #include "bench/BenchTiming.h"
 
 namespace fs = std::filesystem;

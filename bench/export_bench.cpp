@@ -26,7 +26,7 @@
 #include "Quorvel/composition/RCCompositionEditor.h"
 #include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/files/RCRecordingsDirectory.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "bench/BenchDaemon.h"
 #include "bench/BenchTiming.h"
 #include "tests/support/TestBus.h"

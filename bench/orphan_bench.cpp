@@ -24,7 +24,7 @@
 #include <vector>
 
 #include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "bench/BenchTiming.h"
 #include "platform/Log.h"
 #include "tests/support/AudioFixtures.h"

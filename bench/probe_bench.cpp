@@ -15,8 +15,8 @@
 #include <vector>
 
 #include "Quorvel/files/RCRecordingsDirectory.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "bench/BenchTiming.h"
 #include "tests/support/AudioFixtures.h"
 

@@ -10,9 +10,9 @@
 #include <string>
 
 #include "Quorvel/files/RCRecordingsDirectory.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
-#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
+#include "QuorvelMedia/RCFileInputWaveformDataSource.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "bench/BenchTiming.h"
 
 namespace fs = std::filesystem;

@@ -6,7 +6,7 @@
 #include <span>
 #include <string>
 
-#include "Quorvel/media/RCMP4Atoms.h"
+#include "QuorvelMedia/RCMP4Atoms.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   std::span<const std::uint8_t> file(data, size);

@@ -35,9 +35,9 @@
 #include <vector>
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
-#include "Quorvel/media/RCMediaInput.h"
 #include "Quorvel/media/RCMediaProtocol.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCMediaInput.h"
 #include "platform/Log.h"
 
 #if QUORVEL_MEDIA_SANDBOX && __has_include("platform/Sandbox.h")

@@ -19,7 +19,7 @@
 #include "Quorvel/composition/RCCompositionEditor.h"
 #include "Quorvel/files/RCFileCreationDate.h"
 #include "Quorvel/locale/RCLocalizedRecordingDate.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/DelegatingMediaEngine.h"
 #include "tests/support/RecordingsDirectoryFixture.h"

@@ -8,9 +8,9 @@
 
 #include <future>
 
-#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "platform/dbus/BusListener.h"
 #include "tests/quorveld/ServiceFixture.h"
 #include "tests/support/DelegatingMediaEngine.h"

@@ -18,7 +18,7 @@ extern "C" {
 #include <numbers>
 #include <tuple>
 
-#include "Quorvel/media/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
 
 namespace quorvel::testing {
 namespace {

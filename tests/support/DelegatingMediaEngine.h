@@ -6,7 +6,7 @@
 
 #include <memory>
 
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 
 namespace quorvel::testing {
 

@@ -1,7 +1,7 @@
 // Linked into every test above the platform: the process's media engine is
 // the in-process one from the start, as in an app; tests of the worker
 // client install that one themselves.
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 
 namespace {
 

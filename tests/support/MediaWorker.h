@@ -5,8 +5,8 @@
 #include <memory>
 #include <string>
 
-#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/media/RCMediaWorkerClient.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 
 namespace quorvel::testing {
 

@@ -29,10 +29,10 @@
 #include <vector>
 
 #include "Quorvel/files/RCRecordingsDirectory.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "platform/Subprocess.h"
 #include "tools/quorvelctl/Recordings.h"
 #include "tools/quorvelctl/WaveformPicture.h"

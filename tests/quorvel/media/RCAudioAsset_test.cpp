@@ -16,7 +16,7 @@
 #include <thread>
 
 #include "Quorvel/media/RCAssetMetadataLoader.h"
-#include "Quorvel/media/RCMP4Atoms.h"
+#include "QuorvelMedia/RCMP4Atoms.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/Gate.h"
 #include "tests/support/TempDirectory.h"

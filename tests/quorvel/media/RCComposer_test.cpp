@@ -2,7 +2,7 @@
 // ranges, mixed formats, the composed waveform, and damaged input that must
 // fail without leaving a half file. Decoded audio is compared within
 // tolerances (tone frequencies per section, durations), never encoder bytes.
-#include "Quorvel/media/RCComposer.h"
+#include "QuorvelMedia/RCComposer.h"
 
 #include <gtest/gtest.h>
 #include <sys/resource.h>
@@ -21,9 +21,9 @@ extern "C" {
 }
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
+#include "QuorvelMedia/RCFileInputWaveformDataSource.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/TempDirectory.h"
 

@@ -2,7 +2,7 @@
 // languages side by side, interplay with titles written by the ffmpeg CLI,
 // the text encodings a container may declare, and files that must be refused
 // without being touched.
-#include "Quorvel/media/RCMP4Atoms.h"
+#include "QuorvelMedia/RCMP4Atoms.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -16,8 +16,8 @@ extern "C" {
 #include <map>
 
 #include "Quorvel/files/RCFile.h"
-#include "Quorvel/media/RCFFmpegLogging.h"
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/TempDirectory.h"
 

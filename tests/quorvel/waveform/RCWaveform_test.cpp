@@ -10,9 +10,9 @@
 #include <vector>
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
 #include "Quorvel/waveform/RCWaveform.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
+#include "QuorvelMedia/RCFileInputWaveformDataSource.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/DirectoryWatch.h"
 #include "tests/support/TempDirectory.h"

@@ -29,7 +29,7 @@
 // path from the converted samples, in the copy path by decoding the copied
 // packets in output order with their output timestamps, which is exactly what
 // a player decoding the composed file hears (edit list included).
-#include "Quorvel/media/RCComposer.h"
+#include "QuorvelMedia/RCComposer.h"
 
 #include <sys/stat.h>
 
@@ -50,15 +50,15 @@ extern "C" {
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileStatus.h"
 #include "Quorvel/files/RCReplacementFile.h"
-#include "Quorvel/media/RCAudioDecoder.h"
-#include "Quorvel/media/RCAudioEncoder.h"
-#include "Quorvel/media/RCAudioOutput.h"
-#include "Quorvel/media/RCFFmpegLogging.h"
-#include "Quorvel/media/RCFFmpegResource.h"
-#include "Quorvel/media/RCMP4Atoms.h"
-#include "Quorvel/media/RCMediaInput.h"
-#include "Quorvel/waveform/RCWaveformBuilder.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
+#include "QuorvelMedia/RCAudioDecoder.h"
+#include "QuorvelMedia/RCAudioEncoder.h"
+#include "QuorvelMedia/RCAudioOutput.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCFFmpegResource.h"
+#include "QuorvelMedia/RCMP4Atoms.h"
+#include "QuorvelMedia/RCMediaInput.h"
+#include "QuorvelMedia/RCWaveformBuilder.h"
 #include "platform/Log.h"
 
 namespace quorvel {

@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCMediaInput.h"
+#include "QuorvelMedia/RCMediaInput.h"
 
 #include <atomic>
 

@@ -1,4 +1,4 @@
-#include "Quorvel/waveform/RCWaveformBuilder.h"
+#include "QuorvelMedia/RCWaveformBuilder.h"
 
 #include <algorithm>
 #include <cmath>

@@ -11,7 +11,7 @@
 #include <functional>
 #include <memory>
 
-#include "Quorvel/media/RCFFmpegResource.h"
+#include "QuorvelMedia/RCFFmpegResource.h"
 #include "platform/Error.h"
 #include "platform/URL.h"
 

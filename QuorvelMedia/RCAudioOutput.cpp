@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCAudioOutput.h"
+#include "QuorvelMedia/RCAudioOutput.h"
 
 #include <algorithm>
 #include <cctype>
@@ -10,7 +10,7 @@ extern "C" {
 }
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/media/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
 
 namespace quorvel {
 namespace {

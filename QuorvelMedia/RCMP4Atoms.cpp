@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCMP4Atoms.h"
+#include "QuorvelMedia/RCMP4Atoms.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>

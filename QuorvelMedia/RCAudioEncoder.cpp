@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCAudioEncoder.h"
+#include "QuorvelMedia/RCAudioEncoder.h"
 
 #include <algorithm>
 #include <cctype>
@@ -9,8 +9,8 @@ extern "C" {
 }
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/media/RCAudioOutput.h"
-#include "Quorvel/media/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCAudioOutput.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
 
 namespace quorvel {
 namespace {

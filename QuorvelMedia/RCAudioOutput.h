@@ -10,7 +10,7 @@
 #include <string>
 #include <string_view>
 
-#include "Quorvel/media/RCFFmpegResource.h"
+#include "QuorvelMedia/RCFFmpegResource.h"
 #include "platform/Error.h"
 
 namespace quorvel {

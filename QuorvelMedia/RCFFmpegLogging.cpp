@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
 
 extern "C" {
 #include <libavutil/error.h>

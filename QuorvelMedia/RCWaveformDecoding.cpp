@@ -1,11 +1,11 @@
-#include "Quorvel/media/RCWaveformDecoding.h"
+#include "QuorvelMedia/RCWaveformDecoding.h"
 
 #include <algorithm>
 #include <optional>
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/media/RCAudioDecoder.h"
-#include "Quorvel/waveform/RCWaveformBuilder.h"
+#include "QuorvelMedia/RCAudioDecoder.h"
+#include "QuorvelMedia/RCWaveformBuilder.h"
 
 namespace quorvel {
 

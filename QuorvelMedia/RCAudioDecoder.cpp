@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCAudioDecoder.h"
+#include "QuorvelMedia/RCAudioDecoder.h"
 
 extern "C" {
 #include <libavcodec/avcodec.h>
@@ -6,8 +6,8 @@ extern "C" {
 }
 
 #include "Quorvel/errors/RCErrors.h"
-#include "Quorvel/media/RCFFmpegLogging.h"
-#include "Quorvel/media/RCMediaInput.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCMediaInput.h"
 
 namespace quorvel {
 

@@ -1,4 +1,4 @@
-#include "Quorvel/media/RCInProcessMediaEngine.h"
+#include "QuorvelMedia/RCInProcessMediaEngine.h"
 
 extern "C" {
 #include <libavcodec/avcodec.h>
@@ -18,13 +18,13 @@ extern "C" {
 
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCFileStatus.h"
-#include "Quorvel/media/RCComposer.h"
-#include "Quorvel/media/RCFFmpegLogging.h"
-#include "Quorvel/media/RCFFmpegResource.h"
-#include "Quorvel/media/RCMP4Atoms.h"
-#include "Quorvel/media/RCMediaInput.h"
-#include "Quorvel/media/RCWaveformDecoding.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
+#include "QuorvelMedia/RCComposer.h"
+#include "QuorvelMedia/RCFFmpegLogging.h"
+#include "QuorvelMedia/RCFFmpegResource.h"
+#include "QuorvelMedia/RCMP4Atoms.h"
+#include "QuorvelMedia/RCMediaInput.h"
+#include "QuorvelMedia/RCWaveformDecoding.h"
 #include "platform/Log.h"
 
 namespace quorvel {

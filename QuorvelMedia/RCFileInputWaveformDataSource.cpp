@@ -1,13 +1,13 @@
-#include "Quorvel/waveform/RCFileInputWaveformDataSource.h"
+#include "QuorvelMedia/RCFileInputWaveformDataSource.h"
 
 #include <unistd.h>
 
 #include <chrono>
 #include <cmath>
 
-#include "Quorvel/media/RCWaveformDecoding.h"
-#include "Quorvel/waveform/RCWaveformBuilder.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
+#include "QuorvelMedia/RCWaveformBuilder.h"
+#include "QuorvelMedia/RCWaveformDecoding.h"
 #include "platform/Log.h"
 
 namespace quorvel {
