@@ -1,8 +1,10 @@
 // RCSSavedRecordingServiceConnection: the service interface as the bus sees
 // it — every method with its argument and reply signatures and names, and the
-// exporting-set signal. The daemon attaches a handler to each method;
-// packaging/org.quorvel.SavedRecordingService1.xml is the same contract in
-// the bus's introspection format. Constant data; usable from any thread.
+// exporting-set signal — and, as a second interface of the same object, the
+// session listing and its change signal. The daemon attaches a handler to
+// each method; packaging/org.quorvel.SavedRecordingService1.xml and
+// org.quorvel.SavedRecordingService1.Sessions.xml say the same in the bus's
+// introspection format. Constant data; usable from any thread.
 #pragma once
 
 #include "platform/dbus/Listener.h"

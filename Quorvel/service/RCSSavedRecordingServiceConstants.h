@@ -44,4 +44,27 @@ inline constexpr const char* RCSMethodEnableOrphanHandling = "EnableOrphanHandli
 inline constexpr const char* RCSMethodFetchExportingCompositionAVURLs =
     "FetchExportingCompositionAVURLs";
 
+// The second interface of the service object: who holds which recording, and
+// a signal when that changes (packaging/org.quorvel.SavedRecordingService1.Sessions.xml).
+inline constexpr const char* RCSSavedRecordingServiceSessionsInterfaceName =
+    "org.quorvel.SavedRecordingService1.Sessions";
+// Every open and closing session: a(sissxsuus) of (access name, access type,
+// composition AVURL, state "open" or "closing", opened in microseconds since
+// the Unix epoch, holder's bus name, process id, user id, command name).
+inline constexpr const char* RCSMethodListAccessSessions = "ListAccessSessions";
+// Each recording's waiting request: a(sisxsuus) of (access name, access type,
+// composition AVURL, waiting since, holder's bus name, process id, user id,
+// command name).
+inline constexpr const char* RCSMethodListDeferredRequests = "ListDeferredRequests";
+// AccessSessionsChanged(s compositionAVURL): the recording's sessions or its
+// waiting request changed; at most once per recording per turn of the
+// daemon's service queue.
+inline constexpr const char* RCSSignalAccessSessionsChanged = "AccessSessionsChanged";
+// The states ListAccessSessions reports.
+inline constexpr const char* RCSAccessSessionStateOpen = "open";
+inline constexpr const char* RCSAccessSessionStateClosing = "closing";
+// A holder without a user id: the daemon's own session, or credentials the
+// bus would not give.
+inline constexpr unsigned RCSUnknownUserID = 0xFFFFFFFF;
+
 }  // namespace quorvel

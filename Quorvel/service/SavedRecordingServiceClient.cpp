@@ -39,6 +39,7 @@ struct SavedRecordingServiceClient::Impl {
   std::unique_ptr<sdbus::IProxy> proxy;
   std::mutex handlerMutex;
   std::function<void()> exportingChangedHandler;
+  std::function<void(const std::string&)> accessSessionsChangedHandler;
 
   sdbus::MethodCall call(const char* method) {
     return proxy->createMethodCall(RCSSavedRecordingServiceInterfaceName, method);
@@ -103,6 +104,11 @@ struct SavedRecordingServiceClient::Impl {
 
 platform::Result<std::unique_ptr<SavedRecordingServiceClient>> SavedRecordingServiceClient::connect(
     const std::string& busAddress) {
+  return connect(busAddress, Options());
+}
+
+platform::Result<std::unique_ptr<SavedRecordingServiceClient>> SavedRecordingServiceClient::connect(
+    const std::string& busAddress, Options options) {
   try {
     auto connection = busAddress.empty() ? sdbus::createSessionBusConnection()
                                          : sdbus::createSessionBusConnectionWithAddress(busAddress);
@@ -121,6 +127,20 @@ platform::Result<std::unique_ptr<SavedRecordingServiceClient>> SavedRecordingSer
           }
           if (handler) handler();
         });
+    if (options.watchAccessSessions) {
+      impl->proxy->registerSignalHandler(RCSSavedRecordingServiceSessionsInterfaceName,
+                                         RCSSignalAccessSessionsChanged,
+                                         [raw](sdbus::Signal& signal) {
+                                           std::string url;
+                                           signal >> url;
+                                           std::function<void(const std::string&)> handler;
+                                           {
+                                             std::lock_guard lock(raw->handlerMutex);
+                                             handler = raw->accessSessionsChangedHandler;
+                                           }
+                                           if (handler) handler(url);
+                                         });
+    }
     impl->proxy->finishRegistration();
     return std::unique_ptr<SavedRecordingServiceClient>(
         new SavedRecordingServiceClient(std::move(impl)));
@@ -317,6 +337,81 @@ void SavedRecordingServiceClient::setExportingCompositionAVURLsChangedHandler(
     std::function<void()> handler) {
   std::lock_guard lock(impl_->handlerMutex);
   impl_->exportingChangedHandler = std::move(handler);
+}
+
+void SavedRecordingServiceClient::setAccessSessionsChangedHandler(
+    std::function<void(const std::string&)> handler) {
+  std::lock_guard lock(impl_->handlerMutex);
+  impl_->accessSessionsChangedHandler = std::move(handler);
+}
+
+namespace {
+
+using SessionStruct =
+    sdbus::Struct<std::string, std::int32_t, std::string, std::string, std::int64_t, std::string,
+                  std::uint32_t, std::uint32_t, std::string>;
+using RequestStruct = sdbus::Struct<std::string, std::int32_t, std::string, std::int64_t,
+                                    std::string, std::uint32_t, std::uint32_t, std::string>;
+
+std::chrono::system_clock::time_point fromMicroseconds(std::int64_t microseconds) {
+  return std::chrono::system_clock::time_point(std::chrono::microseconds(microseconds));
+}
+
+// Calls a listing method and reads its array of `Wire` with `convert`.
+template <class Wire, class Convert>
+platform::Result<std::vector<SavedRecordingServiceClient::AccessHolder>> list(sdbus::IProxy& proxy,
+                                                                              const char* method,
+                                                                              Convert convert) {
+  std::promise<platform::Result<std::vector<SavedRecordingServiceClient::AccessHolder>>> promise;
+  auto future = promise.get_future();
+  auto message = proxy.createMethodCall(RCSSavedRecordingServiceSessionsInterfaceName, method);
+  proxy.callMethod(message, [&](sdbus::MethodReply& reply, const sdbus::Error* error) {
+    if (error) return promise.set_value(platform::fail(errorFromReply(*error)));
+    std::vector<Wire> wire;
+    try {
+      reply >> wire;
+    } catch (const sdbus::Error& e) {
+      return promise.set_value(platform::fail(malformedReply(method, e.getMessage())));
+    }
+    std::vector<SavedRecordingServiceClient::AccessHolder> holders;
+    for (const Wire& entry : wire) holders.push_back(convert(entry));
+    promise.set_value(std::move(holders));
+  });
+  return future.get();
+}
+
+}  // namespace
+
+platform::Result<std::vector<SavedRecordingServiceClient::AccessHolder>>
+SavedRecordingServiceClient::listAccessSessions() {
+  return list<SessionStruct>(*impl_->proxy, RCSMethodListAccessSessions,
+                             [](const SessionStruct& entry) {
+                               return AccessHolder{.accessName = entry.get<0>(),
+                                                   .accessType = entry.get<1>(),
+                                                   .compositionAVURL = entry.get<2>(),
+                                                   .state = entry.get<3>(),
+                                                   .since = fromMicroseconds(entry.get<4>()),
+                                                   .busName = entry.get<5>(),
+                                                   .pid = entry.get<6>(),
+                                                   .uid = entry.get<7>(),
+                                                   .command = entry.get<8>()};
+                             });
+}
+
+platform::Result<std::vector<SavedRecordingServiceClient::AccessHolder>>
+SavedRecordingServiceClient::listDeferredRequests() {
+  return list<RequestStruct>(*impl_->proxy, RCSMethodListDeferredRequests,
+                             [](const RequestStruct& entry) {
+                               return AccessHolder{.accessName = entry.get<0>(),
+                                                   .accessType = entry.get<1>(),
+                                                   .compositionAVURL = entry.get<2>(),
+                                                   .state = "waiting",
+                                                   .since = fromMicroseconds(entry.get<3>()),
+                                                   .busName = entry.get<4>(),
+                                                   .pid = entry.get<5>(),
+                                                   .uid = entry.get<6>(),
+                                                   .command = entry.get<7>()};
+                             });
 }
 
 }  // namespace quorvel

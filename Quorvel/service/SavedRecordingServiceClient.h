@@ -10,6 +10,8 @@
 // no call timeout: the daemon may defer them or finalize first.
 #pragma once
 
+#include <chrono>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -29,9 +31,16 @@ class SavedRecordingServiceClient {
   using CompletionHandler = std::move_only_function<void(std::optional<platform::Error>)>;
   using URLSetHandler = std::move_only_function<void(platform::Result<std::vector<platform::URL>>)>;
 
+  struct Options {
+    // Receive AccessSessionsChanged (see setAccessSessionsChangedHandler).
+    // Off by default: the bus then sends this client none of those signals.
+    bool watchAccessSessions = false;
+  };
   // Connects to the bus at `busAddress`, or to the session bus when it is empty.
   static platform::Result<std::unique_ptr<SavedRecordingServiceClient>> connect(
       const std::string& busAddress = {});
+  static platform::Result<std::unique_ptr<SavedRecordingServiceClient>> connect(
+      const std::string& busAddress, Options options);
   ~SavedRecordingServiceClient();
   SavedRecordingServiceClient(const SavedRecordingServiceClient&) = delete;
   SavedRecordingServiceClient& operator=(const SavedRecordingServiceClient&) = delete;
@@ -64,6 +73,27 @@ class SavedRecordingServiceClient {
   // Called on the client's bus thread each time the daemon says the set of
   // recordings being exported may have changed. Replaces any earlier handler.
   void setExportingCompositionAVURLsChangedHandler(std::function<void()> handler);
+
+  // Who holds a recording: the daemon's Sessions interface, beside the ten
+  // requests. A holder is what the bus says of the peer; the daemon's own
+  // sessions have none (empty bus name and command, pid 0).
+  struct AccessHolder {
+    std::string accessName;  // "capture", "preview", "export", "trimming", "finalize"
+    std::int32_t accessType = 0;
+    std::string compositionAVURL;
+    std::string state;  // "open", "closing", or "waiting" for a deferred request
+    std::chrono::system_clock::time_point since;
+    std::string busName;
+    std::uint32_t pid = 0;
+    std::uint32_t uid = 0xFFFFFFFF;  // unknown
+    std::string command;
+  };
+  // Every open and closing session; each recording's waiting request.
+  platform::Result<std::vector<AccessHolder>> listAccessSessions();
+  platform::Result<std::vector<AccessHolder>> listDeferredRequests();
+  // Called on the client's bus thread with the composition AVURL whose
+  // sessions or waiting request changed. Needs Options::watchAccessSessions.
+  void setAccessSessionsChangedHandler(std::function<void(const std::string&)> handler);
 
   struct Impl;
 

@@ -43,7 +43,9 @@
 #include <cerrno>
 #include <condition_variable>
 #include <deque>
+#include <fstream>
 #include <future>
+#include <map>
 #include <mutex>
 #include <thread>
 
@@ -66,10 +68,12 @@ Error busError(long code, const std::string& what, const sdbus::Error& error) {
 }  // namespace
 
 struct BusListener::Core {
-  // Declaration order is destruction order in reverse: the match and the
-  // object go before the connection they are registered on.
+  // Declaration order is destruction order in reverse: the match, the
+  // object and the proxy go before the connection they are registered on.
   std::unique_ptr<sdbus::IConnection> bus;
   std::unique_ptr<sdbus::IObject> object;
+  // The bus itself, asked for its peers' credentials.
+  std::unique_ptr<sdbus::IProxy> busDaemon;
   sdbus::Slot nameOwnerChangedMatch;
   std::vector<sdbus::Slot> signalMatches;
 };
@@ -141,6 +145,7 @@ BusListener::~BusListener() {
   try {
     core_->nameOwnerChangedMatch.reset();
     core_->signalMatches.clear();
+    core_->busDaemon.reset();
     core_->object.reset();
   } catch (const std::exception& error) {
     QV_LOG(kLogLevelError, "unregistering the listener failed: {}", error.what());
@@ -183,18 +188,20 @@ Status BusListener::resume() {
           QV_LOG(kLogLevelError, "handler of {} threw: {}", method->name, error.what());
         }
       };
+      const std::string& on = declared.interface.empty() ? interface.name : declared.interface;
       bool named = !declared.inputNames.empty() || !declared.outputNames.empty();
       if (named) {
-        core_->object->registerMethod(interface.name, declared.name, declared.inputSignature,
+        core_->object->registerMethod(on, declared.name, declared.inputSignature,
                                       declared.inputNames, declared.outputSignature,
                                       declared.outputNames, std::move(callback), flags);
       } else {
-        core_->object->registerMethod(interface.name, declared.name, declared.inputSignature,
+        core_->object->registerMethod(on, declared.name, declared.inputSignature,
                                       declared.outputSignature, std::move(callback), flags);
       }
     }
     for (const SignalDescription& signal : interface.signals) {
-      core_->object->registerSignal(interface.name, signal.name, signal.signature, signal.names);
+      core_->object->registerSignal(*interfaceOfSignal(signal.name), signal.name, signal.signature,
+                                    signal.names);
     }
     core_->object->finishRegistration();
   } catch (const sdbus::Error& error) {
@@ -224,10 +231,13 @@ Status BusListener::resume() {
         }
       }));
     }
+    core_->busDaemon =
+        sdbus::createProxy(*core_->bus, "org.freedesktop.DBus", "/org/freedesktop/DBus");
     if (!options_.serviceName.empty()) core_->bus->requestName(options_.serviceName);
   } catch (const sdbus::Error& error) {
     core_->nameOwnerChangedMatch.reset();
     core_->signalMatches.clear();
+    core_->busDaemon.reset();
     core_->object.reset();
     core_->bus.reset();
     return fail(busError(4, "cannot own the name '" + options_.serviceName + "'", error));
@@ -304,12 +314,95 @@ void BusListener::emitSignal(const std::string& name, const BusValues& arguments
     std::lock_guard lock(loop_->mutex);
     if (!loop_->running) return;
   }
+  const std::string* interface = interfaceOfSignal(name);
   try {
-    auto signal = core_->object->createSignal(interfaceDescription().name, name);
+    auto signal =
+        core_->object->createSignal(interface ? *interface : interfaceDescription().name, name);
     sdbuscodec::appendValues(signal, arguments);
     core_->object->emitSignal(signal);
   } catch (const sdbus::Error& error) {
     QV_LOG(kLogLevelError, "cannot emit signal {}: {}", name, error.what());
+  }
+}
+
+namespace {
+
+// The command name of process `pid`, as the kernel keeps it; empty when it
+// cannot be read.
+std::string commandOf(std::uint32_t pid) {
+  if (pid == 0) return {};
+  std::ifstream comm("/proc/" + std::to_string(pid) + "/comm");
+  std::string name;
+  std::getline(comm, name);
+  return name;
+}
+
+PeerCredentials credentialsFrom(sdbus::MethodReply& reply) {
+  PeerCredentials credentials;
+  std::map<std::string, sdbus::Variant> fields;
+  reply >> fields;
+  if (auto pid = fields.find("ProcessID"); pid != fields.end())
+    credentials.pid = pid->second.get<std::uint32_t>();
+  if (auto uid = fields.find("UnixUserID"); uid != fields.end())
+    credentials.uid = uid->second.get<std::uint32_t>();
+  credentials.command = commandOf(credentials.pid);
+  return credentials;
+}
+
+}  // namespace
+
+void BusListener::credentialsOfPeers(std::vector<std::string> uniqueNames,
+                                     CredentialsCompletion completion) {
+  struct Gathering {
+    PeerCredentialsTable table;
+    std::size_t pending = 1;  // the asking itself, until every call is sent
+    CredentialsCompletion completion;
+    void done() {
+      if (--pending == 0) completion(std::move(table));
+    }
+  };
+  auto gathering = std::make_shared<Gathering>();
+  gathering->completion = std::move(completion);
+  auto ask = [this, gathering, names = std::move(uniqueNames)] {
+    for (const std::string& name : names) {
+      if (gathering->table.contains(name)) continue;
+      auto connection = this->connection(name);
+      if (auto known = connection ? connection->credentials() : std::nullopt) {
+        gathering->table[name] = *known;
+        continue;
+      }
+      gathering->table[name] = PeerCredentials();
+      ++gathering->pending;
+      try {
+        auto call =
+            core_->busDaemon->createMethodCall("org.freedesktop.DBus", "GetConnectionCredentials");
+        call << name;
+        core_->busDaemon->callMethod(
+            call,
+            [gathering, name, connection](sdbus::MethodReply& reply, const sdbus::Error* error) {
+              if (!error) {
+                try {
+                  PeerCredentials credentials = credentialsFrom(reply);
+                  if (connection) connection->setCredentials(credentials);
+                  gathering->table[name] = std::move(credentials);
+                } catch (const sdbus::Error&) {
+                  // A malformed answer: the peer is listed without credentials.
+                }
+              }
+              gathering->done();
+            });
+      } catch (const sdbus::Error& error) {
+        QV_LOG(kLogLevelDebug, "cannot ask for the credentials of {}: {}", name, error.what());
+        --gathering->pending;
+      }
+    }
+    gathering->done();
+  };
+  if (isOnBusThread()) {
+    ask();
+  } else if (!performOnBusThread(ask)) {
+    // Not listening: nobody can be asked.
+    gathering->done();
   }
 }
 

@@ -44,6 +44,10 @@ class BusListener final : public Listener {
   Status resume() override;
   // Broadcasts the signal from the object path. Does nothing unless running.
   void emitSignal(const std::string& name, const BusValues& arguments = {}) override;
+  // Asks the bus (GetConnectionCredentials, asynchronously, on the bus
+  // thread) for the peers whose connections do not know theirs yet.
+  void credentialsOfPeers(std::vector<std::string> uniqueNames,
+                          CredentialsCompletion completion) override;
   // Releases the well-known name, on the bus thread; waits for the answer.
   Status releaseName() override;
   // Stops reading after delivering every message already received, then

@@ -32,6 +32,10 @@ bool parseCompleteType(std::string_view signature, std::size_t& pos, int depth) 
         pos += 2;
         return true;
       }
+      if (pos + 1 < signature.size() && signature[pos + 1] == '(') {
+        ++pos;
+        return parseCompleteType(signature, pos, depth + 1);
+      }
       return false;
     case '(': {
       if (depth >= kMaxStructDepth) return false;
@@ -57,6 +61,17 @@ BusValue BusValue::structure(std::vector<BusValue> fields) {
   return BusValue(StructFields{std::move(fields)});
 }
 
+BusValue BusValue::array(std::string elementSignature, std::vector<BusValue> elements) {
+  QV_MISUSE(!elementSignature.starts_with('(') || !isSupportedSignature(elementSignature),
+            "BusValue: arrays hold structs, not {}", elementSignature);
+  for (const BusValue& element : elements) {
+    QV_MISUSE(element.signature() != elementSignature,
+              "BusValue: an element of signature {} in an array of {}", element.signature(),
+              elementSignature);
+  }
+  return BusValue(ArrayElements{std::move(elementSignature), std::move(elements)});
+}
+
 std::string BusValue::signature() const {
   switch (kind()) {
     case Kind::Bool:
@@ -75,6 +90,8 @@ std::string BusValue::signature() const {
       return "as";
     case Kind::Struct:
       return fmt::format("({})", signatureOf(std::get<StructFields>(value_).fields));
+    case Kind::Array:
+      return "a" + std::get<ArrayElements>(value_).elementSignature;
   }
   return {};
 }
@@ -119,6 +136,11 @@ const std::vector<BusValue>& BusValue::fields() const {
   wrongKind("struct fields", *this);
 }
 
+const std::vector<BusValue>& BusValue::elements() const {
+  if (auto* v = std::get_if<ArrayElements>(&value_)) return v->elements;
+  wrongKind("array elements", *this);
+}
+
 std::string BusValue::debugDescription() const {
   switch (kind()) {
     case Kind::Bool:
@@ -141,13 +163,16 @@ std::string BusValue::debugDescription() const {
       }
       return text + "]";
     }
-    case Kind::Struct: {
-      std::string text = "(";
-      for (std::size_t i = 0; i < fields().size(); ++i) {
+    case Kind::Struct:
+    case Kind::Array: {
+      const bool isStruct = kind() == Kind::Struct;
+      const auto& values = isStruct ? fields() : elements();
+      std::string text = isStruct ? "(" : "a[";
+      for (std::size_t i = 0; i < values.size(); ++i) {
         if (i) text += ", ";
-        text += fields()[i].debugDescription();
+        text += values[i].debugDescription();
       }
-      return text + ")";
+      return text + (isStruct ? ")" : "]");
     }
   }
   return {};

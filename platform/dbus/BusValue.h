@@ -1,8 +1,9 @@
 // BusValue: one argument or reply value of a bus method call, in the small
 // subset of D-Bus types the service contract uses: boolean (b), int32 (i),
-// uint32 (u), int64 (x), double (d), string (s), array of strings (as) and
-// structs of those ("(siss)"). A plain value type: copyable, comparable,
-// safe to hand between threads like any other value.
+// uint32 (u), int64 (x), double (d), string (s), array of strings (as),
+// structs of those ("(siss)") and arrays of structs ("a(sis)"). A plain value
+// type: copyable, comparable, safe to hand between threads like any other
+// value.
 //
 // Asking a value for a kind it does not hold (asString() on an int32) is a
 // programming error and throws std::logic_error; code that reads outside
@@ -21,7 +22,7 @@ namespace platform {
 
 class BusValue {
  public:
-  enum class Kind { Bool, Int32, UInt32, Int64, Double, String, StringArray, Struct };
+  enum class Kind { Bool, Int32, UInt32, Int64, Double, String, StringArray, Struct, Array };
 
   // The empty string.
   BusValue() : value_(std::string()) {}
@@ -37,6 +38,9 @@ class BusValue {
 
   // A struct of the given fields, in order. A struct needs at least one field.
   static BusValue structure(std::vector<BusValue> fields);
+  // An array of structs of signature `elementSignature` ("(sis)"); every
+  // element must have that signature.
+  static BusValue array(std::string elementSignature, std::vector<BusValue> elements);
 
   Kind kind() const { return static_cast<Kind>(value_.index()); }
   // The D-Bus type signature of this one value: "b", "s", "as", "(siss)"...
@@ -50,6 +54,7 @@ class BusValue {
   const std::string& asString() const;
   const std::vector<std::string>& asStringArray() const;
   const std::vector<BusValue>& fields() const;
+  const std::vector<BusValue>& elements() const;
 
   // A text for logs and test failures: 's:"abc"', '(i:1, s:"x")'.
   std::string debugDescription() const;
@@ -61,9 +66,15 @@ class BusValue {
     std::vector<BusValue> fields;
     friend bool operator==(const StructFields&, const StructFields&) = default;
   };
+  struct ArrayElements {
+    std::string elementSignature;
+    std::vector<BusValue> elements;
+    friend bool operator==(const ArrayElements&, const ArrayElements&) = default;
+  };
   using Storage = std::variant<bool, std::int32_t, std::uint32_t, std::int64_t, double, std::string,
-                               std::vector<std::string>, StructFields>;
+                               std::vector<std::string>, StructFields, ArrayElements>;
   explicit BusValue(StructFields fields) : value_(std::move(fields)) {}
+  explicit BusValue(ArrayElements elements) : value_(std::move(elements)) {}
 
   Storage value_;
 };
@@ -75,8 +86,8 @@ using BusValues = std::vector<BusValue>;
 std::string signatureOf(const BusValues& values);
 
 // Whether `signature` is a sequence of complete types that BusValue can hold
-// (b, i, u, x, d, s, as, and non-empty structs of these, nested at most 32
-// deep). The empty signature is valid: no values.
+// (b, i, u, x, d, s, as, non-empty structs of these nested at most 32 deep,
+// and arrays of such structs). The empty signature is valid: no values.
 bool isSupportedSignature(std::string_view signature);
 
 // Splits a valid signature into its complete types: "s(siss)b" ->

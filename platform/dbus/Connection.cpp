@@ -103,6 +103,16 @@ void Connection::resume() {
 
 bool Connection::isResumed() const { return resumed_.load(std::memory_order_acquire); }
 
+std::optional<PeerCredentials> Connection::credentials() const {
+  std::lock_guard lock(mutex_);
+  return credentials_;
+}
+
+void Connection::setCredentials(PeerCredentials credentials) {
+  std::lock_guard lock(mutex_);
+  credentials_ = std::move(credentials);
+}
+
 std::shared_ptr<Connection> Connection::current() {
   return tCurrentConnection ? tCurrentConnection->shared_from_this() : nullptr;
 }

@@ -25,16 +25,28 @@
 
 #include <any>
 #include <atomic>
+#include <cstdint>
 #include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 
 namespace platform {
 
 class IncomingCall;
 class Listener;
+
+// What the bus says of a peer: its process, user and command. Empty fields
+// (pid 0, uid kUnknownUser, no command) when it could not be read.
+struct PeerCredentials {
+  static constexpr std::uint32_t kUnknownUser = 0xFFFFFFFF;
+  std::uint32_t pid = 0;
+  std::uint32_t uid = kUnknownUser;
+  std::string command;
+  friend bool operator==(const PeerCredentials&, const PeerCredentials&) = default;
+};
 
 class Connection : public std::enable_shared_from_this<Connection> {
  public:
@@ -77,6 +89,11 @@ class Connection : public std::enable_shared_from_this<Connection> {
   // Whether the connection has been invalidated or interrupted.
   bool hasEnded() const { return ended_.load(std::memory_order_acquire); }
 
+  // The peer's credentials once a listener has asked the bus for them (a
+  // unique name's process never changes, so they are asked once).
+  std::optional<PeerCredentials> credentials() const;
+  void setCredentials(PeerCredentials credentials);
+
   // The connection whose call is being delivered on the calling thread, or
   // nullptr outside a delivery.
   static std::shared_ptr<Connection> current();
@@ -106,6 +123,7 @@ class Connection : public std::enable_shared_from_this<Connection> {
 
   mutable std::mutex mutex_;  // guards the fields below
   std::unique_ptr<std::map<std::string, std::any>> userInfo_;
+  std::optional<PeerCredentials> credentials_;
   Handler invalidationHandler_;
   Handler interruptionHandler_;
 

@@ -38,6 +38,20 @@ std::shared_ptr<Connection> Listener::connection(const std::string& uniqueName) 
   return it == connections_.end() ? nullptr : it->second;
 }
 
+void Listener::credentialsOfPeers(std::vector<std::string> uniqueNames,
+                                  CredentialsCompletion completion) {
+  PeerCredentialsTable table;
+  for (std::string& name : uniqueNames) table[std::move(name)] = PeerCredentials();
+  completion(std::move(table));
+}
+
+const std::string* Listener::interfaceOfSignal(std::string_view name) const {
+  for (const SignalDescription& signal : interface_.signals) {
+    if (signal.name == name) return signal.interface.empty() ? &interface_.name : &signal.interface;
+  }
+  return nullptr;
+}
+
 Status Listener::validateInterface() const {
   auto invalid = [](std::string what) {
     return fail(Error("BusTransportErrorDomain", 1, "invalid interface: " + what));

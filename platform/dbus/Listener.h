@@ -37,6 +37,9 @@ namespace platform {
 
 class Listener;
 
+using PeerCredentialsTable = std::map<std::string, PeerCredentials>;
+using CredentialsCompletion = std::move_only_function<void(PeerCredentialsTable credentials)>;
+
 // One method of the published interface.
 struct MethodDescription {
   std::string name;
@@ -46,6 +49,9 @@ struct MethodDescription {
   std::vector<std::string> outputNames;
   bool noReply = false;               // annotated as a method that sends no reply
   Connection::MethodHandler handler;  // runs on the delivery thread
+  // The interface it belongs to when not the description's own (an object
+  // may publish a second interface beside its main one).
+  std::string interface;
 };
 
 // One signal of the published interface.
@@ -53,6 +59,7 @@ struct SignalDescription {
   std::string name;
   std::string signature;
   std::vector<std::string> names;
+  std::string interface;  // as for methods: empty for the description's own
 };
 
 // A broadcast signal the listener receives, from any sender on the bus.
@@ -106,6 +113,14 @@ class Listener {
   virtual Status resume() = 0;
   // Broadcasts signal `name` of the interface with `arguments`.
   virtual void emitSignal(const std::string& name, const BusValues& arguments = {}) = 0;
+  // What the bus says of each peer (by unique name): its process id, user
+  // id and command name, from the bus's credentials of the peer, asked once
+  // per connection and kept with it. `completion` runs on the delivery
+  // thread once every answer is in; a peer whose credentials cannot be read
+  // gets empty fields. Never blocks the caller. Any thread.
+  // This base answers at once with empty fields.
+  virtual void credentialsOfPeers(std::vector<std::string> uniqueNames,
+                                  CredentialsCompletion completion);
   // Gives up the published name: new callers no longer reach this listener.
   virtual Status releaseName() = 0;
   // Orderly stop: delivers what has already been received, then stops
@@ -114,6 +129,9 @@ class Listener {
   virtual void stop() = 0;
 
   const InterfaceDescription& interfaceDescription() const { return interface_; }
+  // The interface signal `name` belongs to (the description's own when it
+  // names none), or nullptr for a signal not described.
+  const std::string* interfaceOfSignal(std::string_view name) const;
   // The method `name` of the interface, or nullptr.
   const MethodDescription* method(std::string_view name) const;
 

@@ -92,6 +92,24 @@ void LocalListener::emitSignal(const std::string& name, const BusValues& argumen
   signals_.emplace_back(name, arguments);
 }
 
+void LocalListener::credentialsOfPeers(std::vector<std::string> uniqueNames,
+                                       CredentialsCompletion completion) {
+  PeerCredentialsTable table;
+  {
+    std::lock_guard lock(stateMutex_);
+    for (const std::string& name : uniqueNames) {
+      auto known = credentials_.find(name);
+      table[name] = known == credentials_.end() ? PeerCredentials() : known->second;
+    }
+  }
+  completion(std::move(table));
+}
+
+void LocalListener::setPeerCredentials(const std::string& uniqueName, PeerCredentials credentials) {
+  std::lock_guard lock(stateMutex_);
+  credentials_[uniqueName] = std::move(credentials);
+}
+
 Status LocalListener::releaseName() {
   std::lock_guard lock(stateMutex_);
   nameReleased_ = true;

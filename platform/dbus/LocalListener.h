@@ -59,6 +59,11 @@ class LocalListener final : public Listener {
   Status resume() override;
   // Records the signal (see emittedSignals()).
   void emitSignal(const std::string& name, const BusValues& arguments = {}) override;
+  // The credentials set with setPeerCredentials() (empty fields for other
+  // peers), at once, on the calling thread.
+  void credentialsOfPeers(std::vector<std::string> uniqueNames,
+                          CredentialsCompletion completion) override;
+  void setPeerCredentials(const std::string& uniqueName, PeerCredentials credentials);
   Status releaseName() override;
   void stop() override;
 
@@ -100,6 +105,7 @@ class LocalListener final : public Listener {
   bool nameReleased_ = false;
   bool stopped_ = false;
   std::vector<std::pair<std::string, BusValues>> signals_;
+  PeerCredentialsTable credentials_;
   std::vector<Received> received_;
 };
 

@@ -34,6 +34,26 @@ bool readOne(sdbus::Message& message, std::string_view type, BusValues& out) {
     case 's':
       return readBasic<std::string>(message, out);
     case 'a': {
+      if (type[1] == '(') {
+        const std::string element(type.substr(1));
+        if (!message.enterContainer(element)) return false;
+        BusValues elements;
+        while (message.enterStruct(element.substr(1, element.size() - 2))) {
+          auto types = splitSignature(std::string_view(element).substr(1, element.size() - 2));
+          if (!types) return false;
+          BusValues fields;
+          for (std::string_view field : *types) {
+            if (!readOne(message, field, fields)) return false;
+          }
+          message.exitStruct();
+          elements.push_back(BusValue::structure(std::move(fields)));
+        }
+        message.clearFlags();
+        message.exitContainer();
+        if (!message) return false;
+        out.push_back(BusValue::array(element, std::move(elements)));
+        return true;
+      }
       if (!message.enterContainer("s")) return false;
       std::vector<std::string> strings;
       while (true) {
@@ -99,6 +119,11 @@ void appendOne(sdbus::Message& message, const BusValue& value) {
       message.closeStruct();
       break;
     }
+    case BusValue::Kind::Array:
+      message.openContainer(value.signature().substr(1));
+      for (const BusValue& element : value.elements()) appendOne(message, element);
+      message.closeContainer();
+      break;
   }
 }
 

@@ -1,13 +1,14 @@
-// The interface the daemon publishes is the one the packaged XML documents:
-// the same methods, in the same order, with the same arguments, reply
-// arguments and no-reply annotations, the same signal, and the service's
-// object path, bus name and error names.
+// The interfaces the daemon publishes are the ones the packaged XML files
+// document: the same methods, in the same order, with the same arguments,
+// reply arguments and no-reply annotations, the same signals, and the
+// service's object path, bus name and error names.
 #include <gtest/gtest.h>
 
 #include <fstream>
 #include <regex>
 #include <sstream>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "Quorvel/service/RCSSavedRecordingServiceConnection.h"
@@ -46,38 +47,55 @@ std::vector<XmlMethod> methodsInXML(const std::string& xml, std::vector<std::str
   return methods;
 }
 
-TEST(ServiceInterfaceTest, PublishedInterfaceMatchesThePackagedContract) {
-  std::ifstream file(std::string(QUORVEL_SOURCE_DIR) +
-                     "/packaging/org.quorvel.SavedRecordingService1.xml");
-  std::stringstream text;
-  text << file.rdbuf();
-  const std::string xml = std::regex_replace(text.str(), std::regex("<!--[\\s\\S]*?-->"), "");
-  std::vector<std::string> signals;
-  auto documented = methodsInXML(xml, signals);
+// Each packaged XML file documents one interface of the object: the
+// contract's, and the session listing's beside it.
+TEST(ServiceInterfaceTest, PublishedInterfacesMatchThePackagedXML) {
   auto published = RCSSavedRecordingServiceConnection::serviceInterface();
-
   EXPECT_EQ(published.name, "org.quorvel.SavedRecordingService1");
-  ASSERT_EQ(documented.size(), 10u);
-  ASSERT_EQ(published.methods.size(), documented.size());
-  for (std::size_t i = 0; i < documented.size(); ++i) {
-    const auto& declared = published.methods[i];
-    const auto& xml = documented[i];
-    SCOPED_TRACE(xml.name);
-    EXPECT_EQ(declared.name, xml.name);
-    EXPECT_EQ(declared.inputSignature, xml.in);
-    EXPECT_EQ(declared.outputSignature, xml.out);
-    EXPECT_EQ(declared.inputNames, xml.inNames);
-    EXPECT_EQ(declared.outputNames, xml.outNames);
-    EXPECT_EQ(declared.noReply, xml.noReply);
+  for (const auto& [interface, file, methodCount] :
+       {std::tuple{std::string(published.name), "org.quorvel.SavedRecordingService1.xml", 10u},
+        {RCSSavedRecordingServiceSessionsInterfaceName,
+         "org.quorvel.SavedRecordingService1.Sessions.xml", 2u}}) {
+    SCOPED_TRACE(file);
+    std::ifstream in(std::string(QUORVEL_SOURCE_DIR) + "/packaging/" + file);
+    std::stringstream text;
+    text << in.rdbuf();
+    const std::string xml = std::regex_replace(text.str(), std::regex("<!--[\\s\\S]*?-->"), "");
+    std::vector<std::string> signals;
+    auto documented = methodsInXML(xml, signals);
+    auto on = [&](const std::string& declaredOn) {
+      return (declaredOn.empty() ? published.name : declaredOn) == interface;
+    };
+    std::vector<platform::MethodDescription> methods;
+    for (const auto& method : published.methods)
+      if (on(method.interface)) methods.push_back(method);
+    std::vector<std::string> publishedSignals;
+    for (const auto& signal : published.signals)
+      if (on(signal.interface)) publishedSignals.push_back(signal.name);
+    ASSERT_EQ(documented.size(), methodCount);
+    ASSERT_EQ(methods.size(), documented.size());
+    for (std::size_t i = 0; i < documented.size(); ++i) {
+      SCOPED_TRACE(documented[i].name);
+      EXPECT_EQ(methods[i].name, documented[i].name);
+      EXPECT_EQ(methods[i].inputSignature, documented[i].in);
+      EXPECT_EQ(methods[i].outputSignature, documented[i].out);
+      EXPECT_EQ(methods[i].inputNames, documented[i].inNames);
+      EXPECT_EQ(methods[i].outputNames, documented[i].outNames);
+      EXPECT_EQ(methods[i].noReply, documented[i].noReply);
+    }
+    EXPECT_EQ(signals, publishedSignals);
+    EXPECT_NE(xml.find("interface name=\"" + interface + "\""), std::string::npos);
+    EXPECT_NE(xml.find(RCSSavedRecordingServiceObjectPath), std::string::npos);
   }
-  ASSERT_EQ(published.signals.size(), 1u);
-  EXPECT_EQ(signals, std::vector<std::string>{published.signals[0].name});
-  EXPECT_NE(xml.find(RCSSavedRecordingServiceObjectPath), std::string::npos);
-  EXPECT_NE(xml.find(RCSSavedRecordingServiceMachServiceName), std::string::npos);
+  std::ifstream in(std::string(QUORVEL_SOURCE_DIR) +
+                   "/packaging/org.quorvel.SavedRecordingService1.xml");
+  std::stringstream contract;
+  contract << in.rdbuf();
+  EXPECT_NE(contract.str().find(RCSSavedRecordingServiceMachServiceName), std::string::npos);
   for (const char* name : {RCSDBusErrorMissingCompositionAVURL, RCSDBusErrorConflictingSession,
                            RCSDBusErrorDeferredRequestSuperseded, RCSDBusErrorCompositionFailed,
                            RCSDBusErrorGeneric}) {
-    EXPECT_NE(xml.find(name), std::string::npos) << name;
+    EXPECT_NE(contract.str().find(name), std::string::npos) << name;
   }
 }
 
