@@ -8,6 +8,7 @@
 // are compared by identity. Readable from any thread.
 #pragma once
 
+#include <chrono>
 #include <memory>
 #include <string>
 
@@ -28,6 +29,8 @@ class AssetAccessSession {
   const platform::URL& compositionAVURL() const { return _compositionAVURL; }
   const std::shared_ptr<platform::Connection>& xpcConnection() const { return _xpcConnection; }
   const std::shared_ptr<RCSXPCTransaction>& xpcTransaction() const { return _xpcTransaction; }
+  // When the session was made (the wall clock, for listings).
+  std::chrono::system_clock::time_point openedAt() const { return _openedAt; }
 
   // "<AssetAccessSession 0x…> <token's debug description>"
   std::string debugDescription() const;
@@ -37,6 +40,7 @@ class AssetAccessSession {
   const platform::URL _compositionAVURL;
   const std::shared_ptr<platform::Connection> _xpcConnection;
   const std::shared_ptr<RCSXPCTransaction> _xpcTransaction;
+  const std::chrono::system_clock::time_point _openedAt = std::chrono::system_clock::now();
 };
 
 }  // namespace quorvel

@@ -53,6 +53,7 @@ void SavedRecordingService::_onServiceQueueOpenAccessSessionNamed(
   auto session = _assetSesionController->openAccessSessionWithName(
       name, xpcConnection, compositionAVURL, exclusive, &error);
   if (session) {
+    _onQueueNoteAccessSessionsChanged(compositionAVURL);
     // The client gets its token only once the recording's orphaned
     // fragments have been dealt with.
     _attemptOrphanedFragmentsCleanupForCompositionAVURL(
@@ -75,15 +76,19 @@ void SavedRecordingService::_onServiceQueueOpenAccessSessionNamed(
   // service without owning it.
   DeferredAccessRequest request{
       .connection = xpcConnection,
-      .run = [this, name, compositionAVURL, exclusive, xpcConnection,
-              handler = std::move(accessSessionHandler)](bool cancelled) mutable {
-        _onServiceQueueRunDeferredAccessRequest(name, compositionAVURL, exclusive,
-                                                std::move(xpcConnection), std::move(handler),
-                                                cancelled);
-      }};
+      .run =
+          [this, name, compositionAVURL, exclusive, xpcConnection,
+           handler = std::move(accessSessionHandler)](bool cancelled) mutable {
+            _onServiceQueueRunDeferredAccessRequest(name, compositionAVURL, exclusive,
+                                                    std::move(xpcConnection), std::move(handler),
+                                                    cancelled);
+          },
+      .name = name,
+      .exclusive = exclusive};
   QV_LOG(platform::kLogLevelDebug, "scheduling deferred access for '{}' request", name);
   _compositionAVURLsDeferredAccessRequestBlocksByAVURL.insert_or_assign(compositionAVURL,
                                                                         std::move(request));
+  _onQueueNoteAccessSessionsChanged(compositionAVURL);
 }
 
 void SavedRecordingService::_onServiceQueueRunDeferredAccessRequest(
@@ -151,6 +156,7 @@ void SavedRecordingService::_onQueueCloseAccessSession(
   QV_DCHECK_ON_QUEUE(_serviceSerialQueue);
   if (!session) return;
   _closingSessions.push_back(session);
+  _onQueueNoteAccessSessionsChanged(session->compositionAVURL());
   QV_LOG(platform::kLogLevelNotice, "Closing access session: {}.", session->debugDescription());
   QV_LOG(platform::kLogLevelNotice, "Scheduling orphan fragment cleanup for closing session");
   const platform::URL& url = *session->accessToken().compositionAVURL();
@@ -191,6 +197,7 @@ bool SavedRecordingService::_onQueueFinishClosingAccessSession(
   // the already ended transaction again and looks for deferred work again.
   std::erase(_closingSessions, session);
   _assetSesionController->closeSession(session);
+  _onQueueNoteAccessSessionsChanged(session->compositionAVURL());
   return _onServiceQueueAttemptToRunningDeferredWorkAfterClosingSession(session);
 }
 
@@ -213,6 +220,7 @@ bool SavedRecordingService::_onServiceQueueRunDeferredWorkForCompositionAVURL(
   if (deferred != _compositionAVURLsDeferredAccessRequestBlocksByAVURL.end()) {
     auto run = std::move(deferred->second.run);
     _compositionAVURLsDeferredAccessRequestBlocksByAVURL.erase(deferred);
+    _onQueueNoteAccessSessionsChanged(compositionAVURL);
     run(false);
     return false;
   }
@@ -228,9 +236,18 @@ void SavedRecordingService::_handleXPCDisconnect(
   _performOnServiceQueue(
       [this, self = shared_from_this(), connection] {
         rcs_setValid(*connection, false);
-        // Its waiting request goes unanswered: there is nobody left to answer.
-        std::erase_if(_compositionAVURLsDeferredAccessRequestBlocksByAVURL,
-                      [&](const auto& entry) { return entry.second.connection == connection; });
+        // Its waiting request goes unanswered: there is nobody left to
+        // answer. What waited behind it gets the turn instead.
+        std::vector<platform::URL> dropped;
+        std::erase_if(_compositionAVURLsDeferredAccessRequestBlocksByAVURL, [&](const auto& entry) {
+          if (entry.second.connection != connection) return false;
+          dropped.push_back(entry.first);
+          return true;
+        });
+        for (const platform::URL& url : dropped) {
+          _onQueueNoteAccessSessionsChanged(url);
+          _onServiceQueueRunDeferredWorkForCompositionAVURL(url);
+        }
         for (const auto& session :
              _assetSesionController->activeSessionsWithXPCConnection(connection)) {
           QV_LOG(platform::kLogLevelNotice,

@@ -13,6 +13,8 @@
 //                                          close procedure, disconnection
 //   SavedRecordingService.OrphanHandling.cpp  fragment cleanup and its holds,
 //                                          the orphan-handling switch
+//   SavedRecordingService.Holders.cpp      who holds a recording: the
+//                                          listings and their change signal
 //
 // Threads: the request methods and the listener-delegate methods run on the
 // listener's delivery thread (the bus thread); they only check arguments and
@@ -22,6 +24,7 @@
 // _serialQueue) and the queues and listener themselves.
 #pragma once
 
+#include <chrono>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -68,7 +71,21 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   struct DeferredAccessRequest {
     std::shared_ptr<platform::Connection> connection;
     std::move_only_function<void(bool cancelled)> run;
+    // What it asks for, and since when (for listings).
+    std::string name;
+    bool exclusive = false;
+    std::chrono::system_clock::time_point since = std::chrono::system_clock::now();
   };
+  // One session or waiting request as the listings show it.
+  struct AccessListing {
+    std::string accessName;
+    bool exclusive = false;
+    platform::URL compositionAVURL;
+    const char* state = "";  // "open", "closing"; empty for a waiting request
+    std::chrono::system_clock::time_point since;
+    std::shared_ptr<platform::Connection> connection;  // none for the daemon's own
+  };
+  using AccessListingHandler = std::move_only_function<void(std::vector<AccessListing>)>;
   // Makes the listener on the service name for start(): a BusListener in
   // quorveld, a LocalListener in tests.
   using ListenerFactory = std::function<std::shared_ptr<platform::Listener>(
@@ -233,6 +250,18 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // Emits ExportingCompositionAVURLsChanged on the bus. Any thread.
   void _postExportingCompositionAVURLsChanged();
 
+  // Who holds recordings, beside the contract. Any thread: each takes a
+  // snapshot on the service serial queue and hands it to `reply` there.
+  // Every open and closing session, in the registry's order:
+  void listAccessSessions(AccessListingHandler reply);
+  // Each recording's waiting request:
+  void listDeferredRequests(AccessListingHandler reply);
+  // Notes that the recording's sessions or its waiting request changed:
+  // AccessSessionsChanged goes out for it once the work queued so far has
+  // run, once however often it changed meanwhile. Must be called on the
+  // service serial queue.
+  void _onQueueNoteAccessSessionsChanged(const platform::URL& compositionAVURL);
+
   // Tests: the service's waiting state. Must be called on the service
   // serial queue.
   std::size_t closingSessionCountForTesting() const { return _closingSessions.size(); }
@@ -328,6 +357,8 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   std::vector<platform::URL> _compositionAVURLsToFinalize;
   std::unordered_map<platform::URL, DeferredAccessRequest>
       _compositionAVURLsDeferredAccessRequestBlocksByAVURL;
+  // Recordings whose AccessSessionsChanged is due at the end of this turn.
+  std::unordered_set<platform::URL> _accessSessionsChangedCompositionAVURLs;
   // Counted set: recording -> number of connections holding its cleanup off.
   std::unordered_map<platform::URL, std::size_t> _disabledOrphanedFragmentCleanupByCompositionAVURL;
   // A fragment cleanup that reads or deletes, by its recording's bundle

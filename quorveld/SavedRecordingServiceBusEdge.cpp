@@ -8,6 +8,8 @@
 
 #include <fmt/format.h>
 
+#include <chrono>
+#include <cstdint>
 #include <string_view>
 #include <utility>
 
@@ -147,6 +149,66 @@ void fetchExportingCompositionAVURLs(SavedRecordingService& service, platform::I
   service.fetchExportingCompositionAVURLs(urlSetHandlerFor(std::move(call)));
 }
 
+// Microseconds since the Unix epoch, as D-Bus services give times.
+std::int64_t microsecondsSinceEpoch(std::chrono::system_clock::time_point time) {
+  return std::chrono::duration_cast<std::chrono::microseconds>(time.time_since_epoch()).count();
+}
+
+// Answers `call` with `listing`, each entry with its holder's credentials,
+// asked of the listener once the snapshot is taken (never on the service
+// queue's time). `withState` adds the state field of the session listing.
+void replyWithHolders(SavedRecordingService& service, platform::IncomingCall call,
+                      std::vector<SavedRecordingService::AccessListing> listing, bool withState) {
+  std::vector<std::string> peers;
+  for (const auto& entry : listing) {
+    if (entry.connection) peers.push_back(entry.connection->uniqueName());
+  }
+  auto listener = service.listener();
+  auto answer = [call = std::move(call), listing = std::move(listing),
+                 withState](platform::PeerCredentialsTable holders) mutable {
+    std::vector<platform::BusValue> elements;
+    elements.reserve(listing.size());
+    for (const auto& entry : listing) {
+      const std::string peer = entry.connection ? entry.connection->uniqueName() : std::string();
+      const auto found = holders.find(peer);
+      const platform::PeerCredentials holder =
+          found == holders.end() ? platform::PeerCredentials() : found->second;
+      std::vector<platform::BusValue> fields = {
+          entry.accessName,
+          std::int32_t(entry.exclusive ? RCSSavedRecordingAccessTypeExclusive
+                                       : RCSSavedRecordingAccessTypeShared),
+          entry.compositionAVURL.absoluteString()};
+      if (withState) fields.emplace_back(entry.state);
+      fields.insert(fields.end(), {microsecondsSinceEpoch(entry.since), peer, holder.pid,
+                                   holder.uid, holder.command});
+      elements.push_back(platform::BusValue::structure(std::move(fields)));
+    }
+    call.reply(
+        {platform::BusValue::array(withState ? "(sissxsuus)" : "(sisxsuus)", std::move(elements))});
+  };
+  if (listener) {
+    listener->credentialsOfPeers(std::move(peers), std::move(answer));
+  } else {
+    answer({});
+  }
+}
+
+void listAccessSessions(SavedRecordingService& service, platform::IncomingCall call) {
+  service.listAccessSessions(
+      [self = service.shared_from_this(),
+       call = std::move(call)](std::vector<SavedRecordingService::AccessListing> listing) mutable {
+        replyWithHolders(*self, std::move(call), std::move(listing), /*withState=*/true);
+      });
+}
+
+void listDeferredRequests(SavedRecordingService& service, platform::IncomingCall call) {
+  service.listDeferredRequests(
+      [self = service.shared_from_this(),
+       call = std::move(call)](std::vector<SavedRecordingService::AccessListing> listing) mutable {
+        replyWithHolders(*self, std::move(call), std::move(listing), /*withState=*/false);
+      });
+}
+
 constexpr std::pair<std::string_view, Handler> kHandlers[] = {
     {RCSMethodPrepareToCapture, prepareToCapture},
     {RCSMethodPrepareToPreview, prepareToPreview},
@@ -158,6 +220,8 @@ constexpr std::pair<std::string_view, Handler> kHandlers[] = {
     {RCSMethodDisableOrphanHandling, disableOrphanHandling},
     {RCSMethodEnableOrphanHandling, enableOrphanHandling},
     {RCSMethodFetchExportingCompositionAVURLs, fetchExportingCompositionAVURLs},
+    {RCSMethodListAccessSessions, listAccessSessions},
+    {RCSMethodListDeferredRequests, listDeferredRequests},
 };
 
 Handler handlerFor(std::string_view method) {
