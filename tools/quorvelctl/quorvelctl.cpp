@@ -17,6 +17,7 @@
 #include <CLI/CLI.hpp>
 #include <nlohmann/json.hpp>
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <csignal>
@@ -34,6 +35,7 @@
 #include "Quorvel/service/SavedRecordingServiceClient.h"
 #include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "platform/Subprocess.h"
+#include "tools/quorvelctl/Holders.h"
 #include "tools/quorvelctl/Recordings.h"
 #include "tools/quorvelctl/WaveformPicture.h"
 
@@ -155,7 +157,9 @@ int main(int argc, char** argv) {
     std::string url;
     bool cacheWaveform = false;
     std::vector<std::string> command;
+    double waitSeconds = 0;  // with --wait: how long; negative for no limit
     CLI::App* sub = nullptr;
+    CLI::Option* wait = nullptr;
   };
   std::vector<Prepare> prepares = {
       {"capture", "get exclusive access to record into a recording"},
@@ -171,6 +175,10 @@ int main(int argc, char** argv) {
       prepare.sub->add_flag("--cache-waveform", prepare.cacheWaveform,
                             "also compute and keep the waveform");
     }
+    prepare.wait = prepare.sub->add_flag(
+        "--wait{-1}", prepare.waitSeconds,
+        "when another session holds the recording, wait until it is free (--wait=SECONDS: "
+        "at most that long), as flock -w does");
     prepare.sub->add_option("command", prepare.command,
                             "after --: run this while holding access, then end the session");
   }
@@ -196,6 +204,10 @@ int main(int argc, char** argv) {
       app.add_subcommand("fetch-exporting", "list the recordings whose export is being prepared");
   auto* watch = app.add_subcommand(
       "watch", "print the exporting set each time it changes, until interrupted");
+  std::string sessionsURL;
+  auto* sessions = app.add_subcommand(
+      "sessions", "list who holds which recording: open, closing and waiting sessions");
+  sessions->add_option("url", sessionsURL, "only this recording's");
 
   std::string title;
   std::vector<std::string> files;
@@ -235,7 +247,10 @@ int main(int argc, char** argv) {
   if (*info) return quorvelctl::showRecording(infoURL, globals.json);
   if (*waveform) return quorvelctl::drawWaveform(waveformURL, pngPath, pictureSize);
 
-  auto connected = SavedRecordingServiceClient::connect(globals.busAddress);
+  const bool waits = std::ranges::any_of(
+      prepares, [](const Prepare& prepare) { return *prepare.sub && prepare.wait->count() > 0; });
+  auto connected =
+      SavedRecordingServiceClient::connect(globals.busAddress, {.watchAccessSessions = waits});
   if (!connected) {
     std::fprintf(stderr, "quorvelctl: %s\n", connected.error().localizedDescription().c_str());
     return kExitUnreachable;
@@ -250,13 +265,27 @@ int main(int argc, char** argv) {
       return kExitUsage;
     }
     std::string_view kind = prepare.name;
-    auto token = kind == "capture"   ? client.prepareToCapture(*url)
-                 : kind == "preview" ? client.prepareToPreview(*url)
-                 : kind == "export"
-                     ? waitShowingElapsedTime(
-                           isatty(STDERR_FILENO) && !globals.json,
-                           [&] { return client.prepareToExport(*url, prepare.cacheWaveform); })
-                     : client.prepareToTrim(*url);
+    auto ask = [&] {
+      return kind == "capture"   ? client.prepareToCapture(*url)
+             : kind == "preview" ? client.prepareToPreview(*url)
+             : kind == "export"
+                 ? waitShowingElapsedTime(
+                       isatty(STDERR_FILENO) && !globals.json,
+                       [&] { return client.prepareToExport(*url, prepare.cacheWaveform); })
+                 : client.prepareToTrim(*url);
+    };
+    auto token = waits ? quorvelctl::waitForAccess(client, *url, prepare.waitSeconds, ask) : ask();
+    if (!token && quorvelctl::isConflict(token.error())) {
+      // Say who holds it, as the lock tools do.
+      const std::string holders = quorvelctl::describeHolders(client, *url);
+      if (waits) {
+        std::fprintf(stderr, "quorvelctl: gave up after %g s waiting for %s%s%s\n",
+                     prepare.waitSeconds, url->lastPathComponent().c_str(),
+                     holders.empty() ? "" : ": ", holders.c_str());
+        return kExitDaemonError;
+      }
+      if (!holders.empty()) std::fprintf(stderr, "quorvelctl: %s\n", holders.c_str());
+    }
     if (!token) return reportError(globals, token.error());
     if (!prepare.command.empty()) {
       int status = runCommand(prepare.command);
@@ -309,6 +338,18 @@ int main(int argc, char** argv) {
   if (*disableOrphans || *enableOrphans) {
     auto done = *disableOrphans ? client.disableOrphanHandling() : client.enableOrphanHandling();
     return done ? 0 : reportError(globals, done.error());
+  }
+
+  if (*sessions) {
+    std::optional<platform::URL> url;
+    if (!sessionsURL.empty()) {
+      url = parseURL(sessionsURL);
+      if (!url) {
+        std::fprintf(stderr, "quorvelctl: not a file path or file URL: %s\n", sessionsURL.c_str());
+        return kExitUsage;
+      }
+    }
+    return quorvelctl::listSessions(client, url, globals.json);
   }
 
   if (*fetch) {
