@@ -23,8 +23,82 @@ constexpr std::uint8_t kBackground[3] = {0xff, 0xff, 0xff};
 constexpr std::uint8_t kAxis[3] = {0xc8, 0xc8, 0xc8};
 constexpr std::uint8_t kWave[3] = {0x1f, 0x5f, 0xbf};
 
+constexpr std::uint8_t kText[3] = {0x50, 0x50, 0x50};
+
 void paint(std::vector<std::uint8_t>& pixels, int width, int x, int y, const std::uint8_t* rgb) {
   std::memcpy(&pixels[(std::size_t(y) * width + x) * 3], rgb, 3);
+}
+
+// The time axis: a strip of this height under the waveform, when the
+// picture is tall enough to spare it.
+constexpr int kAxisHeight = 16;
+constexpr int kMinimumHeightForAxis = 4 * kAxisHeight;
+// Labels are at least this far apart.
+constexpr int kMinimumLabelSpacing = 48;
+
+// A 3x5 font for the labels, drawn at twice that size: one row of three
+// bits per line, the top line first.
+constexpr int kGlyphScale = 2;
+constexpr std::uint8_t kGlyphs[][5] = {
+    {7, 5, 5, 5, 7}, {2, 6, 2, 2, 7}, {7, 1, 7, 4, 7}, {7, 1, 7, 1, 7},
+    {5, 5, 7, 1, 1}, {7, 4, 7, 1, 7}, {7, 4, 7, 5, 7}, {7, 1, 1, 1, 1},
+    {7, 5, 7, 5, 7}, {7, 5, 7, 1, 7}, {0, 2, 0, 2, 0},  // ':'
+    {0, 3, 6, 3, 6},                                    // 's'
+};
+
+const std::uint8_t* glyphFor(char c) {
+  if (c >= '0' && c <= '9') return kGlyphs[c - '0'];
+  if (c == ':') return kGlyphs[10];
+  if (c == 's') return kGlyphs[11];
+  return nullptr;
+}
+
+// Draws `text` with its left edge at `x` and its top at `y`, clipped to the
+// picture.
+void drawText(std::vector<std::uint8_t>& pixels, int width, int height, int x, int y,
+              std::string_view text) {
+  for (char c : text) {
+    if (const std::uint8_t* glyph = glyphFor(c)) {
+      for (int row = 0; row < 5 * kGlyphScale; ++row) {
+        for (int column = 0; column < 3 * kGlyphScale; ++column) {
+          const int px = x + column, py = y + row;
+          const bool on = glyph[row / kGlyphScale] >> (2 - column / kGlyphScale) & 1;
+          if (on && px >= 0 && px < width && py >= 0 && py < height)
+            paint(pixels, width, px, py, kText);
+        }
+      }
+    }
+    x += 4 * kGlyphScale;
+  }
+}
+
+// "7s", "45s", "1:30", "12:05": the label of `seconds` on the axis.
+std::string timeLabel(int seconds) {
+  if (seconds < 60) return fmt::format("{}s", seconds);
+  return fmt::format("{}:{:02}", seconds / 60, seconds % 60);
+}
+
+// Ticks and labels every so many seconds along the bottom strip: the
+// smallest step of 1, 2, 5, 10, 15, 30 s, 1, 2, 5, 10, 15, 30 min… that keeps
+// labels apart.
+void drawTimeAxis(std::vector<std::uint8_t>& pixels, int width, int height, double seconds) {
+  const int top = height - kAxisHeight;
+  for (int x = 0; x < width; ++x) paint(pixels, width, x, top, kAxis);
+  if (!(seconds > 0)) return;
+  const double pixelsPerSecond = width / seconds;
+  int step = 1;
+  for (int candidate : {1, 2, 5, 10, 15, 30, 60, 120, 300, 600, 900, 1800, 3600, 7200}) {
+    step = candidate;
+    if (candidate * pixelsPerSecond >= kMinimumLabelSpacing) break;
+  }
+  for (int t = 0; t <= seconds; t += step) {
+    const int x = std::min(int(std::lround(t * pixelsPerSecond)), width - 1);
+    for (int y = top; y < top + 3; ++y) paint(pixels, width, x, y, kText);
+    const std::string label = timeLabel(t);
+    const int textWidth = (int(label.size()) * 4 - 1) * kGlyphScale;
+    drawText(pixels, width, height, std::clamp(x - textWidth / 2, 0, width - textWidth), top + 4,
+             label);
+  }
 }
 
 }  // namespace
@@ -32,9 +106,11 @@ void paint(std::vector<std::uint8_t>& pixels, int width, int x, int y, const std
 std::vector<std::uint8_t> renderWaveform(const quorvel::RCWaveform& waveform,
                                          WaveformPictureSize size) {
   const int width = size.width;
-  const int height = size.height;
-  std::vector<std::uint8_t> pixels(std::size_t(width) * height * 3);
+  const bool axis = size.height >= kMinimumHeightForAxis;
+  const int height = axis ? size.height - kAxisHeight : size.height;  // the waveform's bands
+  std::vector<std::uint8_t> pixels(std::size_t(width) * size.height * 3);
   for (std::size_t i = 0; i < pixels.size(); i += 3) std::memcpy(&pixels[i], kBackground, 3);
+  if (axis) drawTimeAxis(pixels, width, size.height, waveform.durationSeconds());
 
   const int channels = std::max(waveform.channels(), 1);
   const std::size_t length = waveform.length();

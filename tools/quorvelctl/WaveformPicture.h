@@ -1,6 +1,6 @@
 // quorvelctl's waveform picture: draws a recording's waveform (its
 // "<name>.waveform" file) as a PNG image, one band per channel, each column
-// the range of the samples it covers.
+// the range of the samples it covers, over a time axis in seconds.
 //
 // Plain functions without shared state; called from main() only.
 #pragma once
@@ -22,7 +22,9 @@ struct WaveformPictureSize {
 // The picture's pixels, 8-bit RGB, row by row from the top: `size.width`
 // columns, each covering an equal share of the waveform's pixels (a column
 // between two waveform pixels repeats the nearer one, so a short waveform is
-// stretched), and `size.height` rows split evenly between the channels.
+// stretched), and `size.height` rows: a time axis of 16 rows at the bottom
+// (ticks and labels in seconds, or minutes:seconds) when the picture is at
+// least 64 rows high, the rest split evenly between the channels.
 std::vector<std::uint8_t> renderWaveform(const quorvel::RCWaveform& waveform,
                                          WaveformPictureSize size);
 
