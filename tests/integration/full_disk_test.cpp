@@ -13,19 +13,17 @@
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
-#include <fstream>
 #include <map>
-#include <optional>
-#include <string>
 
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionEditor.h"
 #include "Quorvel/database/RCSavedRecordingsModel.h"
 #include "Quorvel/files/RCFile.h"
 #include "Quorvel/files/RCMD5.h"
-#include "Quorvel/media/RCMediaEngine.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/DaemonProcess.h"
+#include "tests/support/ScopedTempDir.h"
+#include "tests/support/TempDirectory.h"
 #include "tests/support/TestBus.h"
 
 namespace quorvel {
@@ -44,70 +42,49 @@ class FullDiskTest : public ::testing::Test {
         ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
       GTEST_SKIP() << "no private mount namespace: " << std::strerror(errno);
     }
-    disk_ = fs::temp_directory_path() /
-            ("quorvel-disk-" + std::to_string(::getpid()) + "-" +
-             ::testing::UnitTest::GetInstance()->current_test_info()->name());
     fs::create_directories(disk_);
-    if (::mount("quorvel-test", disk_.c_str(), "tmpfs", 0, "size=8m,mode=0700") != 0) {
+    if (::mount("quorvel-test", disk_.c_str(), "tmpfs", 0, "size=8m,mode=0700") != 0)
       GTEST_SKIP() << "cannot mount a tmpfs: " << std::strerror(errno);
-    }
     mounted_ = true;
-    recordings_ = disk_ / "Recordings";
     fs::create_directories(recordings_);
     RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
-    bus_.emplace();
+    daemon_ = DaemonProcess::serve(bus_.address(), recordings_.string());
   }
   void TearDown() override {
     daemon_.reset();
-    bus_.reset();
     RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
     if (mounted_) ::umount2(disk_.c_str(), MNT_DETACH);
-    if (!disk_.empty()) {
-      fs::remove_all(disk_);
-      fs::remove(disk_.string() + "-take.wav");
-    }
   }
 
-  void startDaemon() {
-    daemon_ = std::make_unique<DaemonProcess>(
-        std::vector<std::string>{"--bus-address", bus_->address(), "--recordings-dir",
-                                 recordings_.string(), "--idle-exit-after", "0"});
-    ASSERT_TRUE(daemon_->waitForLine("[BusListener] listening as")) << daemon_->output();
-  }
   DaemonProcess::CommandResult quorvelctl(std::vector<std::string> arguments) {
-    arguments.insert(arguments.begin(),
-                     {DaemonProcess::programPath("quorvelctl"), "--bus-address", bus_->address()});
-    return DaemonProcess::run(arguments);
+    return DaemonProcess::quorvelctl(bus_.address(), std::move(arguments));
   }
   std::string path(const std::string& name) const { return (recordings_ / name).string(); }
   // A tone made outside the disk, so the disk holds only what is tested.
   std::string take(double seconds, double frequency) {
-    const std::string file = disk_.string() + "-take.wav";
+    const std::string file = (temp_ / "take.wav").string();
     EXPECT_TRUE(testing::writeTone(file, seconds, "wav", 44100, 1, frequency));
     return file;
   }
-
   // Fills the disk to its last byte.
   void fill() {
-    const int fd =
-        ::open((disk_ / "filler").c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    const int fd = ::open((disk_ / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
     ASSERT_GE(fd, 0) << std::strerror(errno);
     const std::string bytes(1 << 16, 'x');
-    for (std::size_t chunk = bytes.size(); chunk > 0; chunk /= 2) {
+    for (std::size_t chunk = bytes.size(); chunk > 0; chunk /= 2)
       while (::write(fd, bytes.data(), chunk) > 0) {
       }
-    }
     ::close(fd);
   }
   void makeRoom() { fs::remove(disk_ / "filler"); }
-
   // Every file under the recordings directory but the database's and the
   // waveforms (a finalization removes the old one first: it describes the
-  // old audio), by path, with its digest.
+  // old audio), by path, with its digest; and no temporary file among them.
   std::map<std::string, std::string> contents() const {
     std::map<std::string, std::string> files;
     for (const auto& entry : fs::recursive_directory_iterator(recordings_)) {
       const std::string name = entry.path().filename();
+      EXPECT_FALSE(RCIsAtomicReplaceTempName(name)) << entry.path();
       if (!entry.is_regular_file() || name.starts_with(RCSavedRecordingsModel::kDatabaseFileName) ||
           entry.path().extension() == ".waveform") {
         continue;
@@ -117,17 +94,12 @@ class FullDiskTest : public ::testing::Test {
     }
     return files;
   }
-  std::vector<std::string> temporaryFiles() const {
-    std::vector<std::string> found;
-    for (const auto& entry : fs::recursive_directory_iterator(recordings_))
-      if (RCIsAtomicReplaceTempName(entry.path().filename().string()))
-        found.push_back(entry.path());
-    return found;
-  }
 
-  fs::path disk_, recordings_;
+  testing::ScopedTempDir temp_{"qv-disk"};
+  fs::path disk_ = temp_ / "disk";
+  fs::path recordings_ = disk_ / "Recordings";
   bool mounted_ = false;
-  std::optional<platform::testing::TestBus> bus_;
+  platform::testing::TestBus bus_;
   std::unique_ptr<DaemonProcess> daemon_;
 };
 
@@ -136,31 +108,25 @@ class FullDiskTest : public ::testing::Test {
 // and the fragments stay as they were, and once there is room the export
 // composes both takes.
 TEST_F(FullDiskTest, AnExportThatCannotBeWrittenFailsAndKeepsTheRecording) {
-  ASSERT_NO_FATAL_FAILURE(startDaemon());
   auto made = quorvelctl({"new", "--recordings-dir", recordings_.string(), "Walk", take(2.0, 440)});
   ASSERT_EQ(made.status, 0) << made.output;
   const std::string audio = path("Walk.m4a");
   auto exported = quorvelctl({"export", audio, "--", "true"});
   ASSERT_EQ(exported.status, 0) << exported.output << daemon_->output();
-  {
-    auto editor =
-        RCCompositionEditor::editorForComposedAVURL(platform::URL::fileURLWithPath(audio));
-    ASSERT_TRUE(editor) << editor.error();
-    auto appended =
-        editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take(20.0, 660)));
-    ASSERT_TRUE(appended) << appended.error();
-  }
+  auto editor = RCCompositionEditor::editorForComposedAVURL(platform::URL::fileURLWithPath(audio));
+  ASSERT_TRUE(editor) << editor.error();
+  auto appended =
+      editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take(20.0, 660)));
+  ASSERT_TRUE(appended) << appended.error();
   const auto before = contents();
 
   ASSERT_NO_FATAL_FAILURE(fill());
   auto failed = quorvelctl({"export", audio, "--", "true"});
   EXPECT_NE(failed.status, 0) << failed.output;
-  // The reply carries no token (and, by the contract, no error); the
-  // daemon logs why.
+  // The reply carries no token (and no error); the daemon logs why.
   EXPECT_NE(failed.output.find("could not be finalized"), std::string::npos) << failed.output;
   EXPECT_FALSE(daemon_->linesContaining("No space left on device").empty()) << daemon_->output();
   EXPECT_EQ(contents(), before);
-  EXPECT_EQ(temporaryFiles(), std::vector<std::string>{});
 
   makeRoom();
   auto again = quorvelctl({"export", audio, "--", "true"});
@@ -168,7 +134,7 @@ TEST_F(FullDiskTest, AnExportThatCannotBeWrittenFailsAndKeepsTheRecording) {
   auto pcm = testing::decodeToPCM(audio);
   ASSERT_TRUE(pcm) << pcm.error();
   EXPECT_NEAR(pcm->seconds(), 22.0, 0.1);
-  EXPECT_EQ(temporaryFiles(), std::vector<std::string>{});
+  contents();  // no temporary file stays
 }
 
 // The orphan run on a full disk, over a bundle and a file the database
@@ -179,23 +145,21 @@ TEST_F(FullDiskTest, AnOrphanRunThatCannotSaveTheDatabaseDeletesNothing) {
   // The daemon opens (and so makes) the database in a run over the empty
   // directory, and keeps it open; the orphans come once its start-up run
   // is over and orphan handling is off.
-  ASSERT_NO_FATAL_FAILURE(startDaemon());
   ASSERT_TRUE(daemon_->waitForLines("Keep-alive for orphan handling", 2)) << daemon_->output();
   ASSERT_EQ(quorvelctl({"enable-orphan-handling"}).status, 0);
   ASSERT_EQ(quorvelctl({"disable-orphan-handling"}).status, 0);
-  fs::create_directories(recordings_ / "Lost.composition");
-  ASSERT_TRUE(testing::writeTone(path("Lost.composition/Lost-1.wav"), 1.0, "wav"));
   RCCompositionManifest manifest;
   manifest.composedName = "Lost.m4a";
   manifest.fragments.push_back({.file = "Lost-1.wav", .contentDuration = 1.0});
   manifest.recomputeTimeRanges();
-  std::ofstream(path("Lost.composition/manifest.json")) << manifest.serialize();
+  testing::writeFile(path("Lost.composition/manifest.json"), manifest.serialize());
+  ASSERT_TRUE(testing::writeTone(path("Lost.composition/Lost-1.wav"), 1.0, "wav"));
   testing::ToneOptions found;
   found.frequencyHz = 660;
   found.metadata = {{"title", "Found on a card"}};
   ASSERT_TRUE(testing::writeTone(path("Found.m4a"), found));
   fs::copy_file(path("Found.m4a"), path("Found again.m4a"));
-  std::ofstream(path("Noise.wav")) << std::string(4096, 'x');
+  testing::writeFile(path("Noise.wav"), std::string(4096, 'x'));
   const auto before = contents();
 
   ASSERT_NO_FATAL_FAILURE(fill());
@@ -204,7 +168,6 @@ TEST_F(FullDiskTest, AnOrphanRunThatCannotSaveTheDatabaseDeletesNothing) {
   EXPECT_FALSE(daemon_->linesContaining("cannot save the recordings database").empty())
       << daemon_->output();
   EXPECT_EQ(contents(), before) << daemon_->output();
-  EXPECT_EQ(temporaryFiles(), std::vector<std::string>{});
 
   makeRoom();
   ASSERT_EQ(quorvelctl({"disable-orphan-handling"}).status, 0);
