@@ -45,6 +45,16 @@ namespace fs = std::filesystem;
 
 class DaemonTest : public ::testing::Test {
  protected:
+  void TearDown() override {
+    RCSavedRecordingsModel::resetSharedModelsForTesting();
+    RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
+  }
+  // Makes the recordings directory (the daemon makes its own) and the test
+  // process's.
+  void useRecordings() {
+    fs::create_directories(recordings_);
+    RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
+  }
   std::unique_ptr<DaemonProcess> serve(const std::string& idleExitAfter = "0") {
     return DaemonProcess::serve(bus_.address(), recordings_.string(), idleExitAfter);
   }
@@ -194,7 +204,7 @@ TEST_F(DaemonTest, ForeignClientsGetTheInterfaceAndItsErrors) {
 // composed file decodes to the fragments' length within one AAC frame per
 // join, and the waveform and the database follow it.
 TEST_F(DaemonTest, TheSandboxedWorkerRecoversOrphansAndComposesAnExport) {
-  fs::create_directories(recordings_);
+  useRecordings();
   ASSERT_TRUE(testing::writeTone(path("Found.m4a"), 1.0, "m4a"));
   ASSERT_TRUE(RCMediaEngine::current()->writeTitle(
       platform::URL::fileURLWithPath(path("Found.m4a")), "Found on a card", ""));
@@ -279,14 +289,7 @@ std::vector<pid_t> workersOf(pid_t pid) {
 
 class MediaWorkerDaemonTest : public DaemonTest {
  protected:
-  void SetUp() override {
-    fs::create_directories(recordings_);
-    RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
-  }
-  void TearDown() override {
-    RCSavedRecordingsModel::resetSharedModelsForTesting();
-    RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
-  }
+  void SetUp() override { useRecordings(); }
 
   // A recording `name` with fragments of the given lengths, in `format`.
   RCCompositionEditor makeRecording(const std::string& name, const std::string& format,
@@ -416,13 +419,12 @@ class FullDiskTest : public DaemonTest {
       GTEST_SKIP() << "cannot mount a tmpfs: " << std::strerror(errno);
     mounted_ = true;
     recordings_ = disk_ / "Recordings";
-    fs::create_directories(recordings_);
-    RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
+    useRecordings();
     daemon_ = serve();
   }
   void TearDown() override {
     daemon_.reset();
-    RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
+    DaemonTest::TearDown();
     if (mounted_) ::umount2(disk_.c_str(), MNT_DETACH);
   }
 
