@@ -115,8 +115,9 @@ TEST_F(ExportControllerTest, ThreeFinalizationsRunTwoAtATime) {
 }
 
 // A finalization asked for while only the recording's waveform is still
-// pending (its finalization answered) is answered before the call returns.
-TEST_F(ExportControllerTest, OnlyAWaveformPendingAnswersAtOnce) {
+// pending (its finalization answered) is answered before the call returns;
+// one that wants the waveform too joins it.
+TEST_F(ExportControllerTest, OnlyAWaveformPendingAnswersAtOnceOrJoinsIt) {
   ASSERT_TRUE(testing::writeTone(recordingsPath("Bare.m4a"), 0.5, "m4a"));  // no bundle
   const platform::URL bare = platform::URL::fileURLWithPath(recordingsPath("Bare.m4a"));
   std::thread loop([&] { main_.run(); });
@@ -127,8 +128,13 @@ TEST_F(ExportControllerTest, OnlyAWaveformPendingAnswersAtOnce) {
   ASSERT_TRUE(engine_->waitForInside(1));                             // the waveform is being built
   ASSERT_TRUE(answers_.waitUntil([&] { return !answers.empty(); }));  // the finalization's
   controller_->finalizeAssetWithCompositionAVURL(bare, false, record("at once"));
+  controller_->finalizeAssetWithCompositionAVURL(bare, true, record("joining"));
   EXPECT_EQ(answered(), (std::vector<std::string>{"finalized yes", "at once yes"}));
+  EXPECT_EQ(controller_->pendingOperationCountForTesting(), 1u);  // the waveform only
   engine_->open();
+  ASSERT_TRUE(answers_.waitUntil([&] { return answers.size() == 4; }));
+  EXPECT_EQ(answered(), (std::vector<std::string>{"finalized yes", "at once yes",
+                                                  "with waveform yes", "joining yes"}));
   main_.stop();
   loop.join();
 }

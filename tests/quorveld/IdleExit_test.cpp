@@ -14,6 +14,7 @@ class IdleExitTest : public ServiceTest {
  public:
   void SetUp() override {
     ServiceTest::SetUp();
+    platform::setLogThreshold(platform::kLogLevelNotice);  // the daemon's default
     ASSERT_TRUE(service_->start());
     settle();  // the first orphan pass and the start-up keep-alives are over
     ASSERT_FALSE(platform::ProcessLifetime::instance().isInTransaction());

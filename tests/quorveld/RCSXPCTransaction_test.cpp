@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <functional>
+#include <latch>
 #include <thread>
 #include <vector>
 
@@ -88,11 +89,15 @@ TEST(TransactionTest, TheRootIsHeldWhileAnyTransactionIsActiveAndEndsRunOnTheMai
   platform::setMainQueueForTesting(nullptr);
 }
 
+// The threads start together, so even their first transactions race.
 TEST(TransactionTest, ConcurrentBeginsEndsAndDropsKeepTheRootConsistent) {
+  constexpr int kThreads = 8;
+  std::latch start(kThreads);
   std::vector<std::thread> threads;
-  for (int t = 0; t < 4; ++t) {
-    threads.emplace_back([] {
-      for (int i = 0; i < 2000; ++i) {
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&start] {
+      start.arrive_and_wait();
+      for (int i = 0; i < 1000; ++i) {
         auto transaction = RCSXPCTransaction::initWithName("stress");
         transaction->beginTransaction();
         if (i % 3 == 0) transaction->endTransaction();
