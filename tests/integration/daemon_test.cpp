@@ -406,6 +406,9 @@ TEST_F(MediaWorkerDaemonTest, AWorkerOrTheDaemonKilledMidExportLeavesNothingTheN
 // root; skipped otherwise.
 class FullDiskTest : public DaemonTest {
  protected:
+  // Logged each time the daemon has no work left.
+  static constexpr const char* kIdle = "No XPC transactions remain";
+
   void SetUp() override {
     if (::geteuid() != 0) GTEST_SKIP() << "needs root to mount a small file system";
     // The namespace is the calling thread's, and so of the processes it
@@ -486,12 +489,19 @@ TEST_F(FullDiskTest, AnExportThatCannotBeWrittenFailsAndKeepsTheRecording) {
   const auto before = contents();
 
   ASSERT_NO_FATAL_FAILURE(fill());
+  const std::size_t idle = daemon_->linesContaining(kIdle).size();
   auto failed = quorvelctl({"export", audio, "--", "true"});
   EXPECT_NE(failed.status, 0) << failed.output;
   // The reply carries no token (and no error); the daemon logs why.
   EXPECT_NE(failed.output.find("could not be finalized"), std::string::npos) << failed.output;
   EXPECT_FALSE(daemon_->linesContaining("No space left on device").empty()) << daemon_->output();
-  EXPECT_EQ(contents(), before);
+  // quorvelctl leaving while its session still closes makes the daemon try
+  // the recording once more, which may still run when the daemon's
+  // keep-alives are over: only once it is done is the directory final.
+  ASSERT_TRUE(daemon_->waitForLines(kIdle, idle + 1)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLines("FINISHED asset finalization",
+                                    daemon_->linesContaining("RUNNING asset finalization").size()));
+  EXPECT_EQ(contents(), before) << daemon_->output();
 
   makeRoom();
   auto again = quorvelctl({"export", audio, "--", "true"});

@@ -191,8 +191,9 @@ TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
 }
 
 // Bundles: one a client names through "..", one recovered into the database
-// with its record written into its manifest, an empty old one removed, an
-// empty young one and an unloadable one left alone.
+// with its record written into its manifest (though files of its name
+// outside the directory are in use), an empty old one removed, an empty
+// young one and an unloadable one left alone.
 TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
   for (const char* name : {"Walk", "Stray"}) ASSERT_NO_FATAL_FAILURE(makeBundle(name));
   for (const char* name : {"Hollow", "Fresh"})
@@ -204,7 +205,10 @@ TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
   for (const char* name : {"Hollow.composition", "Broken.composition", "Lower.COMPOSITION"})
     age(recordingsPath(name), 3600);
 
-  run({platform::URL::fileURLWithPath(recordingsPath("x/../Walk.m4a"))});
+  fs::copy_file(root_ / "take.wav", root_ / "Stray.m4a");
+  run({platform::URL::fileURLWithPath(recordingsPath("x/../Walk.m4a")),
+       platform::URL::fileURLWithPath((root_ / "Stray.m4a").string()),
+       platform::URL::fileURLWithPath((root_ / "Gone" / "Stray.m4a").string())});
 
   EXPECT_EQ(titles().size(), 1u);
   auto stray =
