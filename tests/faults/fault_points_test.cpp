@@ -13,7 +13,6 @@
 #include <atomic>
 #include <chrono>
 #include <filesystem>
-#include <fstream>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -23,6 +22,7 @@
 #include <vector>
 
 #include "tests/support/DaemonProcess.h"
+#include "tests/support/TempDirectory.h"
 
 namespace quorvel {
 namespace {
@@ -47,13 +47,6 @@ struct Fault {
 };
 constexpr Fault kFaults[] = {
     {"SIGKILL", "signal=SIGKILL"}, {"EIO", "error=EIO"}, {"ENOSPC", "error=ENOSPC"}};
-
-std::string readAll(const fs::path& path) {
-  std::ifstream in(path);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
 
 // A strace log line "PID name(args...": the name and whether the call works
 // on `dir` (its file descriptor, as -y shows it, or its path does).
@@ -131,7 +124,7 @@ class FaultPointsTest : public ::testing::TestWithParam<const char*> {
     EXPECT_EQ(ran.status, 0) << ran.output;
     std::vector<Point> points;
     std::map<std::pair<std::string, std::string>, int> counts;  // (thread, syscall)
-    std::istringstream log(readAll(root_ / "calls.log"));
+    std::istringstream log(testing::readFile(root_ / "calls.log"));
     for (std::string line; std::getline(log, line);) {
       auto call = parseCall(line, dir.string());
       if (!call) continue;
@@ -156,7 +149,7 @@ class FaultPointsTest : public ::testing::TestWithParam<const char*> {
     if (!outcome) return "ended with status " + std::to_string(ran.status) + ": " + ran.output;
     // The call the fault went into: the first one marked injected, or the
     // one the process was killed in.
-    std::istringstream lines(readAll(log));
+    std::istringstream lines(testing::readFile(log));
     std::string hit, previous;
     for (std::string line; std::getline(lines, line) && hit.empty(); previous = line) {
       if (line.find("(INJECTED)") != std::string::npos) hit = line;

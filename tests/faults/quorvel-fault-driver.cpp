@@ -76,12 +76,20 @@ struct Context {
 };
 
 platform::Status tone(const std::string& path, double seconds, double frequency = 440) {
-  testing::ToneOptions options;
-  options.seconds = seconds;
-  options.frequencyHz = frequency;
-  options.format = fs::path(path).extension().string().substr(1);
-  return testing::writeTone(path, options);
+  const std::string format = fs::path(path).extension().string().substr(1);
+  return testing::writeTone(path, seconds, format, 44100, 1, frequency);
 }
+
+// The status of a result, for the steps of an operation: each returns the
+// first failure with TRY.
+template <class T>
+platform::Status statusOf(const platform::Result<T>& result) {
+  if (result) return {};
+  return platform::fail(result.error());
+}
+platform::Status statusOf(const platform::Status& status) { return status; }
+#define TRY(step) \
+  if (auto status = statusOf(step); !status) return status
 
 // Seconds of decoded audio in `path`; NaN when it does not decode.
 double decodedSeconds(const std::string& path) {
@@ -101,20 +109,20 @@ platform::Status makeRecording(Context& context, const std::vector<double>& seco
   auto model = context.model();
   if (!model) return platform::fail(platform::posixError(EIO, "no database"));
   auto editor = RCCompositionEditor::createCompositionForNewRecording(*model, "Walk");
-  if (!editor) return platform::fail(editor.error());
+  TRY(editor);
   for (std::size_t i = 0; i < seconds.size(); ++i) {
     const std::string source = context.dir.string() + "-take" + std::to_string(i) + ".wav";
-    if (auto made = tone(source, seconds[i], 440 + 110 * i); !made) return made;
+    TRY(tone(source, seconds[i], 440 + 110 * i));
     auto appended = editor->appendFragmentFromAudioFile(URL::fileURLWithPath(source));
     fs::remove(source);
-    if (!appended) return platform::fail(appended.error());
+    TRY(appended);
   }
   return {};
 }
 
 // A bare composed file "Walk.m4a" with its database record.
 platform::Status makeComposedFile(Context& context, double seconds) {
-  if (auto made = tone(context.path("Walk.m4a"), seconds); !made) return made;
+  TRY(tone(context.path("Walk.m4a"), seconds));
   auto model = context.model();
   if (!model) return platform::fail(platform::posixError(EIO, "no database"));
   model->insertRecordingWithAudioFile(context.path("Walk.m4a"), seconds, platform::Date::now());
@@ -194,27 +202,22 @@ const std::vector<Operation>& operations() {
       // database's duration, then the fragments go.
       {"compose",
        [](Context& c) -> platform::Status {
-         if (auto made = makeRecording(c, {1.0}); !made) return made;
-         auto controller =
-             RCCompositionController::compositionControllerForComposedAVURL(c.url("Walk.m4a"));
-         if (auto composed = controller->composeNow(false, true); !composed) return composed;
+         TRY(makeRecording(c, {1.0}));
+         TRY(RCCompositionController::compositionControllerForComposedAVURL(c.url("Walk.m4a"))
+                 ->composeNow(false, true));
          // A title written into the composed file, which composing keeps.
-         if (auto written = RCMediaEngine::current()->writeTitle(c.url("Walk.m4a"), "Gang", "deu");
-             !written) {
-           return written;
-         }
+         TRY(RCMediaEngine::current()->writeTitle(c.url("Walk.m4a"), "Gang", "deu"));
          auto editor = RCCompositionEditor::editorForComposedAVURL(c.url("Walk.m4a"));
-         if (!editor) return platform::fail(editor.error());
+         TRY(editor);
          const std::string source = c.dir.string() + "-take.wav";
-         if (auto made = tone(source, 0.5, 880); !made) return made;
+         TRY(tone(source, 0.5, 880));
          auto appended = editor->appendFragmentFromAudioFile(URL::fileURLWithPath(source));
          fs::remove(source);
-         return appended ? platform::Status() : platform::fail(appended.error());
+         return statusOf(appended);
        },
        [](Context& c) {
-         auto controller =
-             RCCompositionController::compositionControllerForComposedAVURL(c.url("Walk.m4a"));
-         return controller->composeNow(true, true);
+         return RCCompositionController::compositionControllerForComposedAVURL(c.url("Walk.m4a"))
+             ->composeNow(true, true);
        },
        [](Context& c, bool done) {
          const double seconds = decodedSeconds(c.path("Walk.m4a"));
@@ -240,25 +243,21 @@ const std::vector<Operation>& operations() {
          const bool newState = composed && fragments.empty() &&
                                near(composition->composedDuration(), 1.5) && record &&
                                near(record->duration(), 1.5);
-         if (done && !newState) {
+         if (done && !newState)
            c.problem(std::string("the compose reported success, but ") +
                      (!composed            ? "Walk.m4a is the old file"
                       : !fragments.empty() ? "the manifest was not saved"
                       : !record || !near(record->duration(), 1.5)
                           ? "the database has the old duration"
                           : "the manifest has the wrong duration"));
-         }
          return newState;
        }},
       // A title written into a composed m4a file (the media engine's title
       // job), beside the titles of other languages.
       {"title",
        [](Context& c) -> platform::Status {
-         if (auto made = makeComposedFile(c, 1.0); !made) return made;
-         if (auto written = RCMediaEngine::current()->writeTitle(c.url("Walk.m4a"), "Walk", "");
-             !written) {
-           return written;
-         }
+         TRY(makeComposedFile(c, 1.0));
+         TRY(RCMediaEngine::current()->writeTitle(c.url("Walk.m4a"), "Walk", ""));
          return RCMediaEngine::current()->writeTitle(c.url("Walk.m4a"), "Gang", "deu");
        },
        [](Context& c) {
@@ -281,7 +280,7 @@ const std::vector<Operation>& operations() {
       {"manifest", [](Context& c) { return makeRecording(c, {1.0}); },
        [](Context& c) -> platform::Status {
          auto loaded = RCComposition::load(c.url("Walk.composition"));
-         if (!loaded) return platform::fail(loaded.error());
+         TRY(loaded);
          RCCompositionManifest manifest = (*loaded)->manifest();
          manifest.fragments.at(0).contentDuration = 0.5;
          manifest.recomputeTimeRanges();
@@ -302,7 +301,7 @@ const std::vector<Operation>& operations() {
        [](Context& c) -> platform::Status {
          if (!c.model()) return platform::fail(platform::posixError(EIO, "no database"));
          fs::create_directories(c.dir / "Lost.composition");
-         if (auto made = tone(c.path("Lost.composition/Lost-1.wav"), 1.0); !made) return made;
+         TRY(tone(c.path("Lost.composition/Lost-1.wav"), 1.0));
          RCCompositionManifest manifest;
          manifest.composedName = "Lost.m4a";
          manifest.fragments.push_back({.file = "Lost-1.wav", .contentDuration = 1.0});
@@ -311,7 +310,7 @@ const std::vector<Operation>& operations() {
          testing::ToneOptions options;
          options.frequencyHz = 660;
          options.metadata = {{"title", "Found on a card"}};
-         if (auto made = testing::writeTone(c.path("Found.m4a"), options); !made) return made;
+         TRY(testing::writeTone(c.path("Found.m4a"), options));
          fs::copy_file(c.path("Found.m4a"), c.path("Found again.m4a"));
          std::ofstream(c.path("Noise.wav")) << std::string(4096, 'x');
          return {};
@@ -337,17 +336,13 @@ const std::vector<Operation>& operations() {
       // manifest no longer lists is deleted.
       {"cleanup",
        [](Context& c) -> platform::Status {
-         if (auto made = makeRecording(c, {1.0, 0.5}); !made) return made;
+         TRY(makeRecording(c, {1.0, 0.5}));
          auto composition = loadWalk(c);
          if (!composition) return platform::fail(platform::posixError(EIO, "no bundle"));
          RCCompositionManifest manifest = composition->manifest();
          manifest.fragments.at(1).contentDuration.reset();
          manifest.recomputeTimeRanges();
-         if (auto saved =
-                 RCComposition(c.url("Walk.composition"), manifest).saveMetadataToDefaultLocation();
-             !saved) {
-           return saved;
-         }
+         TRY(RCComposition(c.url("Walk.composition"), manifest).saveMetadataToDefaultLocation());
          return tone(c.path("Walk.composition/Unused.wav"), 0.25);
        },
        [](Context& c) -> platform::Status {

@@ -1,302 +1,249 @@
 // The real quorveld on a private bus, called the way apps and users call it:
-// the client library, quorvelctl, gdbus and dbus-send. Checks what each sees
-// and what the daemon logs.
+// one end-to-end run per kind of client (the client library, quorvelctl,
+// gdbus and dbus-send), and what only a real process shows: its options, a
+// killed client, its sandboxed media workers (which die with it, may be
+// missing, or be killed mid-export), the debug signal, its idle exit, and
+// its recordings directory on a full disk. The rules behind the answers are
+// pinned by the service core's tests.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <csignal>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <string>
+#include <map>
+#include <thread>
 
+#include "Quorvel/composition/RCComposition.h"
+#include "Quorvel/composition/RCCompositionEditor.h"
 #include "Quorvel/database/RCSavedRecordingsModel.h"
+#include "Quorvel/files/RCFile.h"
+#include "Quorvel/files/RCMD5.h"
 #include "Quorvel/media/RCMediaEngine.h"
 #include "Quorvel/service/SavedRecordingServiceClient.h"
 #include "Quorvel/waveform/RCWaveformFile.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/DaemonProcess.h"
+#include "tests/support/DirectoryWatch.h"
+#include "tests/support/ScopedEnvironment.h"
+#include "tests/support/ScopedTempDir.h"
+#include "tests/support/TempDirectory.h"
 #include "tests/support/TestBus.h"
 
 namespace quorvel {
 namespace {
 
 using testing::DaemonProcess;
-
-constexpr const char* kService = "org.quorvel.SavedRecordingService";
-constexpr const char* kPath = "/org/quorvel/SavedRecordingService";
-constexpr const char* kInterface = "org.quorvel.SavedRecordingService1";
+namespace fs = std::filesystem;
 
 class DaemonTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    recordings_ = std::filesystem::temp_directory_path() /
-                  ("quorvel-it-" + std::to_string(getpid()) + "-" +
-                   ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    std::filesystem::remove_all(recordings_);
-  }
   void TearDown() override {
-    std::filesystem::remove_all(recordings_);
-    for (int i = 0; i < 3; ++i)
-      std::filesystem::remove(recordings_.string() + "-take" + std::to_string(i) + ".wav");
+    RCSavedRecordingsModel::resetSharedModelsForTesting();
+    RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
   }
-
-  std::unique_ptr<DaemonProcess> startDaemon(const std::string& idleExitAfter = "0") {
-    auto daemon = std::make_unique<DaemonProcess>(
-        std::vector<std::string>{"--bus-address", bus_.address(), "--recordings-dir",
-                                 recordings_.string(), "--idle-exit-after", idleExitAfter});
-    // Logged once the name is ours.
-    EXPECT_TRUE(daemon->waitForLine("[BusListener] listening as")) << daemon->output();
-    return daemon;
+  // Makes the recordings directory (the daemon makes its own) and the test
+  // process's.
+  void useRecordings() {
+    fs::create_directories(recordings_);
+    RCSavedRecordingsModel::setSavedRecordingsDirectory(recordings_.string());
   }
-  DaemonProcess::CommandResult gdbusCall(const std::string& method,
-                                         std::vector<std::string> arguments = {}) {
-    std::vector<std::string> argv{"gdbus",         "call",
-                                  "--address",     bus_.address(),
-                                  "--dest",        kService,
-                                  "--object-path", kPath,
-                                  "--method",      std::string(kInterface) + "." + method};
-    argv.insert(argv.end(), arguments.begin(), arguments.end());
-    return DaemonProcess::run(argv);
+  std::unique_ptr<DaemonProcess> serve(const std::string& idleExitAfter = "0") {
+    return DaemonProcess::serve(bus_.address(), recordings_.string(), idleExitAfter);
   }
   DaemonProcess::CommandResult quorvelctl(std::vector<std::string> arguments) {
-    arguments.insert(arguments.begin(),
-                     {DaemonProcess::programPath("quorvelctl"), "--bus-address", bus_.address()});
+    return DaemonProcess::quorvelctl(bus_.address(), std::move(arguments));
+  }
+  DaemonProcess::CommandResult gdbus(const std::string& command,
+                                     std::vector<std::string> arguments = {}) {
+    arguments.insert(arguments.begin(), {"gdbus", command, "--address", bus_.address(), "--dest",
+                                         "org.quorvel.SavedRecordingService", "--object-path",
+                                         "/org/quorvel/SavedRecordingService"});
     return DaemonProcess::run(arguments);
+  }
+  DaemonProcess::CommandResult call(const std::string& method,
+                                    std::vector<std::string> arguments = {}) {
+    arguments.insert(arguments.begin(),
+                     {"--method", "org.quorvel.SavedRecordingService1." + method});
+    return gdbus("call", std::move(arguments));
+  }
+  std::string path(const std::string& name) const { return (recordings_ / name).string(); }
+  std::unique_ptr<SavedRecordingServiceClient> connect() {
+    auto client = SavedRecordingServiceClient::connect(bus_.address());
+    EXPECT_TRUE(client) << client.error();
+    return client ? std::move(*client) : nullptr;
   }
 
   platform::testing::TestBus bus_;
-  std::filesystem::path recordings_;
+  testing::ScopedTempDir temp_{"qv-daemon"};
+  fs::path recordings_ = temp_ / "Recordings";  // made by the daemon
 };
 
-TEST_F(DaemonTest, StartsOwnsItsNameAndLogsTheStartUp) {
-  auto daemon = startDaemon();
+TEST_F(DaemonTest, TheClientLibraryGetsAnswersAndErrorsAsValues) {
+  auto daemon = serve();
   EXPECT_EQ(daemon->linesContaining("[quorveld] Starting xpc service").size(), 1u);
-  EXPECT_EQ(daemon
-                ->linesContaining(
-                    "[SavedRecordingService] Starting service 'org.quorvel.SavedRecordingService'")
-                .size(),
-            1u);
-  EXPECT_TRUE(daemon->waitForLine("[RCSXPCTransaction] Root XPC transaction began."));
-  EXPECT_TRUE(std::filesystem::is_directory(recordings_));
+  EXPECT_TRUE(fs::is_directory(recordings_));
+  auto client = connect();
+  ASSERT_TRUE(client);
+  auto exporting = client->fetchExportingCompositionAVURLs();
+  ASSERT_TRUE(exporting) << exporting.error();
+  EXPECT_TRUE(exporting->empty());
 
-  auto introspection = DaemonProcess::run({"gdbus", "introspect", "--address", bus_.address(),
-                                           "--dest", kService, "--object-path", kPath});
+  auto url = platform::URL::fileURLWithPath(path("Walk in the park.m4a"));
+  auto preview = client->prepareToPreview(url);
+  ASSERT_TRUE(preview) << daemon->output();
+  EXPECT_EQ(preview->accessType(), 1);
+  auto capture = client->prepareToCapture(url);
+  ASSERT_FALSE(capture);
+  EXPECT_EQ(capture.error().domain(), "org.quorvel.SavedRecordingService.ErrorDomain");
+  EXPECT_EQ(capture.error().code(), 301);
+  client->endAccessSessionWithToken(*preview);
+  EXPECT_TRUE(daemon->waitForLine("Finally closing access session")) << daemon->output();
+  auto granted = client->prepareToCapture(url);
+  ASSERT_TRUE(granted) << granted.error();
+  EXPECT_EQ(granted->accessType(), 2);
+}
+
+// quorvelctl holds a session while its command runs and reports by exit
+// status; a killed one loses its sessions; the debug signal dumps them, as
+// often as it comes, and the daemon keeps serving.
+TEST_F(DaemonTest, QuorvelctlHoldsSessionsWhileItsCommandRunsAndReportsByExitStatus) {
+  auto daemon = serve();
+  auto fetched = quorvelctl({"--json", "fetch-exporting"});
+  EXPECT_EQ(fetched.status, 0) << fetched.output;
+  EXPECT_EQ(fetched.output, "{\"compositionAVURLs\":[]}\n");
+  EXPECT_EQ(quorvelctl({"fetch-exporting", "--json"}).output,
+            fetched.output);  // options follow too
+  auto captured = quorvelctl({"capture", path("x.m4a")});
+  EXPECT_EQ(captured.status, 0) << captured.output;
+  EXPECT_TRUE(captured.output.starts_with("capture 2 file://")) << captured.output;
+  EXPECT_EQ(quorvelctl({"end", "capture", "two", "file:///x.m4a", "nope"}).status, 2);
+  EXPECT_EQ(DaemonProcess::quorvelctl("unix:path=/nonexistent/bus", {"fetch-exporting"}).status, 3);
+
+  // The command says its pid, so the test can end it once quorvelctl is gone.
+  const std::string recording = path("Held.m4a");
+  DaemonProcess holder(DaemonProcess::programPath("quorvelctl"),
+                       {"--bus-address", bus_.address(), "capture", recording, "--", "sh", "-c",
+                        "echo held $$ >&2; exec sleep 600"});
+  ASSERT_TRUE(holder.waitForLine("held ")) << holder.output() << daemon->output();
+  const pid_t command = std::stoi(holder.linesContaining("held ").at(0).substr(5));
+  auto refused = quorvelctl({"trim", recording});
+  EXPECT_EQ(refused.status, 1);
+  EXPECT_TRUE(
+      refused.output.starts_with("quorvelctl: org.quorvel.SavedRecordingService.Error."
+                                 "ConflictingSession (301): Error Domain="))
+      << refused.output;
+  holder.sendSignal(SIGKILL);
+  ::kill(command, SIGKILL);
+  EXPECT_EQ(holder.waitForExit(), -SIGKILL);
+  EXPECT_TRUE(daemon->waitForLine("for terminated connection")) << daemon->output();
+
+  EXPECT_EQ(quorvelctl({"trim", recording, "--", "true"}).status, 0) << daemon->output();
+  EXPECT_EQ(quorvelctl({"capture", recording, "--", "false"}).status, 1);
+  EXPECT_EQ(quorvelctl({"capture", recording, "--", "true"}).status, 0) << daemon->output();
+  daemon->sendSignal(SIGUSR1);
+  EXPECT_TRUE(daemon->waitForLines("*** No Active Sessions ***", 1));
+  daemon->sendSignal(SIGUSR1);
+  EXPECT_TRUE(daemon->waitForLines("*** No Active Sessions ***", 2));
+  EXPECT_EQ(quorvelctl({"fetch-exporting"}).status, 0) << daemon->output();
+}
+
+TEST_F(DaemonTest, ForeignClientsGetTheInterfaceAndItsErrors) {
+  auto daemon = serve();
+  auto introspection = gdbus("introspect");
   ASSERT_EQ(introspection.status, 0) << introspection.output;
   EXPECT_NE(introspection.output.find("interface org.quorvel.SavedRecordingService1"),
             std::string::npos);
   EXPECT_NE(introspection.output.find("PrepareToExport(in  s compositionAVURL,"), std::string::npos)
       << introspection.output;
-}
 
-TEST_F(DaemonTest, ClientLibraryGetsAnswersAndErrorsAsValues) {
-  auto daemon = startDaemon();
-  auto client = SavedRecordingServiceClient::connect(bus_.address());
-  ASSERT_TRUE(client) << client.error();
-
-  auto exporting = (*client)->fetchExportingCompositionAVURLs();
-  ASSERT_TRUE(exporting) << exporting.error();
-  EXPECT_TRUE(exporting->empty());
-
-  // Two previews share the recording; a capture beside them is refused.
-  auto url = platform::URL::fileURLWithPath(recordings_.string() + "/Walk in the park.m4a");
-  auto first = (*client)->prepareToPreview(url);
-  auto second = (*client)->prepareToPreview(url);
-  ASSERT_TRUE(first && second) << daemon->output();
-  EXPECT_EQ(first->accessType(), 1);
-  EXPECT_FALSE(*first == *second);
-  auto capture = (*client)->prepareToCapture(url);
-  ASSERT_FALSE(capture);
-  EXPECT_EQ(capture.error().domain(), "org.quorvel.SavedRecordingService.ErrorDomain");
-  EXPECT_EQ(capture.error().code(), 301);
-  EXPECT_TRUE(daemon->waitForLine(
-      "[SavedRecordingService] Received request to prepare 'Walk in the park.m4a' for capture..."));
-
-  // Once both are handed back (one through another connection: tokens are
-  // capabilities), the capture is granted.
-  (*client)->endAccessSessionWithToken(*first);
-  auto other = SavedRecordingServiceClient::connect(bus_.address());
-  ASSERT_TRUE(other);
-  (*other)->endAccessSessionWithToken(*second);
-  EXPECT_TRUE(daemon->waitForLines("Finally closing access session", 2)) << daemon->output();
-  auto granted = (*client)->prepareToCapture(url);
-  ASSERT_TRUE(granted) << granted.error();
-  EXPECT_EQ(granted->accessType(), 2);
-}
-
-TEST_F(DaemonTest, AKilledClientsSessionsCloseAndTheRecordingIsFreed) {
-  auto daemon = startDaemon();
-  std::string recording = recordings_.string() + "/Held.m4a";
-  // quorvelctl holds a capture session while its command runs; the command
-  // says its pid so the test can end it once quorvelctl is gone.
-  DaemonProcess holder(DaemonProcess::programPath("quorvelctl"),
-                       {"--bus-address", bus_.address(), "capture", recording, "--", "sh", "-c",
-                        "echo held $$ >&2; exec sleep 600"});
-  ASSERT_TRUE(holder.waitForLine("held ")) << holder.output() << daemon->output();
-  pid_t command = std::stoi(holder.linesContaining("held ").at(0).substr(5));
-
-  auto refused = quorvelctl({"trim", recording});
-  EXPECT_EQ(refused.status, 1);
-  EXPECT_NE(refused.output.find("quorvelctl: org.quorvel.SavedRecordingService.Error."
-                                "ConflictingSession (301): Error Domain="),
-            std::string::npos)
-      << refused.output;
-
-  holder.sendSignal(SIGKILL);
-  ::kill(command, SIGKILL);
-  EXPECT_EQ(holder.waitForExit(), -SIGKILL);
-  EXPECT_TRUE(daemon->waitForLine("Terminating access session")) << daemon->output();
-  EXPECT_TRUE(daemon->waitForLine("for terminated connection: <connection :1."));
-  EXPECT_TRUE(daemon->waitForLine("Closing access session"));
-
-  // The recording is free again; quorvelctl holds a trim while `true` runs
-  // and hands it back whatever the outcome.
-  auto trimmed = quorvelctl({"trim", recording, "--", "true"});
-  EXPECT_EQ(trimmed.status, 0) << trimmed.output << daemon->output();
-  auto failed = quorvelctl({"capture", recording, "--", "false"});
-  EXPECT_EQ(failed.status, 1) << failed.output;
-  EXPECT_EQ(quorvelctl({"capture", recording, "--", "true"}).status, 0) << daemon->output();
-  daemon->sendSignal(SIGUSR1);
-  EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
-}
-
-// A recording made with quorvelctl from three files is exported with its
-// waveform over the bus: the composed file decodes to the fragments' length
-// within one AAC frame per join, and the waveform covers the same length.
-TEST_F(DaemonTest, AnExportComposesTheFragmentsAndCachesTheWaveform) {
-  auto daemon = startDaemon();
-  std::filesystem::create_directories(recordings_);
-  std::vector<std::string> made{"new", "--recordings-dir", recordings_.string(), "Walk"};
-  const double seconds[] = {1.5, 0.75, 1.0};
-  for (int i = 0; i < 3; ++i) {
-    // Outside the recordings directory, where the orphan recovery run would
-    // take them for recordings of their own.
-    std::string file = (recordings_.string() + "-take" + std::to_string(i) + ".wav");
-    ASSERT_TRUE(testing::writeTone(file, seconds[i], "wav"));
-    made.push_back(file);
-  }
-  auto created = quorvelctl(made);
-  ASSERT_EQ(created.status, 0) << created.output;
-  const std::filesystem::path audio = recordings_ / "Walk.m4a";
-
-  auto exported = quorvelctl({"export", audio.string(), "--cache-waveform", "--", "true"});
-  ASSERT_EQ(exported.status, 0) << exported.output << daemon->output();
-  auto pcm = testing::decodeToPCM(audio.string());
-  ASSERT_TRUE(pcm) << pcm.error();
-  constexpr double kAACFrame = 1024.0 / 44100.0;  // the longer of the rates we write
-  EXPECT_NEAR(pcm->seconds(), 3.25, 2 * kAACFrame + 0.001);
-  auto waveform =
-      RCReadWaveformFile(platform::URL::fileURLWithPath((recordings_ / "Walk.waveform").string()));
-  ASSERT_TRUE(waveform) << waveform.error();
-  EXPECT_NEAR(double(waveform->length() * waveform->samplesPerPixel()) / waveform->sampleRate(),
-              pcm->seconds(), 0.05);
-  // The database's duration follows the composed audio.
-  auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
-  ASSERT_TRUE(model);
-  auto recording = (*model)->recordingWithURL(platform::URL::fileURLWithPath(audio.string()));
-  ASSERT_TRUE(recording && *recording);
-  EXPECT_NEAR((*recording)->duration(), 3.25, 0.1);
-  auto info = quorvelctl({"info", "--recordings-dir", recordings_.string(), audio.string()});
-  EXPECT_EQ(info.output.find("not composed"), std::string::npos) << info.output;
-}
-
-// A directory seeded with orphans: the run (here the one that enabling
-// orphan handling starts, which answers after it) keeps one of two identical
-// files and recovers it with the title stored in it, deletes the unplayable
-// file, and leaves what is not a recording alone.
-TEST_F(DaemonTest, OrphansDroppedIntoTheDirectoryAreRecoveredOrRemoved) {
-  std::filesystem::create_directories(recordings_);
-  auto path = [&](const char* name) { return (recordings_ / name).string(); };
-  ASSERT_TRUE(testing::writeTone(path("Found.m4a"), 1.0, "m4a"));
-  ASSERT_TRUE(RCMediaEngine::current()->writeTitle(
-      platform::URL::fileURLWithPath(path("Found.m4a")), "Found on a card", ""));
-  std::filesystem::copy_file(path("Found.m4a"), path("Found again.m4a"));
-  std::filesystem::copy_file(path("Found.m4a"), path("notes.txt"));
-  {
-    std::ofstream noise(path("Noise.wav"));
-    noise << std::string(4096, 'x');
-  }
-  auto daemon = startDaemon();
-  auto enabled = quorvelctl({"enable-orphan-handling"});
-  ASSERT_EQ(enabled.status, 0) << enabled.output;
-
-  EXPECT_TRUE(std::filesystem::exists(path("Found.m4a")));
-  EXPECT_TRUE(std::filesystem::exists(path("notes.txt")));
-  EXPECT_FALSE(std::filesystem::exists(path("Found again.m4a"))) << daemon->output();
-  EXPECT_FALSE(std::filesystem::exists(path("Noise.wav")));
-  auto listed = quorvelctl({"list", "--recordings-dir", recordings_.string()});
-  ASSERT_EQ(listed.status, 0) << listed.output;
-  EXPECT_NE(listed.output.find("Found on a card"), std::string::npos) << listed.output;
-  EXPECT_EQ(listed.output.find("Noise"), std::string::npos) << listed.output;
-}
-
-TEST_F(DaemonTest, ForeignClientsGetTheContractsErrors) {
-  auto daemon = startDaemon();
-  auto missing = gdbusCall("PrepareToCapture", {""});
+  auto missing = call("PrepareToCapture", {""});
   EXPECT_NE(missing.status, 0);
   EXPECT_NE(missing.output.find("org.quorvel.SavedRecordingService.Error.MissingCompositionAVURL"),
             std::string::npos)
       << missing.output;
   EXPECT_NE(missing.output.find("Code=101"), std::string::npos);
-  EXPECT_TRUE(
-      daemon->waitForLine(".  compositionAVURL parameter is required for invocations of "
-                          "-prepareToCaptureToCompositionAVURL:accessRequestHandler:"));
-
-  auto wrongSignature = DaemonProcess::run(
-      {"dbus-send", "--bus=" + bus_.address(), "--print-reply", "--dest=" + std::string(kService),
-       kPath, std::string(kInterface) + ".PrepareToCapture", "int32:7"});
+  auto dbusSend = [&](std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), {"dbus-send", "--bus=" + bus_.address()});
+    return DaemonProcess::run(arguments);
+  };
+  auto wrongSignature =
+      dbusSend({"--print-reply", "--dest=org.quorvel.SavedRecordingService",
+                "/org/quorvel/SavedRecordingService",
+                "org.quorvel.SavedRecordingService1.PrepareToCapture", "int32:7"});
   EXPECT_NE(wrongSignature.output.find("org.freedesktop.DBus.Error.InvalidArgs"), std::string::npos)
       << wrongSignature.output;
-  auto unknown = gdbusCall("NoSuchMethod");
+  auto unknown = call("NoSuchMethod");
   EXPECT_NE(unknown.output.find("org.freedesktop.DBus.Error.UnknownMethod"), std::string::npos)
       << unknown.output;
-
-  // The daemon keeps serving.
-  auto fetched = gdbusCall("FetchExportingCompositionAVURLs");
+  auto fetched = call("FetchExportingCompositionAVURLs");
   EXPECT_EQ(fetched.status, 0) << fetched.output;
   EXPECT_NE(fetched.output.find("(@as [],)"), std::string::npos) << fetched.output;
 
-  // Launch events: a named one is posted in-process, one without a name is
-  // logged and ignored.
-  auto emit = [this](std::vector<std::string> arguments) {
-    std::vector<std::string> argv{"dbus-send", "--bus=" + bus_.address(), "--type=signal", "/",
-                                  "org.quorvel.Events1.Event"};
-    argv.insert(argv.end(), arguments.begin(), arguments.end());
-    return DaemonProcess::run(argv);
-  };
-  EXPECT_EQ(emit({}).status, 0);
+  // Launch events from the bus, without a name and with one.
+  EXPECT_EQ(dbusSend({"--type=signal", "/", "org.quorvel.Events1.Event"}).status, 0);
   EXPECT_TRUE(daemon->waitForLine("Ignoring a launch event without a name"));
-  EXPECT_EQ(emit({"string:com.example.RecordingsChanged"}).status, 0);
+  EXPECT_EQ(dbusSend({"--type=signal", "/", "org.quorvel.Events1.Event",
+                      "string:com.example.RecordingsChanged"})
+                .status,
+            0);
   EXPECT_TRUE(daemon->waitForLine("Posting launch event 'com.example.RecordingsChanged'"));
 }
 
-TEST_F(DaemonTest, QuorvelctlReportsResultsAndErrorsByExitStatus) {
-  auto daemon = startDaemon();
-  auto fetched = quorvelctl({"--json", "fetch-exporting"});
-  EXPECT_EQ(fetched.status, 0) << fetched.output;
-  EXPECT_EQ(fetched.output, "{\"compositionAVURLs\":[]}\n");
-  // Global options may follow the subcommand too.
-  EXPECT_EQ(quorvelctl({"fetch-exporting", "--json"}).output, fetched.output);
+// The media worker, in its sandbox, reads the orphans dropped into the
+// directory (keeping one of two identical files, with the title stored in
+// it, and deleting the unplayable one) and composes an export of a
+// recording made with quorvelctl from three files, with its waveform: the
+// composed file decodes to the fragments' length within one AAC frame per
+// join, and the waveform and the database follow it.
+TEST_F(DaemonTest, TheSandboxedWorkerRecoversOrphansAndComposesAnExport) {
+  useRecordings();
+  ASSERT_TRUE(testing::writeTone(path("Found.m4a"), 1.0, "m4a"));
+  ASSERT_TRUE(RCMediaEngine::current()->writeTitle(
+      platform::URL::fileURLWithPath(path("Found.m4a")), "Found on a card", ""));
+  fs::copy_file(path("Found.m4a"), path("Found again.m4a"));
+  fs::copy_file(path("Found.m4a"), path("notes.txt"));
+  testing::writeFile(path("Noise.wav"), std::string(4096, 'x'));
+  auto daemon = serve();
+  auto enabled = quorvelctl({"enable-orphan-handling"});  // answers after its run
+  ASSERT_EQ(enabled.status, 0) << enabled.output;
+  EXPECT_TRUE(fs::exists(path("Found.m4a")));
+  EXPECT_TRUE(fs::exists(path("notes.txt")));
+  EXPECT_FALSE(fs::exists(path("Found again.m4a"))) << daemon->output();
+  EXPECT_FALSE(fs::exists(path("Noise.wav")));
+  auto listed = quorvelctl({"list", "--recordings-dir", recordings_.string()});
+  EXPECT_NE(listed.output.find("Found on a card"), std::string::npos) << listed.output;
 
-  auto captured = quorvelctl({"capture", recordings_.string() + "/x.m4a"});
-  EXPECT_EQ(captured.status, 0) << captured.output;
-  EXPECT_EQ(captured.output.rfind("capture 2 file://", 0), 0u) << captured.output;
-  // quorvelctl's connection ends with it, and so does that session.
-
-  auto usage = quorvelctl({"end", "capture", "two", "file:///x.m4a", "nope"});
-  EXPECT_EQ(usage.status, 2) << usage.output;
-
-  auto unreachable = DaemonProcess::run({DaemonProcess::programPath("quorvelctl"), "--bus-address",
-                                         "unix:path=/nonexistent/bus", "fetch-exporting"});
-  EXPECT_EQ(unreachable.status, 3) << unreachable.output;
-}
-
-TEST_F(DaemonTest, DebugSignalDumpsWithoutEndingTheProcess) {
-  auto daemon = startDaemon();
-  daemon->sendSignal(SIGUSR1);
-  EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
-  daemon->sendSignal(SIGUSR1);
-  EXPECT_TRUE(daemon->waitForLine("*** No Active Sessions ***"));
-  auto fetched = gdbusCall("FetchExportingCompositionAVURLs");
-  EXPECT_EQ(fetched.status, 0) << fetched.output << daemon->output();
+  std::vector<std::string> made{"new", "--recordings-dir", recordings_.string(), "Walk"};
+  for (double seconds : {1.5, 0.75, 1.0}) {
+    made.push_back(temp_ / ("take" + std::to_string(made.size()) + ".wav"));
+    ASSERT_TRUE(testing::writeTone(made.back(), seconds, "wav"));
+  }
+  auto created = quorvelctl(made);
+  ASSERT_EQ(created.status, 0) << created.output;
+  auto exported = quorvelctl({"export", path("Walk.m4a"), "--cache-waveform", "--", "true"});
+  ASSERT_EQ(exported.status, 0) << exported.output << daemon->output();
+  auto pcm = testing::decodeToPCM(path("Walk.m4a"));
+  ASSERT_TRUE(pcm) << pcm.error();
+  EXPECT_NEAR(pcm->seconds(), 3.25, 2 * 1024.0 / 44100.0 + 0.001);
+  auto waveform = RCReadWaveformFile(platform::URL::fileURLWithPath(path("Walk.waveform")));
+  ASSERT_TRUE(waveform) << waveform.error();
+  EXPECT_NEAR(double(waveform->length() * waveform->samplesPerPixel()) / waveform->sampleRate(),
+              pcm->seconds(), 0.05);
+  auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+  ASSERT_TRUE(model);
+  auto recording = (*model)->recordingWithURL(platform::URL::fileURLWithPath(path("Walk.m4a")));
+  ASSERT_TRUE(recording && *recording);
+  EXPECT_NEAR((*recording)->duration(), 3.25, 0.1);
+  auto info = quorvelctl({"info", "--recordings-dir", recordings_.string(), path("Walk.m4a")});
+  EXPECT_EQ(info.output.find("not composed"), std::string::npos) << info.output;
 }
 
 TEST_F(DaemonTest, BadOptionsExitWithUsageStatusAndAMessage) {
@@ -315,19 +262,297 @@ TEST_F(DaemonTest, BadOptionsExitWithUsageStatusAndAMessage) {
 }
 
 TEST_F(DaemonTest, ExitsByItselfOnceIdleAndASecondDaemonIsRefused) {
-  auto daemon = startDaemon("1");
-  // A second daemon cannot own the name: a clear message and status 1.
+  auto daemon = serve("1");
   DaemonProcess second({"--bus-address", bus_.address(), "--recordings-dir", recordings_.string()});
   EXPECT_EQ(second.waitForExit(), 1);
   EXPECT_NE(second.output().find("quorveld: cannot serve org.quorvel.SavedRecordingService"),
             std::string::npos)
       << second.output();
-
   EXPECT_EQ(daemon->waitForExit(), 0) << daemon->output();
-  EXPECT_EQ(
-      daemon->linesContaining("No XPC transactions remain. Ending root XPC transaction.").size(),
-      1u);
   EXPECT_EQ(daemon->linesContaining("[quorveld] Exiting xpc service").size(), 1u);
+}
+
+// The daemon reads audio only through its quorvel-media workers.
+// The quorvel-media children of `pid`, from every one of its threads.
+std::vector<pid_t> workersOf(pid_t pid) {
+  std::vector<pid_t> workers;
+  for (const auto& task : fs::directory_iterator("/proc/" + std::to_string(pid) + "/task")) {
+    std::ifstream list(task.path() / "children");
+    for (pid_t child; list >> child;) {
+      std::string name;
+      std::getline(std::ifstream("/proc/" + std::to_string(child) + "/comm"), name);
+      if (name == "quorvel-media") workers.push_back(child);
+    }
+  }
+  return workers;
+}
+
+class MediaWorkerDaemonTest : public DaemonTest {
+ protected:
+  void SetUp() override { useRecordings(); }
+
+  // A recording `name` with fragments of the given lengths, in `format`.
+  RCCompositionEditor makeRecording(const std::string& name, const std::string& format,
+                                    std::initializer_list<double> seconds) {
+    auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+    auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, name, format);
+    const std::string source = (temp_ / "source.wav").string();
+    for (double length : seconds) {
+      EXPECT_TRUE(testing::writeTone(source, length, "wav"));
+      EXPECT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(source)));
+    }
+    return std::move(*editor);
+  }
+  // A recording "Walk" whose last capture wrote 0.75 s of audio and crashed
+  // before recording its length.
+  platform::URL crashedRecording() {
+    auto editor = makeRecording("Walk", "wav", {1.0});
+    auto captured = editor.beginFragment("wav");
+    EXPECT_TRUE(captured && testing::writeTone(captured->path(), 0.75, "wav"));
+    return editor.composedAVURL();
+  }
+  std::optional<double> lastFragmentDuration() {
+    auto composition = RCComposition::compositionLoadedFromCompositionBundleURL(
+        platform::URL::fileURLWithPath((recordings_ / "Walk.composition").string()));
+    if (!composition) return std::nullopt;
+    return composition->fragments().back().contentDuration();
+  }
+};
+
+TEST_F(MediaWorkerDaemonTest, RepairRunsInAWorkerThatDiesWithTheDaemon) {
+  platform::URL walk = crashedRecording();
+  ASSERT_FALSE(lastFragmentDuration());
+  auto daemon = serve();
+  auto client = connect();
+  auto token = client->prepareToCapture(walk);
+  ASSERT_TRUE(token) << token.error() << daemon->output();
+  ASSERT_TRUE(daemon->waitForLine("repaired the fragment metadata of Walk.composition"))
+      << daemon->output();
+  EXPECT_NEAR(lastFragmentDuration().value_or(0), 0.75, 0.01);
+
+  const auto workers = workersOf(daemon->pid());
+  ASSERT_EQ(workers.size(), 1u) << daemon->output();
+  const int worker = int(::syscall(SYS_pidfd_open, workers[0], 0));
+  ASSERT_GE(worker, 0);
+  daemon->sendSignal(SIGKILL);
+  ASSERT_TRUE(daemon->waitForExit());
+  pollfd ended{worker, POLLIN, 0};
+  EXPECT_EQ(::poll(&ended, 1, 10000), 1) << "the worker outlived the daemon";
+  ::close(worker);
+}
+
+TEST_F(MediaWorkerDaemonTest, WithoutItsWorkerTheDaemonStillServesAndSaysWhy) {
+  platform::URL walk = crashedRecording();
+  const std::string missing = (temp_ / "no-such-worker").string();
+  testing::ScopedEnvironment environment{{"QUORVEL_MEDIA_WORKER", missing.c_str()}};
+  auto daemon = serve();
+  auto client = connect();
+  auto token = client->prepareToCapture(walk);
+  ASSERT_TRUE(token) << token.error() << daemon->output();
+  EXPECT_TRUE(daemon->waitForLine("cannot start the media worker " + missing)) << daemon->output();
+  EXPECT_FALSE(lastFragmentDuration());  // nothing it could not read was dropped or changed
+  client->endAccessSessionWithToken(*token);
+  EXPECT_TRUE(client->prepareToPreview(walk)) << daemon->output();
+  EXPECT_TRUE(client->fetchExportingCompositionAVURLs());
+}
+
+TEST_F(MediaWorkerDaemonTest, AWorkerOrTheDaemonKilledMidExportLeavesNothingTheNextExportTrips) {
+  // Wav into m4a: composing re-encodes, which takes a while.
+  const platform::URL audio = makeRecording("Long", "m4a", {30.0, 30.0, 30.0}).composedAVURL();
+  auto daemon = serve();
+  auto client = connect();
+  // Starts an export and, once the composer's temporary output appears,
+  // kills `victim`; the export's answer, when it comes.
+  auto killMidExport = [&](const std::function<void()>& victim) {
+    testing::DirectoryWatch watch(recordings_, IN_CREATE);
+    platform::Result<RCSSavedRecordingAccessToken> answer =
+        platform::fail(platform::Error("", 0, ""));
+    std::thread exporter([&] { answer = client->prepareToExport(audio, false); });
+    EXPECT_TRUE(watch.waitForCreation(".Long.m4a"));
+    victim();
+    exporter.join();
+    return answer;
+  };
+  EXPECT_FALSE(killMidExport([&] {
+    for (pid_t worker : workersOf(daemon->pid())) ::kill(worker, SIGKILL);
+  }));
+  EXPECT_TRUE(daemon->waitForLine("died with SIGKILL")) << daemon->output();
+  EXPECT_FALSE(fs::exists(audio.path()));  // no half-written composed file
+
+  // The daemon itself killed mid-compose (its worker dies with it): the
+  // next daemon's export composes over what was left, and only the
+  // recording's files remain.
+  killMidExport([&] {
+    daemon->sendSignal(SIGKILL);
+    ASSERT_TRUE(daemon->waitForExit());
+  });
+  EXPECT_FALSE(fs::exists(audio.path()));
+  daemon = serve();
+  client = connect();
+  auto exported = client->prepareToExport(audio, false);
+  ASSERT_TRUE(exported) << exported.error() << daemon->output();
+  client->endAccessSessionWithToken(*exported);
+  EXPECT_TRUE(fs::exists(audio.path()));
+  ASSERT_TRUE(RCComposition::load(RCComposition::compositionBundleURLForComposedAVURL(audio)));
+  for (const auto& entry : fs::directory_iterator(recordings_))
+    EXPECT_NE(entry.path().filename().string().front(), '.') << entry.path();
+}
+
+// The recordings directory on a full disk: a small tmpfs mounted in a
+// private mount namespace of the test (and so of the daemon and the media
+// worker it starts), filled to the last byte. What cannot be written fails
+// with an error the caller sees; nothing already there is lost, no temporary
+// file stays, and the same request succeeds once there is room again. Needs
+// root; skipped otherwise.
+class FullDiskTest : public DaemonTest {
+ protected:
+  // Logged each time the daemon has no work left.
+  static constexpr const char* kIdle = "No XPC transactions remain";
+
+  void SetUp() override {
+    if (::geteuid() != 0) GTEST_SKIP() << "needs root to mount a small file system";
+    // The namespace is the calling thread's, and so of the processes it
+    // starts: the daemon, its media worker, quorvelctl.
+    if (::unshare(CLONE_NEWNS) != 0 ||
+        ::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) {
+      GTEST_SKIP() << "no private mount namespace: " << std::strerror(errno);
+    }
+    fs::create_directories(disk_);
+    if (::mount("quorvel-test", disk_.c_str(), "tmpfs", 0, "size=8m,mode=0700") != 0)
+      GTEST_SKIP() << "cannot mount a tmpfs: " << std::strerror(errno);
+    mounted_ = true;
+    recordings_ = disk_ / "Recordings";
+    useRecordings();
+    daemon_ = serve();
+  }
+  void TearDown() override {
+    daemon_.reset();
+    DaemonTest::TearDown();
+    if (mounted_) ::umount2(disk_.c_str(), MNT_DETACH);
+  }
+
+  // A tone made outside the disk, so the disk holds only what is tested.
+  std::string take(double seconds, double frequency) {
+    const std::string file = (temp_ / "take.wav").string();
+    EXPECT_TRUE(testing::writeTone(file, seconds, "wav", 44100, 1, frequency));
+    return file;
+  }
+  // Fills the disk to its last byte.
+  void fill() {
+    const int fd = ::open((disk_ / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+    ASSERT_GE(fd, 0) << std::strerror(errno);
+    const std::string bytes(1 << 16, 'x');
+    for (std::size_t chunk = bytes.size(); chunk > 0; chunk /= 2)
+      while (::write(fd, bytes.data(), chunk) > 0) {
+      }
+    ::close(fd);
+  }
+  void makeRoom() { fs::remove(disk_ / "filler"); }
+  // Every file under the recordings directory but the database's and the
+  // waveforms (a finalization removes the old one first: it describes the
+  // old audio), by path, with its digest; and no temporary file among them.
+  std::map<std::string, std::string> contents() const {
+    std::map<std::string, std::string> files;
+    for (const auto& entry : fs::recursive_directory_iterator(recordings_)) {
+      const std::string name = entry.path().filename();
+      EXPECT_FALSE(RCIsAtomicReplaceTempName(name)) << entry.path();
+      if (!entry.is_regular_file() || name.starts_with(RCSavedRecordingsModel::kDatabaseFileName) ||
+          entry.path().extension() == ".waveform") {
+        continue;
+      }
+      auto digest = RCMD5DataForPath(entry.path().string());
+      files[fs::relative(entry.path(), recordings_)] = digest ? RCMD5HexString(*digest) : "";
+    }
+    return files;
+  }
+
+  fs::path disk_ = temp_ / "disk";
+  bool mounted_ = false;
+  std::unique_ptr<DaemonProcess> daemon_;
+};
+
+// A recording composed once and then given a second take is exported on a
+// full disk: the export fails with the disk's error, the old composed file
+// and the fragments stay as they were, and once there is room the export
+// composes both takes.
+TEST_F(FullDiskTest, AnExportThatCannotBeWrittenFailsAndKeepsTheRecording) {
+  auto made = quorvelctl({"new", "--recordings-dir", recordings_.string(), "Walk", take(2.0, 440)});
+  ASSERT_EQ(made.status, 0) << made.output;
+  const std::string audio = path("Walk.m4a");
+  auto exported = quorvelctl({"export", audio, "--", "true"});
+  ASSERT_EQ(exported.status, 0) << exported.output << daemon_->output();
+  auto editor = RCCompositionEditor::editorForComposedAVURL(platform::URL::fileURLWithPath(audio));
+  ASSERT_TRUE(editor) << editor.error();
+  auto appended =
+      editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take(20.0, 660)));
+  ASSERT_TRUE(appended) << appended.error();
+  const auto before = contents();
+
+  ASSERT_NO_FATAL_FAILURE(fill());
+  const std::size_t idle = daemon_->linesContaining(kIdle).size();
+  auto failed = quorvelctl({"export", audio, "--", "true"});
+  EXPECT_NE(failed.status, 0) << failed.output;
+  // The reply carries no token (and no error); the daemon logs why.
+  EXPECT_NE(failed.output.find("could not be finalized"), std::string::npos) << failed.output;
+  EXPECT_FALSE(daemon_->linesContaining("No space left on device").empty()) << daemon_->output();
+  // quorvelctl leaving while its session still closes makes the daemon try
+  // the recording once more, which may still run when the daemon's
+  // keep-alives are over: only once it is done is the directory final.
+  ASSERT_TRUE(daemon_->waitForLines(kIdle, idle + 1)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLines("FINISHED asset finalization",
+                                    daemon_->linesContaining("RUNNING asset finalization").size()));
+  EXPECT_EQ(contents(), before) << daemon_->output();
+
+  makeRoom();
+  auto again = quorvelctl({"export", audio, "--", "true"});
+  ASSERT_EQ(again.status, 0) << again.output << daemon_->output();
+  auto pcm = testing::decodeToPCM(audio);
+  ASSERT_TRUE(pcm) << pcm.error();
+  EXPECT_NEAR(pcm->seconds(), 22.0, 0.1);
+  contents();  // no temporary file stays
+}
+
+// The orphan run on a full disk, over a bundle and a file the database
+// lacks, a copy of that file and a file without audio: the database cannot
+// take the recovered recordings, so the run stops and deletes nothing; with
+// room again the next run recovers them and deletes the copy and the junk.
+TEST_F(FullDiskTest, AnOrphanRunThatCannotSaveTheDatabaseDeletesNothing) {
+  // The daemon opens (and so makes) the database in a run over the empty
+  // directory, and keeps it open; the orphans come once its start-up run
+  // is over and orphan handling is off.
+  ASSERT_TRUE(daemon_->waitForLines("Keep-alive for orphan handling", 2)) << daemon_->output();
+  ASSERT_EQ(quorvelctl({"enable-orphan-handling"}).status, 0);
+  ASSERT_EQ(quorvelctl({"disable-orphan-handling"}).status, 0);
+  RCCompositionManifest manifest;
+  manifest.composedName = "Lost.m4a";
+  manifest.fragments.push_back({.file = "Lost-1.wav", .contentDuration = 1.0});
+  manifest.recomputeTimeRanges();
+  testing::writeFile(path("Lost.composition/manifest.json"), manifest.serialize());
+  ASSERT_TRUE(testing::writeTone(path("Lost.composition/Lost-1.wav"), 1.0, "wav"));
+  testing::ToneOptions found;
+  found.frequencyHz = 660;
+  found.metadata = {{"title", "Found on a card"}};
+  ASSERT_TRUE(testing::writeTone(path("Found.m4a"), found));
+  fs::copy_file(path("Found.m4a"), path("Found again.m4a"));
+  testing::writeFile(path("Noise.wav"), std::string(4096, 'x'));
+  const auto before = contents();
+
+  ASSERT_NO_FATAL_FAILURE(fill());
+  auto enabled = quorvelctl({"enable-orphan-handling"});
+  EXPECT_EQ(enabled.status, 0) << enabled.output;
+  EXPECT_FALSE(daemon_->linesContaining("cannot save the recordings database").empty())
+      << daemon_->output();
+  EXPECT_EQ(contents(), before) << daemon_->output();
+
+  makeRoom();
+  ASSERT_EQ(quorvelctl({"disable-orphan-handling"}).status, 0);
+  ASSERT_EQ(quorvelctl({"enable-orphan-handling"}).status, 0);
+  auto model = RCSavedRecordingsModel::modelWithDirectory(recordings_.string());
+  ASSERT_TRUE(model) << model.error();
+  auto lost = (*model)->recordingWithURL(platform::URL::fileURLWithPath(path("Lost.m4a")));
+  EXPECT_TRUE(lost && *lost) << daemon_->output();
+  EXPECT_NE(fs::exists(path("Found.m4a")), fs::exists(path("Found again.m4a")));
+  EXPECT_FALSE(fs::exists(path("Noise.wav")));
 }
 
 }  // namespace

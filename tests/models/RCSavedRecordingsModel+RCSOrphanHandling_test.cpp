@@ -23,68 +23,42 @@
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/DelegatingMediaEngine.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
+#include "tests/support/ScopedEnvironment.h"
 
 namespace quorvel {
 namespace {
 
 namespace fs = std::filesystem;
 
-// Probing a file whose name contains "Flaky" fails as an I/O error does.
-class FlakyDiskEngine : public testing::DelegatingMediaEngine {
+// The in-process engine, with a hook before each probe (which may fail it
+// or change the file) and the files of every batch of probes remembered.
+class ProbeHookEngine : public testing::DelegatingMediaEngine {
  public:
+  explicit ProbeHookEngine(std::function<platform::Status(const platform::URL&)> hook = {})
+      : hook_(std::move(hook)) {}
   platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
-    if (url.lastPathComponent().find("Flaky") != std::string::npos)
-      return platform::fail(platform::posixError(EIO, "read " + url.path()));
+    if (auto hooked = hook_ ? hook_(url) : platform::Status(); !hooked)
+      return platform::fail(hooked.error());
     return DelegatingMediaEngine::probe(url);
   }
-};
-
-// Remembers the files of every probeMany call.
-class BatchRecordingEngine : public testing::DelegatingMediaEngine {
- public:
   std::vector<platform::Result<RCMediaProbe>> probeMany(
       const std::vector<platform::URL>& urls) override {
-    std::vector<std::string> names;
-    for (const platform::URL& url : urls) names.push_back(url.lastPathComponent());
-    batches.push_back(std::move(names));
+    batches.emplace_back();
+    for (const platform::URL& url : urls) batches.back().push_back(url.lastPathComponent());
     return DelegatingMediaEngine::probeMany(urls);
   }
   std::vector<std::vector<std::string>> batches;
-};
 
-// While it reads a file whose name starts with "Growing", appends to it (a
-// copy still coming in); one starting with "Replaced", renames another file
-// over it (a sync tool's atomic replace).
-class BusyDirectoryEngine : public testing::DelegatingMediaEngine {
- public:
-  platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
-    const std::string name = url.lastPathComponent();
-    if (name.starts_with("Growing")) {
-      testing::writeFile(url.path(), testing::readFile(url.path()) + "more");
-    } else if (name.starts_with("Replaced")) {
-      testing::writeFile(url.path() + ".new", std::string(3400, 'r'));
-      fs::rename(url.path() + ".new", url.path());
-    }
-    return DelegatingMediaEngine::probe(url);
-  }
+ private:
+  std::function<platform::Status(const platform::URL&)> hook_;
 };
 
 class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
  protected:
-  void SetUp() override {
-    RecordingsDirectoryTest::SetUp();
-    if (const char* language = std::getenv("LANGUAGE")) savedLanguage_ = language;
-  }
   void TearDown() override {
-    if (savedLanguage_) {
-      ::setenv("LANGUAGE", savedLanguage_->c_str(), 1);
-    } else {
-      ::unsetenv("LANGUAGE");
-    }
     RCUseInProcessMediaEngine();
     RecordingsDirectoryTest::TearDown();
   }
-
   std::shared_ptr<RCSavedRecordingsModel> model() {
     if (!model_) {
       auto opened = RCSavedRecordingsModel::modelWithDirectory(
@@ -103,6 +77,9 @@ class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
   }
   void copy(const std::string& from, const std::string& to) {
     fs::copy_file(recordingsPath(from), recordingsPath(to));
+  }
+  auto insert(const std::string& name) {
+    return model()->insertRecordingWithAudioFile(recordingsPath(name), 1.0, platform::Date::now());
   }
   static void age(const fs::path& path, double seconds) {
     fs::last_write_time(
@@ -125,9 +102,7 @@ class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
   }
   bool present(const std::string& name) const { return fs::exists(recordingsPath(name)); }
   std::size_t linesContaining(const std::string& text) {
-    auto lines = logLines();
-    return std::count_if(lines.begin(), lines.end(),
-                         [&](const std::string& line) { return line.find(text) != line.npos; });
+    return std::ranges::count_if(logLines(), [&](const auto& line) { return line.contains(text); });
   }
   // Makes every database recording an orphan: a new, empty database.
   void forgetDatabase() {
@@ -135,9 +110,16 @@ class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
     for (const char* suffix : {"", "-wal", "-shm"})
       fs::remove(recordingsPath(std::string(RCSavedRecordingsModel::kDatabaseFileName) + suffix));
   }
+  // A recording `name` with one fragment of a second, not composed.
+  void makeBundle(const std::string& name) {
+    const std::string take = (root_ / "take.wav").string();
+    ASSERT_TRUE(testing::writeTone(take, 1.0, "wav"));
+    auto editor = RCCompositionEditor::createCompositionForNewRecording(*model(), name);
+    ASSERT_TRUE(editor) << editor.error();
+    ASSERT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take)));
+  }
 
   std::shared_ptr<RCSavedRecordingsModel> model_;
-  std::optional<std::string> savedLanguage_;
 };
 
 TEST(PathOrderTest, ShorterFirstThenDigitRunsByValue) {
@@ -159,7 +141,7 @@ TEST(PathOrderTest, ShorterFirstThenDigitRunsByValue) {
 // batch before the pass, which uses each answer for its own file.
 TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
   tone("Kept.m4a", 1.0);
-  model()->insertRecordingWithAudioFile(recordingsPath("Kept.m4a"), 1.0, platform::Date::now());
+  insert("Kept.m4a");
   copy("Kept.m4a", "Copy of kept.m4a");
   copy("Kept.m4a", "Same size.m4a");
   {
@@ -179,7 +161,7 @@ TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
   copy("Recording.m4a", "Upper.M4A");
   copy("Recording.m4a", "Other.mp3");
   fs::create_directory(recordingsPath("Folder.m4a"));
-  auto engine = std::make_shared<BatchRecordingEngine>();
+  auto engine = std::make_shared<ProbeHookEngine>();
   RCMediaEngine::setCurrent(engine);
 
   auto statistics = run();
@@ -209,16 +191,11 @@ TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
 }
 
 // Bundles: one a client names through "..", one recovered into the database
-// with its record written into its manifest, an empty old one removed, an
-// empty young one and an unloadable one left alone.
+// with its record written into its manifest (though files of its name
+// outside the directory are in use), an empty old one removed, an empty
+// young one and an unloadable one left alone.
 TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
-  const std::string take = (root_ / "take.wav").string();
-  ASSERT_TRUE(testing::writeTone(take, 1.0, "wav"));
-  for (const char* name : {"Walk", "Stray"}) {
-    auto editor = RCCompositionEditor::createCompositionForNewRecording(*model(), name);
-    ASSERT_TRUE(editor) << editor.error();
-    ASSERT_TRUE(editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take)));
-  }
+  for (const char* name : {"Walk", "Stray"}) ASSERT_NO_FATAL_FAILURE(makeBundle(name));
   for (const char* name : {"Hollow", "Fresh"})
     ASSERT_TRUE(RCCompositionEditor::createCompositionForNewRecording(*model(), name));
   fs::create_directory(recordingsPath("Broken.composition"));
@@ -228,7 +205,10 @@ TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
   for (const char* name : {"Hollow.composition", "Broken.composition", "Lower.COMPOSITION"})
     age(recordingsPath(name), 3600);
 
-  run({platform::URL::fileURLWithPath(recordingsPath("x/../Walk.m4a"))});
+  fs::copy_file(root_ / "take.wav", root_ / "Stray.m4a");
+  run({platform::URL::fileURLWithPath(recordingsPath("x/../Walk.m4a")),
+       platform::URL::fileURLWithPath((root_ / "Stray.m4a").string()),
+       platform::URL::fileURLWithPath((root_ / "Gone" / "Stray.m4a").string())});
 
   EXPECT_EQ(titles().size(), 1u);
   auto stray =
@@ -255,14 +235,19 @@ TEST_F(OrphanHandlingTest, NeverDeletesWhatItCouldNotProveOrphaned) {
   const fs::path alias = root_ / "Alias";
   fs::create_directory_symlink(recordings_, alias);
   RCSavedRecordingsModel::setSavedRecordingsDirectory(alias.string());
-  model()->insertRecordingWithAudioFile(recordingsPath("Only.m4a"), 1.0, platform::Date::now());
+  insert("Only.m4a");
   fs::create_hard_link(recordingsPath("Only.m4a"), recordingsPath("Linked.m4a"));
   tone("Flaky.m4a", 1.5);
   copy("Flaky.m4a", "Flaky copy.m4a");
   testing::writeFile(recordingsPath(".Old.m4a.abcdefgh.tmp"), "old");
   testing::writeFile(recordingsPath(".New.m4a.abcdefgh.tmp"), "new");
   age(recordingsPath(".Old.m4a.abcdefgh.tmp"), 2 * 3600);
-  RCMediaEngine::setCurrent(std::make_shared<FlakyDiskEngine>());
+  // Probing "Flaky" fails as an I/O error does.
+  RCMediaEngine::setCurrent(std::make_shared<ProbeHookEngine>([](const platform::URL& url) {
+    return url.lastPathComponent().starts_with("Flaky")
+               ? platform::fail(platform::posixError(EIO, "read " + url.path()))
+               : platform::Status();
+  }));
 
   run();
 
@@ -281,11 +266,7 @@ TEST_F(OrphanHandlingTest, NeverDeletesWhatItCouldNotProveOrphaned) {
 // their bundle or reached through a link out of the directory; a deleted
 // unplayable file is matched by no later orphan.
 TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy) {
-  const std::string take = (root_ / "take.wav").string();
-  ASSERT_TRUE(testing::writeTone(take, 1.0, "wav"));
-  auto alpha = RCCompositionEditor::createCompositionForNewRecording(*model(), "Alpha");
-  ASSERT_TRUE(alpha) << alpha.error();
-  ASSERT_TRUE(alpha->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(take)));
+  ASSERT_NO_FATAL_FAILURE(makeBundle("Alpha"));
   forgetDatabase();
   tone("Alpha.m4a", 1.0, 550);
   copy("Alpha.m4a", "Beta.m4a");
@@ -297,8 +278,7 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
   ASSERT_TRUE(testing::writeTone((root_ / "outside.m4a").string(), outside));
   fs::create_symlink(root_ / "outside.m4a", recordingsPath("Out.m4a"));
   fs::copy_file(root_ / "outside.m4a", recordingsPath("Outside copy.m4a"));
-  for (const char* name : {"Kept.m4a", "Member.m4a", "Out.m4a"})
-    model()->insertRecordingWithAudioFile(recordingsPath(name), 1.0, platform::Date::now());
+  for (const char* name : {"Kept.m4a", "Member.m4a", "Out.m4a"}) insert(name);
   fs::create_symlink(recordingsPath("Kept.m4a"), recordingsPath("Link.m4a"));
   ASSERT_EQ(::mkfifo(recordingsPath("Pipe.m4a").c_str(), 0600), 0);
   fs::create_directory(recordingsPath("Folder.m4a"));
@@ -318,7 +298,17 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
   testing::writeFile(recordingsPath("Writing.m4a"), std::string(3300, 'w'));
   const int writer = ::open(recordingsPath("Writing.m4a").c_str(), O_WRONLY | O_APPEND);
   ASSERT_GE(writer, 0);
-  RCMediaEngine::setCurrent(std::make_shared<BusyDirectoryEngine>());
+  // While the run reads "Growing", more of it comes in; while it reads
+  // "Replaced", a sync tool renames another file over it.
+  RCMediaEngine::setCurrent(std::make_shared<ProbeHookEngine>([](const platform::URL& url) {
+    if (url.lastPathComponent() == "Growing.m4a")
+      testing::writeFile(url.path(), testing::readFile(url.path()) + "more");
+    if (url.lastPathComponent() == "Replaced.m4a") {
+      testing::writeFile(url.path() + ".new", std::string(3400, 'r'));
+      fs::rename(url.path() + ".new", url.path());
+    }
+    return platform::Status();
+  }));
 
   run();
 
@@ -346,9 +336,7 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
     EXPECT_EQ(present(row.name), row.stays) << row.name;
     EXPECT_EQ(linesContaining(row.line), 1u) << row.line;
   }
-  if (device) {
-    EXPECT_EQ(linesContaining("'Null.m4a' alone: it is not a regular file"), 1u);
-  }
+  EXPECT_EQ(linesContaining("'Null.m4a' alone: it is not a regular file"), device ? 1u : 0u);
   EXPECT_TRUE(fs::exists(root_ / "outside.m4a"));
   EXPECT_EQ(linesContaining("matches existing file = Noise A.m4a"), 0u);
 
@@ -372,27 +360,23 @@ TEST_F(OrphanHandlingTest, RecoveredTitlesAndDatesComeFromTheFile) {
   ASSERT_TRUE(engine->writeTitle(url("Tagged.m4a"), "Walk", "eng"));
   ASSERT_TRUE(engine->writeTitle(url("Tagged.m4a"), "Spaziergang", "deu"));
   ASSERT_TRUE(engine->writeTitle(url("Single.m4a"), "Solo", "fra"));
-  auto recording = [&](const char* name) {
-    return model()->insertRecordingWithAudioFile(recordingsPath(name), 1, platform::Date::now());
-  };
-
-  ::setenv("LANGUAGE", "fr:de:en", 1);
-  auto tagged = recording("Tagged.m4a");
+  testing::ScopedEnvironment language{{"LANGUAGE", "fr:de:en"}};
+  auto tagged = insert("Tagged.m4a");
   ASSERT_TRUE(RCSApplyAssetMetadataToRecording(*tagged));
   EXPECT_EQ(tagged->customLabel(), "Spaziergang");
   EXPECT_EQ(tagged->date(), RCFileCreationDate(recordingsPath("Tagged.m4a")));
 
-  ::setenv("LANGUAGE", "it", 1);  // neither title: the container's date
+  language.set("LANGUAGE", "it");  // neither title: the container's date
   ASSERT_TRUE(RCSApplyAssetMetadataToRecording(*tagged));
   EXPECT_EQ(tagged->date(), created);
   EXPECT_EQ(tagged->customLabel(), RCLocalizedRecordingDateWithOptions(*created, 3));
 
-  auto single = recording("Single.m4a");  // one title is the title, whatever its language
+  auto single = insert("Single.m4a");  // one title is the title, whatever its language
   ASSERT_TRUE(RCSApplyAssetMetadataToRecording(*single));
   EXPECT_EQ(single->customLabel(), "Solo");
   EXPECT_NE(single->date(), created);
 
-  auto missing = recording("Missing.m4a");
+  auto missing = insert("Missing.m4a");
   const std::string before = missing->customLabel();
   EXPECT_FALSE(RCSApplyAssetMetadataToRecording(*missing));
   EXPECT_EQ(missing->customLabel(), before);

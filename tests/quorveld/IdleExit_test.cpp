@@ -4,58 +4,36 @@
 
 #include <gtest/gtest.h>
 
-#include <chrono>
-#include <latch>
-
-#include "platform/MainQueue.h"
-#include "platform/ProcessLifetime.h"
-#include "platform/dbus/LocalListener.h"
 #include "quorveld/RCSXPCTransaction.h"
-#include "quorveld/RCSXPCTransactionController.h"
+#include "tests/quorveld/ServiceFixture.h"
 
 namespace quorvel {
 namespace {
 
-using namespace std::chrono_literals;
-
-class IdleExitTest : public ::testing::Test {
- protected:
+class IdleExitTest : public ServiceTest {
+ public:
   void SetUp() override {
-    // The process-wide lifetime and controller stay on the real main queue.
-    (void)lifetime();
-    (void)RCSXPCTransactionController::sharedInstance();
-    platform::setMainQueueForTesting(&main_);
-    service_ = SavedRecordingService::makeForTesting({.watchDebugSignal = false});
-    service_->setListenerFactory([this](const std::string&, platform::InterfaceDescription i) {
-      listener_ = std::make_shared<platform::LocalListener>(std::move(i));
-      return listener_;
-    });
+    ServiceTest::SetUp();
+    platform::setLogThreshold(platform::kLogLevelNotice);  // the daemon's default
     ASSERT_TRUE(service_->start());
-    advance(2s);  // the first orphan pass runs...
-    advance(2s);  // ...and the start-up keep-alives are over
-    ASSERT_FALSE(lifetime().isInTransaction());
-    idleExit_ = std::make_shared<IdleExit>(service_, lifetime(), main_);
+    settle();  // the first orphan pass and the start-up keep-alives are over
+    ASSERT_FALSE(platform::ProcessLifetime::instance().isInTransaction());
+    idleExit_ = std::make_shared<IdleExit>(service_, platform::ProcessLifetime::instance(), main_);
   }
   void TearDown() override {
-    advance(10s);
-    advance(10s);
     idleExit_.reset();
-    service_.reset();
-    platform::setMainQueueForTesting(nullptr);
-    EXPECT_FALSE(lifetime().isInTransaction());
+    ServiceTest::TearDown();
   }
-  static platform::ProcessLifetime& lifetime() { return platform::ProcessLifetime::instance(); }
-  // One turn: what is due on the main queue, the service work it starts, and
-  // what that work hands back.
+  // What is due on the main queue, the service work it starts, and what that
+  // work hands back.
   void turn() {
     main_.runUntilIdle();
-    service_->serviceSerialQueue().sync([] {});
+    drainServiceQueue();
     main_.runUntilIdle();
   }
-  void advance(std::chrono::nanoseconds by) {
-    clock_.advance(by);
-    turn();
-    turn();
+  void startIdleExit() {
+    main_.async([this] { idleExit_->start(); });
+    main_.runUntilIdle();
   }
   bool stopped() {
     bool stopped = false;
@@ -63,13 +41,7 @@ class IdleExitTest : public ::testing::Test {
     main_.runUntilIdle();
     return stopped;
   }
-  // The stop the sequence ends with makes the next run() return at once.
-  void expectMainQueueStopped() { main_.run(); }
 
-  platform::ManualClock clock_;
-  platform::MainQueue main_{clock_, "test main"};
-  std::shared_ptr<SavedRecordingService> service_;
-  std::shared_ptr<platform::LocalListener> listener_;
   std::shared_ptr<IdleExit> idleExit_;
 };
 
@@ -79,12 +51,10 @@ TEST_F(IdleExitTest, ACallReceivedBeforeTheNameWentIsAnsweredBeforeTheMainQueueS
   std::latch busy(1);
   service_->serviceSerialQueue().async([&busy] { busy.wait(); });
   auto reply = listener_->receive(":1.1", "FetchExportingCompositionAVURLs");
-
-  main_.async([this] { idleExit_->start(); });
-  main_.runUntilIdle();
+  startIdleExit();
   EXPECT_TRUE(listener_->isNameReleased());
   EXPECT_TRUE(listener_->isStopped());
-  EXPECT_TRUE(lifetime().isInTransaction());  // the delivered call's work is queued
+  EXPECT_TRUE(controller().isInTransaction());  // the delivered call's work is queued
   EXPECT_FALSE(reply->isAnswered());
   EXPECT_FALSE(stopped());
 
@@ -99,17 +69,14 @@ TEST_F(IdleExitTest, ACallReceivedBeforeTheNameWentIsAnsweredBeforeTheMainQueueS
   advance(1ms);
   EXPECT_TRUE(stopped());
   EXPECT_EQ(reply->answerCount(), 1);
-  expectMainQueueStopped();
-
-  // The idle timer firing again changes nothing.
-  main_.async([this] { idleExit_->start(); });
-  main_.runUntilIdle();
+  main_.run();      // returns at once: the sequence ended with a stop
+  startIdleExit();  // the idle timer firing again changes nothing
 }
 
 TEST_F(IdleExitTest, AKeepAliveHeldAfterTheListenerStoppedHoldsTheMainQueue) {
   auto held = RCSXPCTransaction::initWithName("test keep-alive");
   held->beginTransaction();
-  main_.async([this] { idleExit_->start(); });
+  startIdleExit();
   advance(1h);
   EXPECT_TRUE(listener_->isStopped());
   EXPECT_FALSE(stopped());
@@ -123,7 +90,7 @@ TEST_F(IdleExitTest, AKeepAliveHeldAfterTheListenerStoppedHoldsTheMainQueue) {
   busy.count_down();
   turn();
   EXPECT_TRUE(stopped());
-  expectMainQueueStopped();
+  main_.run();  // returns at once
 }
 
 }  // namespace

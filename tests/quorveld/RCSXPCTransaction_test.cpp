@@ -1,13 +1,12 @@
-// Keep-alive transactions and the root transaction they fold into.
+// Keep-alive transactions and the root transaction they fold into (their
+// log lines are pinned in ServiceLog_test).
 #include <gtest/gtest.h>
 
-#include <mutex>
-#include <regex>
-#include <string>
+#include <functional>
+#include <latch>
 #include <thread>
 #include <vector>
 
-#include "platform/Log.h"
 #include "platform/MainQueue.h"
 #include "platform/ProcessLifetime.h"
 #include "quorveld/RCSXPCTransaction.h"
@@ -16,133 +15,89 @@
 namespace quorvel {
 namespace {
 
-class TransactionTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    platform::setConsoleLogging(false);
-    platform::setLogThreshold(platform::kLogLevelDebug);
-    platform::setLogSinkForTesting([this](int, std::string_view text) {
-      std::lock_guard lock(mutex_);
-      lines_.emplace_back(text);
-    });
-    ASSERT_TRUE(RCSXPCTransaction::activeTransactions().empty());
-  }
-  void TearDown() override {
-    platform::setLogSinkForTesting(nullptr);
-    platform::setLogThreshold(platform::kLogLevelNotice);
-    EXPECT_FALSE(controller().isInTransaction());
-  }
-  static RCSXPCTransactionController& controller() {
-    return RCSXPCTransactionController::sharedInstance();
-  }
-  std::vector<std::string> takeLines() {
-    std::lock_guard lock(mutex_);
-    return std::exchange(lines_, {});
-  }
+bool rootHeld() {
+  const bool held = RCSXPCTransactionController::sharedInstance().isInTransaction();
+  EXPECT_EQ(platform::ProcessLifetime::instance().isInTransaction(), held);
+  return held;
+}
 
-  std::mutex mutex_;
-  std::vector<std::string> lines_;
+// One step of a timeline: what is done, how far the clock then moves before
+// the main queue runs (negative: it does not run), and which of the first
+// transaction, the second and the root are active after ("110": the first
+// two).
+struct Step {
+  std::function<void()> act;
+  int advanceMs;
+  const char* active;
 };
 
-TEST_F(TransactionTest, FirstBeginTakesTheRootAndLastEndReleasesIt) {
-  auto transaction = RCSXPCTransaction::initWithName("Keep-alive for tests");
-  transaction->beginTransaction();
-  EXPECT_TRUE(transaction->isActive());
-  EXPECT_TRUE(controller().isInTransaction());
-  EXPECT_TRUE(platform::ProcessLifetime::instance().isInTransaction());
-  transaction->endTransaction();
-  EXPECT_FALSE(platform::ProcessLifetime::instance().isInTransaction());
-
-  std::string description = transaction->description();
-  EXPECT_TRUE(std::regex_match(
-      description, std::regex(R"(<RCSXPCTransaction 0x[0-9a-f]+, name = "Keep-alive for tests">)")))
-      << description;
-  EXPECT_EQ(takeLines(), (std::vector<std::string>{
-                             "[RCSXPCTransaction] Activating XPC transaction: " + description,
-                             "[RCSXPCTransaction] Root XPC transaction began.",
-                             "[RCSXPCTransaction] Deactivating XPC transaction: " + description,
-                             "[RCSXPCTransaction] No XPC transactions remain. Ending "
-                             "root XPC transaction.",
-                         }));
-}
-
-TEST_F(TransactionTest, SameNamedTransactionsAreTrackedSeparately) {
-  auto first = RCSXPCTransaction::initWithName("same");
-  auto second = RCSXPCTransaction::initWithName("same");
-  first->beginTransaction();
-  second->beginTransaction();
-  first->endTransaction();
-  EXPECT_FALSE(first->isActive());
-  EXPECT_TRUE(second->isActive());
-  EXPECT_TRUE(controller().isInTransaction());
-  second->endTransaction();
-}
-
-TEST_F(TransactionTest, BeginTwiceEndOnceAndRedundantEndsAreQuiet) {
-  auto transaction = RCSXPCTransaction::initWithName("twice");
-  transaction->beginTransaction();
-  transaction->beginTransaction();
-  transaction->endTransaction();
-  EXPECT_FALSE(transaction->isActive());
-  EXPECT_FALSE(controller().isInTransaction());
-  takeLines();
-
-  transaction->endTransaction();
-  RCSXPCTransaction::initWithName("never begun")->endTransaction();
-  EXPECT_TRUE(takeLines().empty());
-}
-
-TEST_F(TransactionTest, ScheduledEndRunsOnTheMainQueueEvenAfterAnEarlierEnd) {
-  auto transaction = RCSXPCTransaction::initWithName("scheduled");
-  transaction->beginTransaction();
-  transaction->endTransactionOnDate(platform::Date::dateWithTimeIntervalSinceNow(-1.0));
-  EXPECT_TRUE(transaction->isActive());  // nothing ends before the main queue turns
-  platform::mainQueue().runUntilIdle();
-  EXPECT_FALSE(transaction->isActive());
-
-  // Ended in the meantime: the scheduled end touches nothing and logs nothing.
-  transaction->beginTransaction();
-  transaction->endTransactionOnDate(platform::Date::dateWithTimeIntervalSinceNow(-1.0));
-  transaction->endTransaction();
-  takeLines();
-  platform::mainQueue().runUntilIdle();
-  EXPECT_TRUE(takeLines().empty());
-}
-
-TEST_F(TransactionTest, ScheduledEndTwoSecondsAheadRunsTwoSecondsLater) {
+TEST(TransactionTest, TheRootIsHeldWhileAnyTransactionIsActiveAndEndsRunOnTheMainQueue) {
+  ASSERT_FALSE(rootHeld());  // the process-wide lifetime stays on the real main queue
   platform::ManualClock clock;
   platform::MainQueue main(clock, "test main");
   platform::setMainQueueForTesting(&main);
-  auto transaction = RCSXPCTransaction::initWithName("two seconds");
-  transaction->beginTransaction();
-  transaction->endTransactionOnDate(platform::Date::dateWithTimeIntervalSinceNow(2.0));
-  clock.advance(std::chrono::milliseconds(1990));
+  auto first = RCSXPCTransaction::initWithName("same");
+  auto second = RCSXPCTransaction::initWithName("same");
+  auto begin = [](auto& t) { return [&t] { t->beginTransaction(); }; };
+  auto end = [](auto& t) { return [&t] { t->endTransaction(); }; };
+  // Begins `first` and ends it `seconds` from now (after an end, with `thenEnd`).
+  auto endIn = [&](double seconds, bool thenEnd = false) {
+    return [&, seconds, thenEnd] {
+      first->beginTransaction();
+      first->endTransactionOnDate(platform::Date::dateWithTimeIntervalSinceNow(seconds));
+      if (thenEnd) first->endTransaction();
+    };
+  };
+  const Step timeline[] = {
+      {begin(first), -1, "101"},
+      {begin(second), -1, "111"},
+      {end(first), -1, "011"},
+      {begin(second), -1, "011"},
+      {end(second), -1, "000"},
+      {end(second), -1, "000"},
+      {endIn(2.0), 1990, "101"},
+      {[] {}, 10, "000"},
+      {endIn(-1.0), -1, "101"},
+      {[] {}, 0, "000"},
+      // A scheduled end after an earlier end touches nothing.
+      {endIn(-1.0, true), -1, "000"},
+      {begin(second), 0, "011"},
+      {end(second), -1, "000"},
+  };
+  for (const Step& step : timeline) {
+    step.act();
+    if (step.advanceMs >= 0) {
+      clock.advance(std::chrono::milliseconds(step.advanceMs));
+      main.runUntilIdle();
+    }
+    const std::string active = {char('0' + first->isActive()), char('0' + second->isActive()),
+                                char('0' + rootHeld())};
+    EXPECT_EQ(active, step.active) << "step " << &step - timeline;
+  }
+  RCSXPCTransaction::initWithName("never begun")->endTransaction();
+  EXPECT_FALSE(rootHeld());
+
+  // A scheduled end keeps a transaction nobody else owns alive until it runs.
+  std::weak_ptr<RCSXPCTransaction> weak = first;
+  endIn(-1.0)();
+  first.reset();
+  EXPECT_FALSE(weak.expired());
+  EXPECT_TRUE(rootHeld());
   main.runUntilIdle();
-  EXPECT_TRUE(transaction->isActive());
-  clock.advance(std::chrono::milliseconds(10));
-  main.runUntilIdle();
-  EXPECT_FALSE(transaction->isActive());
+  EXPECT_TRUE(weak.expired());
+  EXPECT_FALSE(rootHeld());
   platform::setMainQueueForTesting(nullptr);
 }
 
-TEST_F(TransactionTest, ScheduledEndKeepsAnUnownedTransactionAlive) {
-  auto transaction = RCSXPCTransaction::initWithName("kept by its end");
-  std::weak_ptr<RCSXPCTransaction> weak = transaction;
-  transaction->beginTransaction();
-  transaction->endTransactionOnDate(platform::Date::dateWithTimeIntervalSinceNow(-1.0));
-  transaction.reset();
-  EXPECT_FALSE(weak.expired());
-  EXPECT_TRUE(controller().isInTransaction());
-  platform::mainQueue().runUntilIdle();
-  EXPECT_TRUE(weak.expired());
-}
-
-TEST_F(TransactionTest, ConcurrentBeginsEndsAndDropsKeepTheRootConsistent) {
-  platform::setLogThreshold(platform::kLogLevelNotice);
+// The threads start together, so even their first transactions race.
+TEST(TransactionTest, ConcurrentBeginsEndsAndDropsKeepTheRootConsistent) {
+  constexpr int kThreads = 8;
+  std::latch start(kThreads);
   std::vector<std::thread> threads;
-  for (int t = 0; t < 4; ++t) {
-    threads.emplace_back([] {
-      for (int i = 0; i < 2000; ++i) {
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&start] {
+      start.arrive_and_wait();
+      for (int i = 0; i < 1000; ++i) {
         auto transaction = RCSXPCTransaction::initWithName("stress");
         transaction->beginTransaction();
         if (i % 3 == 0) transaction->endTransaction();
@@ -152,8 +107,7 @@ TEST_F(TransactionTest, ConcurrentBeginsEndsAndDropsKeepTheRootConsistent) {
   }
   for (auto& thread : threads) thread.join();
   EXPECT_TRUE(RCSXPCTransaction::activeTransactions().empty());
-  EXPECT_FALSE(controller().isInTransaction());
-  EXPECT_FALSE(platform::ProcessLifetime::instance().isInTransaction());
+  EXPECT_FALSE(rootHeld());
 }
 
 }  // namespace

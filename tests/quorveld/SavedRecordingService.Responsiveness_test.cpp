@@ -13,44 +13,24 @@
 #include "QuorvelMedia/RCInProcessMediaEngine.h"
 #include "platform/dbus/BusListener.h"
 #include "tests/quorveld/ServiceFixture.h"
-#include "tests/support/DelegatingMediaEngine.h"
+#include "tests/support/HeldMediaEngine.h"
 #include "tests/support/TestBus.h"
 
 namespace quorvel {
 namespace {
 
-// Once armed, holds every read of a fragment of the recording "Stuck" until
-// released.
-class StuckProbeEngine final : public testing::DelegatingMediaEngine {
- public:
-  platform::Result<RCMediaProbe> probe(const platform::URL& url) override {
-    bool hold = false;
-    gate.update([&] {
-      hold = armed && url.path().find("/Stuck.composition/") != std::string::npos;
-      held += hold;
-    });
-    if (hold) gate.waitUntil([&] { return released; });
-    return DelegatingMediaEngine::probe(url);
-  }
-  platform::testing::Gate gate;
-  bool armed = false;     // guarded by gate
-  int held = 0;           // guarded by gate
-  bool released = false;  // guarded by gate
-};
-
 class ResponsivenessTest : public SessionTest {
- protected:
-  std::shared_ptr<platform::Listener> makeListener(
-      const std::string& serviceName, platform::InterfaceDescription interface) override {
-    busListener_ = std::make_shared<platform::BusListener>(
-        platform::BusListenerOptions{.busAddress = bus_.address(),
-                                     .serviceName = serviceName,
-                                     .objectPath = RCSSavedRecordingServiceObjectPath},
-        std::move(interface));
-    return busListener_;
+ public:
+  std::shared_ptr<platform::Listener> makeListener(const std::string& serviceName,
+                                                   platform::InterfaceDescription i) override {
+    return busListener_ = std::make_shared<platform::BusListener>(
+               platform::BusListenerOptions{.busAddress = bus_.address(),
+                                            .serviceName = serviceName,
+                                            .objectPath = RCSSavedRecordingServiceObjectPath},
+               std::move(i));
   }
   void TearDown() override {
-    engine_->gate.update([&] { engine_->released = true; });
+    engine_->open();
     // The clients' disconnections reach the bus thread at some time after
     // the test body; stopping the listener first ends what they started, so
     // settling finds it all queued and no bus-thread block outlives the
@@ -61,42 +41,41 @@ class ResponsivenessTest : public SessionTest {
     RCUseInProcessMediaEngine();
   }
 
-  using Token = std::optional<RCSSavedRecordingAccessToken>;
-  // A preview request whose answer the test waits for.
-  static std::future<Token> preview(SavedRecordingServiceClient& client, const platform::URL& url) {
-    auto answer = std::make_shared<std::promise<Token>>();
-    client.prepareToPreviewCompositionAVURL(url,
-                                            [answer](Token token, std::optional<platform::Error>) {
-                                              answer->set_value(std::move(token));
-                                            });
-    return answer->get_future();
-  }
+  // A preview whose answer (a token, or none) the test waits for.
   template <class T>
   static bool answered(std::future<T>& future) {
     return future.wait_for(platform::testing::kWait) == std::future_status::ready;
   }
-  platform::URL recording(const std::string& name) const {
-    return platform::URL::fileURLWithPath((directory_ / name).string());
+  std::future<bool> preview(SavedRecordingServiceClient& client, const std::string& name,
+                            std::optional<RCSSavedRecordingAccessToken>& token) {
+    auto answer = std::make_shared<std::promise<bool>>();
+    client.prepareToPreviewCompositionAVURL(
+        platform::URL::fileURLWithPath((directory_ / name).string()),
+        [answer, &token](auto granted, std::optional<platform::Error>) {
+          token = std::move(granted);
+          answer->set_value(token.has_value());
+        });
+    return answer->get_future();
   }
 
   platform::testing::TestBus bus_;
   std::shared_ptr<platform::BusListener> busListener_;
-  std::shared_ptr<StuckProbeEngine> engine_ = [] {
-    auto engine = std::make_shared<StuckProbeEngine>();
-    RCMediaEngine::setCurrent(engine);
-    return engine;
-  }();
+  std::shared_ptr<testing::HeldMediaEngine> engine_ = std::make_shared<testing::HeldMediaEngine>();
 };
 
 TEST_F(ResponsivenessTest, AStuckFragmentReadHoldsOnlyItsOwnRecording) {
   ASSERT_TRUE(makeRecording("Stuck", {0.2, 0.2}));
   ASSERT_TRUE(makeRecording("Other", {0.2}));
+  engine_->holds = [](std::string_view job, const std::string& path) {
+    return job == "probe" && path.find("/Stuck.composition/") != std::string::npos;
+  };
+  RCMediaEngine::setCurrent(engine_);
   auto first = SavedRecordingServiceClient::connect(bus_.address());
   auto second = SavedRecordingServiceClient::connect(bus_.address());
   ASSERT_TRUE(first && second);
-  engine_->gate.update([&] { engine_->armed = true; });
-  auto stuck = preview(**first, recording("Stuck.m4a"));
-  ASSERT_TRUE(engine_->gate.waitUntil([&] { return engine_->held > 0; }));
+  std::optional<RCSSavedRecordingAccessToken> stuckToken, otherToken;
+  auto stuck = preview(**first, "Stuck.m4a", stuckToken);
+  ASSERT_TRUE(engine_->waitForInside(1));
 
   // Another client is answered meanwhile, by the bus and by the service: a
   // ping, a preview of another recording read for the first time, and the
@@ -107,31 +86,25 @@ TEST_F(ResponsivenessTest, AStuckFragmentReadHoldsOnlyItsOwnRecording) {
   auto ping = proxy->createMethodCall("org.freedesktop.DBus.Peer", "Ping");
   EXPECT_NO_THROW(
       proxy->callMethod(ping, std::chrono::microseconds(platform::testing::kWait).count()));
-  auto other = preview(**second, recording("Other.m4a"));
-  ASSERT_TRUE(answered(other)) << [&] {
-    std::string all;
-    for (auto& line : lines()) all += line.text + "\n";
-    return all;
-  }();
-  Token otherToken = other.get();
-  ASSERT_TRUE(otherToken);
+  auto other = preview(**second, "Other.m4a", otherToken);
+  ASSERT_TRUE(answered(other));
+  ASSERT_TRUE(other.get());
   std::promise<bool> fetched;
   (*second)->fetchExportingCompositionAVURLs(
       [&](platform::Result<std::vector<platform::URL>> urls) { fetched.set_value(bool(urls)); });
   auto fetch = fetched.get_future();
   ASSERT_TRUE(answered(fetch));
   EXPECT_TRUE(fetch.get());
-  EXPECT_EQ(stuck.wait_for(std::chrono::seconds(0)), std::future_status::timeout);
+  EXPECT_EQ(stuck.wait_for(0s), std::future_status::timeout);
 
-  engine_->gate.update([&] { engine_->released = true; });
+  engine_->open();
   ASSERT_TRUE(answered(stuck));
-  Token stuckToken = stuck.get();
-  ASSERT_TRUE(stuckToken);
+  ASSERT_TRUE(stuck.get());
   (*first)->endAccessSessionWithToken(*stuckToken);
   (*second)->endAccessSessionWithToken(*otherToken);
-  ASSERT_TRUE(waitForLines("Finally closing access session", 2));
+  ASSERT_TRUE(log_.waitForCount("Finally closing access session", 2));
   // Healthy fragments are read once each, and never reported unreadable.
-  EXPECT_TRUE(linesContaining("cannot be read").empty());
+  EXPECT_EQ(log_.count("cannot be read"), 0u);
 }
 
 }  // namespace

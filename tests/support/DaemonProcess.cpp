@@ -1,5 +1,7 @@
 #include "tests/support/DaemonProcess.h"
 
+#include <gtest/gtest.h>
+
 #include <fcntl.h>
 #include <signal.h>
 #include <spawn.h>
@@ -172,6 +174,22 @@ DaemonProcess::CommandResult DaemonProcess::run(const std::vector<std::string>& 
   while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
   }
   return {WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status), output};
+}
+
+std::unique_ptr<DaemonProcess> DaemonProcess::serve(const std::string& address,
+                                                    const std::string& recordings,
+                                                    const std::string& idleExitAfter) {
+  auto daemon = std::make_unique<DaemonProcess>(
+      std::vector<std::string>{"--bus-address", address, "--recordings-dir", recordings,
+                               "--idle-exit-after", idleExitAfter});
+  EXPECT_TRUE(daemon->waitForLine("[BusListener] listening as")) << daemon->output();
+  return daemon;
+}
+
+DaemonProcess::CommandResult DaemonProcess::quorvelctl(const std::string& address,
+                                                       std::vector<std::string> arguments) {
+  arguments.insert(arguments.begin(), {programPath("quorvelctl"), "--bus-address", address});
+  return run(arguments);
 }
 
 }  // namespace quorvel::testing

@@ -12,6 +12,7 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -53,6 +54,13 @@ class DaemonProcess {
     std::string output;
   };
   static CommandResult run(const std::vector<std::string>& argv);
+  // quorveld serving `recordings` on the bus at `address`, once it owns its
+  // name (the test fails when it does not).
+  static std::unique_ptr<DaemonProcess> serve(const std::string& address,
+                                              const std::string& recordings,
+                                              const std::string& idleExitAfter = "0");
+  // Runs quorvelctl on the bus at `address`.
+  static CommandResult quorvelctl(const std::string& address, std::vector<std::string> arguments);
   // The path of a built program, "quorveld" or "quorvelctl".
   static std::string programPath(const std::string& name);
 

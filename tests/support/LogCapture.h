@@ -59,6 +59,10 @@ class LogCapture {
   bool waitFor(std::string_view text, int level = -1) {
     return gate_.waitUntil([&] { return countLocked(text, level) > 0; });
   }
+  // Waits (up to Gate's bound) until `count` lines contain `text`.
+  bool waitForCount(std::string_view text, std::size_t count) {
+    return gate_.waitUntil([&] { return countLocked(text, -1) >= count; });
+  }
 
  private:
   std::size_t countLocked(std::string_view text, int level) const {
