@@ -8,7 +8,7 @@
 // root transaction, and with it the process's reason to stay, ends with the
 // last of these.
 #include "quorveld/SavedRecordingService.h"
-#include "quorveld/SavedRecordingServiceBusEdge.h"
+#include "quorveld/SavedRecordingService.BusEdge.h"
 
 #include <fmt/format.h>
 

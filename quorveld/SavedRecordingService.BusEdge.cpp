@@ -4,10 +4,11 @@
 // token whose session has ended; a call sent without expecting a reply is a
 // missing reply callback. The calling connection is passed to the request
 // explicitly. Each reply callback owns its call and answers it.
-#include "quorveld/SavedRecordingServiceBusEdge.h"
+#include "quorveld/SavedRecordingService.BusEdge.h"
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <string_view>
@@ -159,10 +160,16 @@ std::int64_t microsecondsSinceEpoch(std::chrono::system_clock::time_point time) 
 // queue's time). `withState` adds the state field of the session listing.
 void replyWithHolders(SavedRecordingService& service, platform::IncomingCall call,
                       std::vector<SavedRecordingService::AccessListing> listing, bool withState) {
+  // Each holder once: a client with many sessions is asked about once.
   std::vector<std::string> peers;
+  const platform::Connection* last = nullptr;
   for (const auto& entry : listing) {
-    if (entry.connection) peers.push_back(entry.connection->uniqueName());
+    if (!entry.connection || entry.connection.get() == last) continue;
+    last = entry.connection.get();
+    peers.push_back(entry.connection->uniqueName());
   }
+  std::ranges::sort(peers);
+  peers.erase(std::unique(peers.begin(), peers.end()), peers.end());
   auto listener = service.listener();
   auto answer = [call = std::move(call), listing = std::move(listing),
                  withState](platform::PeerCredentialsTable holders) mutable {
