@@ -157,6 +157,7 @@ int main(int argc, char** argv) {
     std::string url;
     bool cacheWaveform = false;
     std::vector<std::string> command;
+    std::string waitText;    // --wait's value: "forever", or seconds
     double waitSeconds = 0;  // with --wait: how long; negative for no limit
     CLI::App* sub = nullptr;
     CLI::Option* wait = nullptr;
@@ -176,7 +177,7 @@ int main(int argc, char** argv) {
                             "also compute and keep the waveform");
     }
     prepare.wait = prepare.sub->add_flag(
-        "--wait{-1}", prepare.waitSeconds,
+        "--wait{forever}", prepare.waitText,
         "when another session holds the recording, wait until it is free (--wait=SECONDS: "
         "at most that long), as flock -w does");
     prepare.sub->add_option("command", prepare.command,
@@ -247,6 +248,21 @@ int main(int argc, char** argv) {
   if (*info) return quorvelctl::showRecording(infoURL, globals.json);
   if (*waveform) return quorvelctl::drawWaveform(waveformURL, pngPath, pictureSize);
 
+  // --wait alone waits as long as it takes; --wait=SECONDS at most that long.
+  for (auto& prepare : prepares) {
+    if (!*prepare.sub || prepare.wait->count() == 0) continue;
+    if (prepare.waitText == "forever") {
+      prepare.waitSeconds = -1;
+      continue;
+    }
+    char* end = nullptr;
+    prepare.waitSeconds = std::strtod(prepare.waitText.c_str(), &end);
+    if (end == prepare.waitText.c_str() || *end != '\0' || !(prepare.waitSeconds >= 0)) {
+      std::fprintf(stderr, "quorvelctl: --wait takes a number of seconds: %s\n",
+                   prepare.waitText.c_str());
+      return kExitUsage;
+    }
+  }
   const bool waits = std::ranges::any_of(
       prepares, [](const Prepare& prepare) { return *prepare.sub && prepare.wait->count() > 0; });
   auto connected =
