@@ -6,6 +6,7 @@
 // its recordings directory on a full disk. The rules behind the answers are
 // pinned by the service core's tests.
 #include <fcntl.h>
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sched.h>
@@ -19,7 +20,9 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
+#include <nlohmann/json.hpp>
 #include <thread>
+#include <tuple>
 
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionEditor.h"
@@ -136,9 +139,9 @@ TEST_F(DaemonTest, QuorvelctlHoldsSessionsWhileItsCommandRunsAndReportsByExitSta
   const pid_t command = std::stoi(holder.linesContaining("held ").at(0).substr(5));
   auto refused = quorvelctl({"trim", recording});
   EXPECT_EQ(refused.status, 1);
-  EXPECT_TRUE(
-      refused.output.starts_with("quorvelctl: org.quorvel.SavedRecordingService.Error."
-                                 "ConflictingSession (301): Error Domain="))
+  EXPECT_NE(refused.output.find("\nquorvelctl: org.quorvel.SavedRecordingService.Error."
+                                "ConflictingSession (301): Error Domain="),
+            std::string::npos)
       << refused.output;
   holder.sendSignal(SIGKILL);
   ::kill(command, SIGKILL);
@@ -153,6 +156,69 @@ TEST_F(DaemonTest, QuorvelctlHoldsSessionsWhileItsCommandRunsAndReportsByExitSta
   daemon->sendSignal(SIGUSR1);
   EXPECT_TRUE(daemon->waitForLines("*** No Active Sessions ***", 2));
   EXPECT_EQ(quorvelctl({"fetch-exporting"}).status, 0) << daemon->output();
+}
+
+// Who holds a recording, seen from real client processes: the listing names
+// each holder as the bus knows it, a refusal names the holder, and --wait
+// waits for the recording's change signal, until granted or the time is up.
+TEST_F(DaemonTest, SessionsNameTheirHoldersAndWaitingEndsWhenTheHolderGoes) {
+  auto daemon = serve();
+  // Each holder's command says its pid, so it can be ended with its
+  // quorvelctl: it would otherwise keep the holder's stderr open.
+  std::vector<pid_t> commands;
+  auto holdInBackground = [&](const char* kind, const std::string& recording) {
+    auto holder = std::make_unique<DaemonProcess>(
+        DaemonProcess::programPath("quorvelctl"),
+        std::vector<std::string>{"--bus-address", bus_.address(), kind, recording, "--", "sh", "-c",
+                                 "echo held $$ >&2; exec sleep 600"});
+    EXPECT_TRUE(holder->waitForLine("held ")) << holder->output() << daemon->output();
+    commands.push_back(std::stoi(holder->linesContaining("held ").at(0).substr(5)));
+    return holder;
+  };
+  const std::string walk = path("Walk.m4a"), memo = path("Memo.m4a");
+  auto capturing = holdInBackground("capture", walk);
+  auto previewing = holdInBackground("preview", memo);
+
+  auto listed = quorvelctl({"--json", "sessions"});
+  ASSERT_EQ(listed.status, 0) << listed.output;
+  auto sessions = nlohmann::json::parse(listed.output).at("sessions");
+  ASSERT_EQ(sessions.size(), 2u) << listed.output;
+  for (const auto& [holder, kind, file] :
+       {std::tuple{capturing.get(), "capture", walk}, {previewing.get(), "preview", memo}}) {
+    auto found = std::ranges::find(sessions, std::string(kind), [](const auto& session) {
+      return session.at("kind").template get<std::string>();
+    });
+    ASSERT_NE(found, sessions.end()) << listed.output;
+    EXPECT_EQ(found->at("pid"), holder->pid());
+    EXPECT_EQ(found->at("uid"), ::getuid());
+    EXPECT_EQ(found->at("command"), "quorvelctl");
+    EXPECT_EQ(found->at("state"), "open");
+    EXPECT_EQ(found->at("recording"), platform::URL::fileURLWithPath(file).absoluteString());
+  }
+  EXPECT_EQ(quorvelctl({"--json", "sessions", path("Nothing.m4a")}).output, "{\"sessions\":[]}\n");
+
+  const std::string heldBy =
+      fmt::format("held by quorvelctl (pid {}) for capture since ", capturing->pid());
+  auto refused = quorvelctl({"preview", walk});
+  EXPECT_EQ(refused.status, 1);
+  EXPECT_TRUE(refused.output.starts_with("quorvelctl: " + heldBy)) << refused.output;
+  auto gaveUp = quorvelctl({"preview", "--wait=0.2", walk});
+  EXPECT_EQ(gaveUp.status, 1);
+  EXPECT_TRUE(
+      gaveUp.output.starts_with("quorvelctl: gave up after 0.2 s waiting for Walk.m4a: " + heldBy))
+      << gaveUp.output;
+
+  DaemonProcess waiting(DaemonProcess::programPath("quorvelctl"),
+                        {"--bus-address", bus_.address(), "preview", "--wait", walk, "--", "sh",
+                         "-c", "echo granted >&2"});
+  // Its first request is refused (the third preview of Walk the daemon
+  // sees); it then waits, and asks again when the capture goes.
+  ASSERT_TRUE(daemon->waitForLines("Received request to prepare 'Walk.m4a' for preview...", 3))
+      << daemon->output();
+  capturing->sendSignal(SIGKILL);
+  EXPECT_TRUE(waiting.waitForLine("granted")) << waiting.output() << daemon->output();
+  EXPECT_EQ(waiting.waitForExit(), 0) << waiting.output();
+  for (pid_t command : commands) ::kill(command, SIGKILL);
 }
 
 TEST_F(DaemonTest, ForeignClientsGetTheInterfaceAndItsErrors) {
