@@ -55,6 +55,15 @@ long residentKilobytes(pid_t pid) {
   return -1;
 }
 
+int threadCount(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.starts_with("Threads:")) return std::stoi(line.substr(8));
+  }
+  return -1;
+}
+
 double cpuMicroseconds(pid_t pid) {
   std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
   std::string text((std::istreambuf_iterator<char>(stat)), {});

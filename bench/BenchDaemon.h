@@ -31,6 +31,8 @@ class BenchDaemon {
 
 // VmRSS of `pid` in kilobytes; -1 when it cannot be read.
 long residentKilobytes(pid_t pid);
+// The number of threads of process `pid`, or -1.
+int threadCount(pid_t pid);
 // User plus system CPU time `pid` has used so far, in microseconds.
 double cpuMicroseconds(pid_t pid);
 // How many distinct shared libraries `pid` has mapped.

@@ -12,7 +12,10 @@
 //      pings on this kind of machine).
 //   3. Resident memory with 1,000 open sessions, above idle (target <= 5 MB),
 //      and after they closed (target: within 1 MB of idle), on a daemon of
-//      its own, so that nothing the earlier parts allocated hides growth.
+//      its own, so that nothing the earlier parts allocated hides growth;
+//      the threads of that daemon when idle (target <= 5); and, while the
+//      1,000 sessions are open, ListAccessSessions (p50 and worst of 50)
+//      against Peer.Ping (target: p50 <= 10 x ping).
 // Also prints the CPU time per ping and per grant (prepare + end) of the
 // daemon, the bus and the clients, which machine load does not skew the way
 // it skews rates, and, as a floor for part 2, the grant rate of a bare
@@ -313,9 +316,41 @@ int main(int argc, char** argv) {
   ping(*proxy);
   std::this_thread::sleep_for(std::chrono::milliseconds(1500));  // its keep-alives end
   long idle = quorvel::bench::residentKilobytes(daemon->pid());
+  const int idleThreads = quorvel::bench::threadCount(daemon->pid());
   std::vector<Token> open;
   for (int i = 0; i < 1000; ++i) open.push_back(prepare(*proxy, url));
   long held = quorvel::bench::residentKilobytes(daemon->pid());
+  {
+    std::vector<double> lists, pings;
+    for (int i = 0; i < 50; ++i) {
+      auto start = Clock::now();
+      auto call = proxy->createMethodCall("org.quorvel.SavedRecordingService1.Sessions",
+                                          "ListAccessSessions");
+      auto reply = proxy->callMethod(call);
+      lists.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+      std::vector<sdbus::Struct<std::string, int32_t, std::string, std::string, int64_t,
+                                std::string, uint32_t, uint32_t, std::string>>
+          sessions;
+      auto parse = Clock::now();
+      reply >> sessions;
+      if (i == 0) std::printf("client parse %.0f us\n", std::chrono::duration<double, std::micro>(Clock::now() - parse).count());
+      if (sessions.size() != open.size()) {
+        std::fprintf(stderr, "ListAccessSessions listed %zu sessions, not %zu\n", sessions.size(),
+                     open.size());
+        return 1;
+      }
+      start = Clock::now();
+      ping(*proxy);
+      pings.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+    }
+    std::sort(lists.begin(), lists.end());
+    std::sort(pings.begin(), pings.end());
+    std::printf(
+        "ListAccessSessions with 1000 sessions: p50 %.0f us, worst %.0f us; ping p50 %.0f us; "
+        "ratio %.2f (target <= 10)\n",
+        lists[lists.size() / 2], lists.back(), pings[pings.size() / 2],
+        lists[lists.size() / 2] / pings[pings.size() / 2]);
+  }
   for (const auto& token : open) end(*proxy, token);
   ping(*proxy);
   std::this_thread::sleep_for(std::chrono::milliseconds(1500));  // closes and their keep-alives
@@ -325,6 +360,7 @@ int main(int argc, char** argv) {
       "(+%.2f, target <= 1)\n",
       idle / 1024.0, held / 1024.0, (held - idle) / 1024.0, after / 1024.0,
       (after - idle) / 1024.0);
+  std::printf("threads of the idle daemon: %d (target <= 5)\n", idleThreads);
 
   daemon.reset();
   std::filesystem::remove_all(recordings);

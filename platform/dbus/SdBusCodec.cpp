@@ -87,7 +87,10 @@ bool readOne(sdbus::Message& message, std::string_view type, BusValues& out) {
   }
 }
 
-void appendOne(sdbus::Message& message, const BusValue& value) {
+// `structContents`, when given, is the signature inside a struct's
+// parentheses, known from the array that holds it.
+void appendOne(sdbus::Message& message, const BusValue& value,
+               const std::string* structContents = nullptr) {
   switch (value.kind()) {
     case BusValue::Kind::Bool:
       message << value.asBool();
@@ -113,17 +116,25 @@ void appendOne(sdbus::Message& message, const BusValue& value) {
       message.closeContainer();
       break;
     case BusValue::Kind::Struct: {
-      std::string signature = value.signature();
-      message.openStruct(signature.substr(1, signature.size() - 2));
+      if (structContents) {
+        message.openStruct(*structContents);
+      } else {
+        std::string signature = value.signature();
+        message.openStruct(signature.substr(1, signature.size() - 2));
+      }
       for (const BusValue& field : value.fields()) appendOne(message, field);
       message.closeStruct();
       break;
     }
-    case BusValue::Kind::Array:
-      message.openContainer(value.signature().substr(1));
-      for (const BusValue& element : value.elements()) appendOne(message, element);
+    case BusValue::Kind::Array: {
+      // Every element has the array's element signature: worked out once.
+      const std::string element = value.signature().substr(1);
+      const std::string contents = element.substr(1, element.size() - 2);
+      message.openContainer(element);
+      for (const BusValue& item : value.elements()) appendOne(message, item, &contents);
       message.closeContainer();
       break;
+    }
   }
 }
 
