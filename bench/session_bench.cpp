@@ -331,9 +331,6 @@ int main(int argc, char** argv) {
       std::vector<sdbus::Struct<std::string, int32_t, std::string, std::string, int64_t,
                                 std::string, uint32_t, uint32_t, std::string>>
           sessions;
-      auto parse = Clock::now();
-      reply >> sessions;
-      if (i == 0) std::printf("client parse %.0f us\n", std::chrono::duration<double, std::micro>(Clock::now() - parse).count());
       if (sessions.size() != open.size()) {
         std::fprintf(stderr, "ListAccessSessions listed %zu sessions, not %zu\n", sessions.size(),
                      open.size());
