@@ -331,6 +331,7 @@ int main(int argc, char** argv) {
       std::vector<sdbus::Struct<std::string, int32_t, std::string, std::string, int64_t,
                                 std::string, uint32_t, uint32_t, std::string>>
           sessions;
+      reply >> sessions;
       if (sessions.size() != open.size()) {
         std::fprintf(stderr, "ListAccessSessions listed %zu sessions, not %zu\n", sessions.size(),
                      open.size());
