@@ -173,25 +173,33 @@ void replyWithHolders(SavedRecordingService& service, platform::IncomingCall cal
   auto listener = service.listener();
   auto answer = [call = std::move(call), listing = std::move(listing),
                  withState](platform::PeerCredentialsTable holders) mutable {
+    // Built field by field and moved, never copied: a list of a thousand
+    // sessions is nine thousand values.
+    static const platform::PeerCredentials kNobody;
     std::vector<platform::BusValue> elements;
     elements.reserve(listing.size());
-    for (const auto& entry : listing) {
-      const std::string peer = entry.connection ? entry.connection->uniqueName() : std::string();
+    for (auto& entry : listing) {
+      std::string peer = entry.connection ? entry.connection->uniqueName() : std::string();
       const auto found = holders.find(peer);
-      const platform::PeerCredentials holder =
-          found == holders.end() ? platform::PeerCredentials() : found->second;
-      std::vector<platform::BusValue> fields = {
-          entry.accessName,
-          std::int32_t(entry.exclusive ? RCSSavedRecordingAccessTypeExclusive
-                                       : RCSSavedRecordingAccessTypeShared),
-          entry.compositionAVURL.absoluteString()};
+      const platform::PeerCredentials& holder = found == holders.end() ? kNobody : found->second;
+      std::vector<platform::BusValue> fields;
+      fields.reserve(9);
+      fields.emplace_back(std::move(entry.accessName));
+      fields.emplace_back(std::int32_t(entry.exclusive ? RCSSavedRecordingAccessTypeExclusive
+                                                       : RCSSavedRecordingAccessTypeShared));
+      fields.emplace_back(entry.compositionAVURL.absoluteString());
       if (withState) fields.emplace_back(entry.state);
-      fields.insert(fields.end(), {microsecondsSinceEpoch(entry.since), peer, holder.pid,
-                                   holder.uid, holder.command});
+      fields.emplace_back(microsecondsSinceEpoch(entry.since));
+      fields.emplace_back(std::move(peer));
+      fields.emplace_back(holder.pid);
+      fields.emplace_back(holder.uid);
+      fields.emplace_back(holder.command);
       elements.push_back(platform::BusValue::structure(std::move(fields)));
     }
-    call.reply(
-        {platform::BusValue::array(withState ? "(sissxsuus)" : "(sisxsuus)", std::move(elements))});
+    platform::BusValues reply;
+    reply.push_back(
+        platform::BusValue::array(withState ? "(sissxsuus)" : "(sisxsuus)", std::move(elements)));
+    call.reply(std::move(reply));
   };
   if (listener) {
     listener->credentialsOfPeers(std::move(peers), std::move(answer));

@@ -3,17 +3,30 @@
 //
 // The listings are snapshots taken on the service serial queue; the holders'
 // credentials are asked of the bus afterwards, by the D-Bus edge, so nothing
-// here waits for the bus. The signal is coalesced: the first change of a turn
-// queues one flush behind the work already queued, and every recording that
-// changed until the flush runs gets one signal, however often it changed.
+// here waits for the bus.
+//
+// The signal is coalesced: the first change starts a short wait, then one
+// flush on the service queue sends one signal for every recording that
+// changed meanwhile, however often it changed. Each signal is a broadcast the
+// bus matches against every client's rules, and a busy recording changes
+// twice per session, so a burst of sessions costs the bus one signal per
+// recording instead of two per session; a waiting client hears of the change
+// a few milliseconds later.
 #include <algorithm>
 #include <utility>
 
 #include "Quorvel/service/RCSSavedRecordingServiceConstants.h"
 #include "platform/DispatchQueue.h"
+#include "platform/MainQueue.h"
 #include "quorveld/SavedRecordingService.h"
 
 namespace quorvel {
+namespace {
+
+// How long changes gather before their signals go out.
+constexpr auto kAccessSessionsChangedCoalescing = std::chrono::milliseconds(5);
+
+}  // namespace
 
 void SavedRecordingService::listAccessSessions(AccessListingHandler reply) {
   _performOnServiceQueue(
@@ -59,16 +72,18 @@ void SavedRecordingService::_onQueueNoteAccessSessionsChanged(
   const bool flushQueued = !_accessSessionsChangedCompositionAVURLs.empty();
   _accessSessionsChangedCompositionAVURLs.insert(compositionAVURL);
   if (flushQueued) return;
-  _performOnServiceQueue(
-      [this, self = shared_from_this()] {
-        auto changed = std::exchange(_accessSessionsChangedCompositionAVURLs, {});
-        auto listener = _xpcListener;
-        if (!listener) return;
-        for (const platform::URL& url : changed) {
-          listener->emitSignal(RCSSignalAccessSessionsChanged, {url.absoluteString()});
-        }
-      },
-      WorkLength::Short);
+  // The change's own request holds a keep-alive for a second after it, which
+  // covers the wait.
+  platform::mainQueue().after(kAccessSessionsChangedCoalescing, [self = shared_from_this()] {
+    self->_serviceSerialQueue.async([self] {
+      auto changed = std::exchange(self->_accessSessionsChangedCompositionAVURLs, {});
+      auto listener = self->_xpcListener;
+      if (!listener) return;
+      for (const platform::URL& url : changed) {
+        listener->emitSignal(RCSSignalAccessSessionsChanged, {url.absoluteString()});
+      }
+    });
+  });
 }
 
 }  // namespace quorvel

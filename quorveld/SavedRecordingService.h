@@ -257,9 +257,9 @@ class SavedRecordingService final : public platform::ListenerDelegate,
   // Each recording's waiting request:
   void listDeferredRequests(AccessListingHandler reply);
   // Notes that the recording's sessions or its waiting request changed:
-  // AccessSessionsChanged goes out for it once the work queued so far has
-  // run, once however often it changed meanwhile. Must be called on the
-  // service serial queue.
+  // AccessSessionsChanged goes out for it a few milliseconds later (on the
+  // main queue's clock), once however often it changed meanwhile. Must be
+  // called on the service serial queue.
   void _onQueueNoteAccessSessionsChanged(const platform::URL& compositionAVURL);
 
   // Tests: the service's waiting state. Must be called on the service
