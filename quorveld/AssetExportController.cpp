@@ -8,6 +8,7 @@
 // finds no entry and makes a new one: nobody joins an operation whose
 // answers are already being delivered.
 #include "quorveld/AssetExportController.h"
+#include "quorveld/RCSXPCTransaction.h"
 
 #include "platform/Log.h"
 #include "platform/MainQueue.h"
@@ -78,17 +79,27 @@ void AssetExportController::finalizeAssetWithCompositionAVURL(const platform::UR
 template <class OperationT>
 void AssetExportController::_setCompletionHandling(
     const std::shared_ptr<OperationT>& operation, Table<OperationT> AssetExportController::*table) {
+  // The daemon stays while an operation composes or computes, whatever
+  // holds the session it was asked for under: the session of a client that
+  // went away may close before the finalization its leaving started ends, and
+  // an exit then would leave the composed file half made.
+  auto keepAlive = RCSXPCTransaction::initWithName("Keep-alive for export operation");
+  keepAlive->beginTransaction();
   operation->setCompletionBlock(
-      [weak = std::weak_ptr<OperationT>(operation), self = shared_from_this(), table] {
+      [weak = std::weak_ptr<OperationT>(operation), self = shared_from_this(), table, keepAlive] {
         auto strong = weak.lock();
-        if (!strong) return;
-        self->_serialQueue.sync([&] {
-          auto entry = (self.get()->*table).find(strong->compositionAVURL());
-          if (entry != (self.get()->*table).end() && entry->second == strong) {
-            (self.get()->*table).erase(entry);
-          }
+        if (strong) {
+          self->_serialQueue.sync([&] {
+            auto entry = (self.get()->*table).find(strong->compositionAVURL());
+            if (entry != (self.get()->*table).end() && entry->second == strong) {
+              (self.get()->*table).erase(entry);
+            }
+          });
+        }
+        platform::mainQueue().async([strong, keepAlive] {
+          if (strong) strong->invokeExportClientCompletionBlocks();
+          keepAlive->endTransaction();
         });
-        platform::mainQueue().async([strong] { strong->invokeExportClientCompletionBlocks(); });
       });
 }
 

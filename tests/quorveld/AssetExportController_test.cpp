@@ -9,6 +9,7 @@
 
 #include "Quorvel/composition/RCCompositionEditor.h"
 #include "platform/MainQueue.h"
+#include "quorveld/RCSXPCTransactionController.h"
 #include "tests/support/AudioFixtures.h"
 #include "tests/support/HeldMediaEngine.h"
 #include "tests/support/RecordingsDirectoryFixture.h"
@@ -73,8 +74,12 @@ TEST_F(ExportControllerTest, RequestsFoldIntoThePendingWorkAndAreAnsweredInOrder
     EXPECT_EQ(controller_->pendingOperationCountForTesting(), pending) << name;
   }
   EXPECT_TRUE(answered().empty());
+  // Pending work keeps the daemon alive by itself, not only through the
+  // sessions it was asked under.
+  EXPECT_TRUE(RCSXPCTransactionController::sharedInstance().isInTransaction());
   runAll();
   EXPECT_EQ(controller_->pendingOperationCountForTesting(), 0u);
+  EXPECT_FALSE(RCSXPCTransactionController::sharedInstance().isInTransaction());
   // Each operation answers its own callers together, in the order they came.
   auto all = answered();
   auto position = [&](const std::string& entry) {
