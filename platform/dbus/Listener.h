@@ -6,7 +6,8 @@
 //
 // Two listeners implement it: BusListener (a real D-Bus connection, in
 // BusListener.h) and LocalListener (in-process, for tests of the service
-// core, in LocalListener.h). The service codes against this interface.
+// core; a test double, in tests/support/LocalListener.h). The service codes
+// against this interface.
 //
 // Delivery: calls run one at a time on the listener's delivery thread (the
 // bus thread for BusListener), so handlers must return quickly and never

@@ -19,10 +19,10 @@
 #include "Quorvel/files/RCRecordingsDirectory.h"
 #include "platform/MainQueue.h"
 #include "platform/ProcessLifetime.h"
-#include "platform/dbus/LocalListener.h"
 #include "quorveld/RCSXPCTransactionController.h"
 #include "quorveld/SavedRecordingService.h"
 #include "tests/support/AudioFixtures.h"
+#include "tests/support/LocalListener.h"
 #include "tests/support/LogCapture.h"
 #include "tests/support/ScopedTempDir.h"
 

@@ -19,9 +19,9 @@
 #include <vector>
 
 #include "platform/dbus/BusListener.h"
-#include "platform/dbus/LocalListener.h"
 #include "platform/dbus/SdBusCodec.h"
 #include "tests/support/Gate.h"
+#include "tests/support/LocalListener.h"
 #include "tests/support/TestBus.h"
 
 namespace platform::testing {

@@ -1,4 +1,4 @@
-#include "platform/dbus/LocalListener.h"
+#include "tests/support/LocalListener.h"
 
 #include <fmt/format.h>
 
