@@ -1,9 +1,6 @@
 #include "bench/BenchDaemon.h"
 
-#include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <fstream>
@@ -16,34 +13,19 @@ namespace quorvel::bench {
 
 BenchDaemon::BenchDaemon(const std::string& busAddress, const std::string& recordingsDirectory)
     : program_(std::string(QUORVEL_BINARY_DIR) + "/bin/quorveld") {
-  std::vector<std::string> arguments{program_,
-                                     "--bus-address",
-                                     busAddress,
-                                     "--recordings-dir",
-                                     recordingsDirectory,
-                                     "--idle-exit-after",
-                                     "0"};
-  std::vector<char*> args;
-  for (auto& argument : arguments) args.push_back(argument.data());
-  args.push_back(nullptr);
-  std::vector<std::string> environment{"QUORVEL_LOG_CONSOLE=0", "QUORVEL_LOG_STDERR=1",
-                                       "QUORVEL_LOG_LEVEL=4"};
-  std::vector<char*> envp;
-  for (auto& entry : environment) envp.push_back(entry.data());
-  envp.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
-  if (posix_spawn(&pid_, program_.c_str(), &actions, nullptr, args.data(), envp.data()) != 0) {
-    pid_ = -1;
-  }
-  posix_spawn_file_actions_destroy(&actions);
+  auto spawned = platform::Subprocess::spawn(
+      {.arguments = {program_, "--bus-address", busAddress, "--recordings-dir", recordingsDirectory,
+                     "--idle-exit-after", "0"},
+       .environment = std::vector<std::string>{"QUORVEL_LOG_CONSOLE=0", "QUORVEL_LOG_STDERR=1",
+                                               "QUORVEL_LOG_LEVEL=4"},
+       .descriptors = {{STDERR_FILENO, platform::Subprocess::kDevNull}}});
+  if (spawned) process_ = std::move(*spawned);
 }
 
 BenchDaemon::~BenchDaemon() {
-  if (pid_ <= 0) return;
-  kill(pid_, SIGTERM);
-  waitpid(pid_, nullptr, 0);
+  if (!process_) return;
+  process_->kill(SIGTERM);
+  process_->wait();
 }
 
 long residentKilobytes(pid_t pid) {

@@ -8,7 +8,10 @@
 
 #include <sys/types.h>
 
+#include <optional>
 #include <string>
+
+#include "platform/Subprocess.h"
 
 namespace quorvel::bench {
 
@@ -20,13 +23,13 @@ class BenchDaemon {
   BenchDaemon(const BenchDaemon&) = delete;
   BenchDaemon& operator=(const BenchDaemon&) = delete;
 
-  bool started() const { return pid_ > 0; }
-  pid_t pid() const { return pid_; }
+  bool started() const { return process_.has_value(); }
+  pid_t pid() const { return process_ ? process_->pid() : -1; }
   const std::string& program() const { return program_; }
 
  private:
   std::string program_;
-  pid_t pid_ = -1;
+  std::optional<platform::Subprocess> process_;
 };
 
 // VmRSS of `pid` in kilobytes; -1 when it cannot be read.

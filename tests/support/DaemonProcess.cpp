@@ -4,7 +4,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -17,13 +16,6 @@ extern char** environ;
 
 namespace quorvel::testing {
 namespace {
-
-std::vector<char*> argvOf(const std::vector<std::string>& arguments) {
-  std::vector<char*> argv;
-  for (const auto& argument : arguments) argv.push_back(const_cast<char*>(argument.c_str()));
-  argv.push_back(nullptr);
-  return argv;
-}
 
 // The daemon's environment: ours, with the log on stderr at level 7 and
 // without the console format.
@@ -40,23 +32,23 @@ std::vector<std::string> daemonEnvironment() {
   return environment;
 }
 
-// Starts `argv` with stdin on /dev/null and `outputs` (stdout, stderr or both)
-// on a pipe; the pipe's read end, or -1 with the spawn error in `error`.
-int spawn(pid_t& pid, const std::vector<std::string>& arguments, char* const* envp,
-          std::initializer_list<int> outputs, int& error) {
+// Starts `arguments` (looked up in PATH) with stdin on /dev/null and
+// `outputs` (stdout, stderr or both) on a pipe; the pipe's read end is `fd`.
+platform::Result<platform::Subprocess> spawn(const std::vector<std::string>& arguments,
+                                             std::optional<std::vector<std::string>> environment,
+                                             std::initializer_list<int> outputs, int& fd) {
   int pipeFds[2];
   if (pipe2(pipeFds, O_CLOEXEC) != 0) throw std::runtime_error("pipe failed");
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  for (int fd : outputs) posix_spawn_file_actions_adddup2(&actions, pipeFds[1], fd);
-  posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
-  auto argv = argvOf(arguments);
-  error = posix_spawnp(&pid, argv[0], &actions, nullptr, argv.data(), envp);
-  posix_spawn_file_actions_destroy(&actions);
+  platform::SpawnOptions options{.arguments = arguments,
+                                 .searchPath = true,
+                                 .environment = std::move(environment),
+                                 .descriptors = {{STDIN_FILENO, platform::Subprocess::kDevNull}}};
+  for (int output : outputs) options.descriptors[output] = pipeFds[1];
+  auto child = platform::Subprocess::spawn(options);
   close(pipeFds[1]);
-  if (error == 0) return pipeFds[0];
-  close(pipeFds[0]);
-  return -1;
+  fd = pipeFds[0];
+  if (!child) close(fd);
+  return child;
 }
 
 }  // namespace
@@ -70,16 +62,18 @@ DaemonProcess::DaemonProcess(std::vector<std::string> arguments)
 
 DaemonProcess::DaemonProcess(const std::string& program, std::vector<std::string> arguments) {
   arguments.insert(arguments.begin(), program);
-  auto environment = daemonEnvironment();
-  int error = 0;
-  int fd = spawn(pid_, arguments, argvOf(environment).data(), {STDERR_FILENO}, error);
-  if (fd < 0) throw std::runtime_error("cannot start " + program + ": " + std::strerror(error));
+  int fd = -1;
+  auto child = spawn(arguments, daemonEnvironment(), {STDERR_FILENO}, fd);
+  if (!child)
+    throw std::runtime_error("cannot start " + program + ": " + child.error().description());
+  process_ = std::move(*child);
+  pid_ = process_->pid();
   reader_ = std::thread([this, fd] { capture(fd); });
 }
 
 DaemonProcess::~DaemonProcess() {
   if (!exitStatus_) {
-    ::kill(pid_, SIGKILL);
+    process_->kill(SIGKILL);
     waitForExit();
   }
   if (reader_.joinable()) reader_.join();
@@ -149,20 +143,18 @@ std::optional<int> DaemonProcess::waitForExit(std::chrono::milliseconds timeout)
     std::unique_lock lock(mutex_);
     if (!changed_.wait_for(lock, timeout, [this] { return closed_; })) return std::nullopt;
   }
-  int status = 0;
-  while (waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
-  }
+  const int status = process_->wait();
   exitStatus_ = WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
   return exitStatus_;
 }
 
-void DaemonProcess::sendSignal(int signo) const { ::kill(pid_, signo); }
+void DaemonProcess::sendSignal(int signo) const { process_->kill(signo); }
 
 DaemonProcess::CommandResult DaemonProcess::run(const std::vector<std::string>& argv) {
-  pid_t pid = -1;
-  int error = 0;
-  int fd = spawn(pid, argv, environ, {STDOUT_FILENO, STDERR_FILENO}, error);
-  if (fd < 0) return {127, std::string("cannot run ") + argv[0] + ": " + std::strerror(error)};
+  int fd = -1;
+  auto child = spawn(argv, std::nullopt, {STDOUT_FILENO, STDERR_FILENO}, fd);
+  if (!child)
+    return {127, std::string("cannot run ") + argv[0] + ": " + child.error().description()};
   std::string output;
   char buffer[4096];
   for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) != 0;) {
@@ -170,10 +162,7 @@ DaemonProcess::CommandResult DaemonProcess::run(const std::vector<std::string>& 
     if (n < 0 && errno != EINTR) break;
   }
   close(fd);
-  int status = 0;
-  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-  }
-  return {WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status), output};
+  return {platform::Subprocess::exitCode(child->wait()), output};
 }
 
 std::unique_ptr<DaemonProcess> DaemonProcess::serve(const std::string& address,

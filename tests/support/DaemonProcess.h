@@ -19,6 +19,8 @@
 #include <thread>
 #include <vector>
 
+#include "platform/Subprocess.h"
+
 namespace quorvel::testing {
 
 class DaemonProcess {
@@ -67,6 +69,7 @@ class DaemonProcess {
  private:
   void capture(int fd);
 
+  std::optional<platform::Subprocess> process_;
   pid_t pid_ = -1;
   std::optional<int> exitStatus_;
   std::thread reader_;
