@@ -85,18 +85,14 @@ SavedRecordingService::URLSetHandler urlSetHandlerFor(platform::IncomingCall cal
 
 using Handler = void (*)(SavedRecordingService& service, platform::IncomingCall call);
 
-void prepareToCapture(SavedRecordingService& service, platform::IncomingCall call) {
+// PrepareToCapture, PrepareToPreview and PrepareToTrim: a URL in, a token
+// out, through the service's request `Request`.
+template <auto Request>
+void prepareAccess(SavedRecordingService& service, platform::IncomingCall call) {
   auto url = urlArgument(call);
   auto connection = call.connection();
-  service.prepareToCaptureToCompositionAVURL(
-      std::move(url), accessRequestHandlerFor(std::move(call)), std::move(connection));
-}
-
-void prepareToPreview(SavedRecordingService& service, platform::IncomingCall call) {
-  auto url = urlArgument(call);
-  auto connection = call.connection();
-  service.prepareToPreviewCompositionAVURL(std::move(url), accessRequestHandlerFor(std::move(call)),
-                                           std::move(connection));
+  (service.*Request)(std::move(url), accessRequestHandlerFor(std::move(call)),
+                     std::move(connection));
 }
 
 void prepareToExport(SavedRecordingService& service, platform::IncomingCall call) {
@@ -106,13 +102,6 @@ void prepareToExport(SavedRecordingService& service, platform::IncomingCall call
   service.prepareToExportCompositionAVURL(std::move(url), cacheWaveform,
                                           accessRequestHandlerFor(std::move(call)),
                                           std::move(connection));
-}
-
-void prepareToTrim(SavedRecordingService& service, platform::IncomingCall call) {
-  auto url = urlArgument(call);
-  auto connection = call.connection();
-  service.prepareToTrimCompositionAVURL(std::move(url), accessRequestHandlerFor(std::move(call)),
-                                        std::move(connection));
 }
 
 void endAccessSession(SavedRecordingService& service, platform::IncomingCall call) {
@@ -225,10 +214,12 @@ void listDeferredRequests(SavedRecordingService& service, platform::IncomingCall
 }
 
 constexpr std::pair<std::string_view, Handler> kHandlers[] = {
-    {RCSMethodPrepareToCapture, prepareToCapture},
-    {RCSMethodPrepareToPreview, prepareToPreview},
+    {RCSMethodPrepareToCapture,
+     prepareAccess<&SavedRecordingService::prepareToCaptureToCompositionAVURL>},
+    {RCSMethodPrepareToPreview,
+     prepareAccess<&SavedRecordingService::prepareToPreviewCompositionAVURL>},
     {RCSMethodPrepareToExport, prepareToExport},
-    {RCSMethodPrepareToTrim, prepareToTrim},
+    {RCSMethodPrepareToTrim, prepareAccess<&SavedRecordingService::prepareToTrimCompositionAVURL>},
     {RCSMethodEndAccessSession, endAccessSession},
     {RCSMethodDisableOrphanedFragmentCleanup, disableOrphanedFragmentCleanup},
     {RCSMethodEnableOrphanedFragmentCleanup, enableOrphanedFragmentCleanup},
