@@ -374,6 +374,7 @@ platform::Result<std::vector<SavedRecordingServiceClient::AccessHolder>> list(sd
       return promise.set_value(platform::fail(malformedReply(method, e.getMessage())));
     }
     std::vector<SavedRecordingServiceClient::AccessHolder> holders;
+    holders.reserve(wire.size());
     for (const Wire& entry : wire) holders.push_back(convert(entry));
     promise.set_value(std::move(holders));
   });
