@@ -1,84 +1,63 @@
+// The fixtures are made and read back by the ffmpeg and ffprobe programs, not
+// by the FFmpeg code under test: a fault of the framework's media code cannot
+// hide in fixtures that share it.
 #include "tests/support/AudioFixtures.h"
 
-extern "C" {
-#include <libavcodec/avcodec.h>
-#include <libavformat/avformat.h>
-#include <libavutil/channel_layout.h>
-#include <libavutil/opt.h>
-#include <libswresample/swresample.h>
-}
+#include <fcntl.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cmath>
-#include <cstdlib>
+#include <cstdio>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <limits>
-#include <memory>
-#include <numbers>
+#include <ranges>
+#include <string_view>
 #include <tuple>
 
-#include "QuorvelMedia/RCFFmpegLogging.h"
+#include <fmt/format.h>
+
+#include "platform/Subprocess.h"
 
 namespace quorvel::testing {
 namespace {
 
 constexpr const char* kDomain = "org.quorvel.tests.AudioFixtures";
 
-platform::Error ffError(int code, const std::string& what) {
-  char text[AV_ERROR_MAX_STRING_SIZE] = {};
-  av_strerror(code, text, sizeof text);
-  return platform::Error(kDomain, code, what + ": " + text);
+platform::Error fixtureError(const std::string& what) { return platform::Error(kDomain, -1, what); }
+
+// Runs `arguments` (a program from PATH) with its stdout collected; its
+// stderr, ffmpeg's error lines, goes to the test's.
+platform::Result<std::string> run(std::vector<std::string> arguments) {
+  int fds[2];
+  if (::pipe2(fds, O_CLOEXEC) != 0) return platform::fail(fixtureError("pipe"));
+  auto child = platform::Subprocess::spawn(
+      {.arguments = arguments,
+       .searchPath = true,
+       .descriptors = {{STDIN_FILENO, platform::Subprocess::kDevNull}, {STDOUT_FILENO, fds[1]}}});
+  ::close(fds[1]);
+  std::string output;
+  char buffer[65536];
+  for (ssize_t n; child && (n = ::read(fds[0], buffer, sizeof buffer)) != 0;) {
+    if (n > 0) output.append(buffer, std::size_t(n));
+    if (n < 0 && errno != EINTR) break;
+  }
+  ::close(fds[0]);
+  if (!child) return platform::fail(child.error());
+  if (const int status = child->wait(); status != 0)
+    return platform::fail(
+        fixtureError(arguments.front() + " " + platform::Subprocess::describeStatus(status)));
+  return output;
 }
 
-struct OutputContextDeleter {
-  void operator()(AVFormatContext* context) const {
-    if (context != nullptr && context->pb != nullptr && !(context->oformat->flags & AVFMT_NOFILE))
-      avio_closep(&context->pb);
-    avformat_free_context(context);
-  }
-};
-// Deleters for the types FFmpeg frees through a pointer to the pointer.
-template <auto Free>
-struct FreeDeleter {
-  template <typename T>
-  void operator()(T* object) const {
-    Free(&object);
-  }
-};
-using InputContextDeleter = FreeDeleter<avformat_close_input>;
-using CodecContextDeleter = FreeDeleter<avcodec_free_context>;
-using FrameDeleter = FreeDeleter<av_frame_free>;
-using PacketDeleter = FreeDeleter<av_packet_free>;
-using SwrDeleter = FreeDeleter<swr_free>;
-
-struct FormatChoice {
-  const char* muxer;
-  AVCodecID codec;
-  AVSampleFormat sampleFormat;
-};
-
-platform::Result<FormatChoice> choose(const std::string& format) {
-  if (format == "m4a") return FormatChoice{"ipod", AV_CODEC_ID_AAC, AV_SAMPLE_FMT_FLTP};
-  if (format == "flac") return FormatChoice{"flac", AV_CODEC_ID_FLAC, AV_SAMPLE_FMT_S16};
-  if (format == "wav") return FormatChoice{"wav", AV_CODEC_ID_PCM_S16LE, AV_SAMPLE_FMT_S16};
-  return platform::fail(platform::Error(kDomain, -1, "unknown tone format " + format));
-}
-
-// Sends `frame` (nullptr drains) and writes every packet the encoder returns.
-platform::Status encodeAndWrite(AVCodecContext* codec, AVFormatContext* output, AVStream* stream,
-                                AVFrame* frame, AVPacket* packet) {
-  int status = avcodec_send_frame(codec, frame);
-  if (status < 0) return platform::fail(ffError(status, "avcodec_send_frame"));
-  for (;;) {
-    status = avcodec_receive_packet(codec, packet);
-    if (status == AVERROR(EAGAIN) || status == AVERROR_EOF) return {};
-    if (status < 0) return platform::fail(ffError(status, "avcodec_receive_packet"));
-    av_packet_rescale_ts(packet, codec->time_base, stream->time_base);
-    packet->stream_index = stream->index;
-    status = av_interleaved_write_frame(output, packet);
-    if (status < 0) return platform::fail(ffError(status, "av_interleaved_write_frame"));
-  }
+// The words of `text`, split at blanks.
+std::vector<std::string> words(std::string_view text) {
+  std::vector<std::string> split;
+  for (auto word : std::views::split(text, ' ')) split.emplace_back(word.begin(), word.end());
+  return split;
 }
 
 }  // namespace
@@ -88,6 +67,36 @@ platform::Status writeTone(const std::string& path, double seconds, const std::s
                            M4ALayout layout) {
   return writeTone(
       path, ToneOptions{seconds, format, sampleRate, channels, frequencyHz, amplitude, layout, {}});
+}
+
+platform::Status writeTone(const std::string& path, const ToneOptions& tone) {
+  std::vector<std::string> codec;
+  if (tone.format == "m4a") {
+    codec = {"-c:a", "aac", "-b:a", std::to_string(64000 * tone.channels), "-f", "ipod"};
+    if (tone.layout == M4ALayout::MoovFirst) codec.insert(codec.end(), {"-movflags", "+faststart"});
+  } else if (tone.format == "flac") {
+    codec = {"-c:a", "flac", "-sample_fmt", "s16", "-f", "flac"};
+  } else if (tone.format == "wav") {
+    codec = {"-c:a", "pcm_s16le", "-f", "wav"};
+  } else {
+    return platform::fail(fixtureError("unknown tone format " + tone.format));
+  }
+  // The same sine on every channel.
+  std::string expression = fmt::format("{}*sin(2*PI*{}*t)", tone.amplitude, tone.frequencyHz);
+  std::string channels = expression;
+  for (int c = 1; c < tone.channels; ++c) channels += "|" + expression;
+  // Only the container is bit-exact: AAC's bit-exact mode spoils the sine.
+  auto arguments = words("ffmpeg -nostdin -v error -y -f lavfi -i");
+  arguments.push_back(
+      fmt::format("aevalsrc={}:s={}:d={}", channels, tone.sampleRate, tone.seconds));
+  arguments.insert(arguments.end(), {"-fflags", "+bitexact"});
+  for (const auto& [key, value] : tone.metadata)
+    arguments.insert(arguments.end(), {"-metadata", key + "=" + value});
+  arguments.insert(arguments.end(), codec.begin(), codec.end());
+  arguments.push_back(path);
+  auto ran = run(std::move(arguments));
+  if (!ran) return platform::fail(ran.error());
+  return {};
 }
 
 platform::Status writeDamagedAudio(const std::string& dir) {
@@ -111,153 +120,31 @@ platform::Status writeDamagedAudio(const std::string& dir) {
   cut("whole.m4a", "cut.m4a", 2.0 / 3);
   cut("first.m4a", "cutdata.m4a", 0.5);
   cut("whole.wav", "cut.wav", 0.5);
-  const std::string video =
-      "ffmpeg -nostdin -v error -y -f lavfi -i color=s=32x32:d=0.5 -c:v mpeg4 -f mp4 '" +
-      (at / "video.m4a").string() + "'";
-  if (std::system(video.c_str()) != 0)
-    return platform::fail(platform::Error(kDomain, -1, "ffmpeg could not write a video"));
-  return {};
-}
-
-platform::Status writeTone(const std::string& path, const ToneOptions& tone) {
-  RCInstallFFmpegLogging();
-  auto choice = choose(tone.format);
-  if (!choice) return platform::fail(choice.error());
-
-  AVFormatContext* rawOutput = nullptr;
-  int status = avformat_alloc_output_context2(&rawOutput, nullptr, choice->muxer, path.c_str());
-  if (status < 0) return platform::fail(ffError(status, "avformat_alloc_output_context2"));
-  std::unique_ptr<AVFormatContext, OutputContextDeleter> output(rawOutput);
-
-  const AVCodec* encoder = avcodec_find_encoder(choice->codec);
-  if (encoder == nullptr) return platform::fail(platform::Error(kDomain, -1, "no encoder"));
-  std::unique_ptr<AVCodecContext, CodecContextDeleter> codec(avcodec_alloc_context3(encoder));
-  codec->sample_rate = tone.sampleRate;
-  codec->sample_fmt = choice->sampleFormat;
-  av_channel_layout_default(&codec->ch_layout, tone.channels);
-  codec->time_base = AVRational{1, tone.sampleRate};
-  if (choice->codec == AV_CODEC_ID_AAC) codec->bit_rate = 64000 * tone.channels;
-  if (output->oformat->flags & AVFMT_GLOBALHEADER) codec->flags |= AV_CODEC_FLAG_GLOBAL_HEADER;
-  status = avcodec_open2(codec.get(), encoder, nullptr);
-  if (status < 0) return platform::fail(ffError(status, "avcodec_open2"));
-
-  AVStream* stream = avformat_new_stream(output.get(), nullptr);
-  if (stream == nullptr) return platform::fail(platform::Error(kDomain, -1, "no stream"));
-  stream->time_base = codec->time_base;
-  status = avcodec_parameters_from_context(stream->codecpar, codec.get());
-  if (status < 0) return platform::fail(ffError(status, "avcodec_parameters_from_context"));
-  for (const auto& [key, value] : tone.metadata) {
-    av_dict_set(&output->metadata, key.c_str(), value.c_str(), 0);
-  }
-
-  status = avio_open(&output->pb, path.c_str(), AVIO_FLAG_WRITE);
-  if (status < 0) return platform::fail(ffError(status, "avio_open " + path));
-  AVDictionary* options = nullptr;
-  if (tone.format == "m4a" && tone.layout == M4ALayout::MoovFirst) {
-    av_dict_set(&options, "movflags", "+faststart", 0);
-  }
-  status = avformat_write_header(output.get(), &options);
-  av_dict_free(&options);
-  if (status < 0) return platform::fail(ffError(status, "avformat_write_header"));
-
-  const int frameSize = codec->frame_size > 0 ? codec->frame_size : 1024;
-  const auto totalFrames = static_cast<int64_t>(std::llround(tone.seconds * tone.sampleRate));
-  std::unique_ptr<AVFrame, FrameDeleter> frame(av_frame_alloc());
-  std::unique_ptr<AVPacket, PacketDeleter> packet(av_packet_alloc());
-  const double step = 2.0 * std::numbers::pi * tone.frequencyHz / tone.sampleRate;
-  for (int64_t done = 0; done < totalFrames;) {
-    const int count = static_cast<int>(std::min<int64_t>(frameSize, totalFrames - done));
-    av_frame_unref(frame.get());
-    frame->nb_samples = count;
-    frame->format = codec->sample_fmt;
-    frame->sample_rate = codec->sample_rate;
-    av_channel_layout_copy(&frame->ch_layout, &codec->ch_layout);
-    status = av_frame_get_buffer(frame.get(), 0);
-    if (status < 0) return platform::fail(ffError(status, "av_frame_get_buffer"));
-    for (int i = 0; i < count; ++i) {
-      const double value = tone.amplitude * std::sin(step * double(done + i));
-      for (int c = 0; c < tone.channels; ++c) {
-        if (codec->sample_fmt == AV_SAMPLE_FMT_FLTP) {
-          reinterpret_cast<float*>(frame->extended_data[c])[i] = static_cast<float>(value);
-        } else {
-          reinterpret_cast<int16_t*>(frame->data[0])[i * tone.channels + c] =
-              static_cast<int16_t>(std::lround(std::clamp(value, -1.0, 1.0) * 32767.0));
-        }
-      }
-    }
-    frame->pts = done;
-    if (auto written = encodeAndWrite(codec.get(), output.get(), stream, frame.get(), packet.get());
-        !written) {
-      return written;
-    }
-    done += count;
-  }
-  if (auto drained = encodeAndWrite(codec.get(), output.get(), stream, nullptr, packet.get());
-      !drained) {
-    return drained;
-  }
-  status = av_write_trailer(output.get());
-  if (status < 0) return platform::fail(ffError(status, "av_write_trailer"));
+  auto video = words("ffmpeg -nostdin -v error -y -f lavfi -i color=s=32x32:d=0.5 -c:v mpeg4");
+  video.insert(video.end(), {"-f", "mp4", (at / "video.m4a").string()});
+  if (auto made = run(std::move(video)); !made) return platform::fail(made.error());
   return {};
 }
 
 platform::Result<DecodedPCM> decodeToPCM(const std::string& path) {
-  RCInstallFFmpegLogging();
-  AVFormatContext* rawInput = nullptr;
-  int status = avformat_open_input(&rawInput, path.c_str(), nullptr, nullptr);
-  if (status < 0) return platform::fail(ffError(status, "avformat_open_input " + path));
-  std::unique_ptr<AVFormatContext, InputContextDeleter> input(rawInput);
-  status = avformat_find_stream_info(input.get(), nullptr);
-  if (status < 0) return platform::fail(ffError(status, "avformat_find_stream_info"));
-  const AVCodec* decoder = nullptr;
-  const int streamIndex = av_find_best_stream(input.get(), AVMEDIA_TYPE_AUDIO, -1, -1, &decoder, 0);
-  if (streamIndex < 0) return platform::fail(ffError(streamIndex, "no audio stream"));
-  std::unique_ptr<AVCodecContext, CodecContextDeleter> codec(avcodec_alloc_context3(decoder));
-  avcodec_parameters_to_context(codec.get(), input->streams[streamIndex]->codecpar);
-  status = avcodec_open2(codec.get(), decoder, nullptr);
-  if (status < 0) return platform::fail(ffError(status, "avcodec_open2"));
-
+  auto probe = words(
+      "ffprobe -v error -select_streams a:0 -show_entries "
+      "stream=sample_rate,channels -of csv=p=0");
+  probe.push_back(path);
+  auto shape = run(std::move(probe));
+  if (!shape) return platform::fail(shape.error());
   DecodedPCM pcm;
-  pcm.sampleRate = codec->sample_rate;
-  pcm.channels = codec->ch_layout.nb_channels;
-  SwrContext* rawSwr = nullptr;
-  status =
-      swr_alloc_set_opts2(&rawSwr, &codec->ch_layout, AV_SAMPLE_FMT_FLT, codec->sample_rate,
-                          &codec->ch_layout, codec->sample_fmt, codec->sample_rate, 0, nullptr);
-  std::unique_ptr<SwrContext, SwrDeleter> swr(rawSwr);
-  if (status < 0 || swr_init(swr.get()) < 0) {
-    return platform::fail(ffError(status, "swr_alloc_set_opts2"));
-  }
-
-  std::unique_ptr<AVFrame, FrameDeleter> frame(av_frame_alloc());
-  std::unique_ptr<AVPacket, PacketDeleter> packet(av_packet_alloc());
-  auto drain = [&]() -> platform::Status {
-    for (;;) {
-      int received = avcodec_receive_frame(codec.get(), frame.get());
-      if (received == AVERROR(EAGAIN) || received == AVERROR_EOF) return {};
-      if (received < 0) return platform::fail(ffError(received, "avcodec_receive_frame"));
-      const std::size_t offset = pcm.samples.size();
-      pcm.samples.resize(offset + std::size_t(frame->nb_samples) * pcm.channels);
-      uint8_t* out[] = {reinterpret_cast<uint8_t*>(pcm.samples.data() + offset)};
-      int converted =
-          swr_convert(swr.get(), out, frame->nb_samples,
-                      const_cast<const uint8_t**>(frame->extended_data), frame->nb_samples);
-      if (converted < 0) return platform::fail(ffError(converted, "swr_convert"));
-      pcm.samples.resize(offset + std::size_t(converted) * pcm.channels);
-      av_frame_unref(frame.get());
-    }
-  };
-  while (av_read_frame(input.get(), packet.get()) >= 0) {
-    if (packet->stream_index == streamIndex) {
-      // A damaged packet is skipped, as a player would.
-      if (avcodec_send_packet(codec.get(), packet.get()) >= 0) {
-        if (auto drained = drain(); !drained) return platform::fail(drained.error());
-      }
-    }
-    av_packet_unref(packet.get());
-  }
-  avcodec_send_packet(codec.get(), nullptr);
-  if (auto drained = drain(); !drained) return platform::fail(drained.error());
+  if (std::sscanf(shape->c_str(), "%d,%d", &pcm.sampleRate, &pcm.channels) != 2)
+    return platform::fail(fixtureError("no audio stream in " + path));
+  // A damaged packet is skipped, as a player would: ffmpeg goes on after one.
+  auto decode = words("ffmpeg -nostdin -v quiet -i");
+  decode.push_back(path);
+  for (auto& word : words("-map 0:a:0 -f f32le -c:a pcm_f32le -"))
+    decode.push_back(std::move(word));
+  auto samples = run(std::move(decode));
+  if (!samples) return platform::fail(samples.error());
+  pcm.samples.resize(samples->size() / sizeof(float));
+  std::memcpy(pcm.samples.data(), samples->data(), pcm.samples.size() * sizeof(float));
   return pcm;
 }
 
