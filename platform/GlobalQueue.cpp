@@ -5,6 +5,8 @@
 // other static objects' destructors at exit cannot reach a dead queue.
 #include "platform/GlobalQueue.h"
 
+#include <pthread.h>
+
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
@@ -47,6 +49,7 @@ class GlobalQueue final : public DispatchQueue {
 
  private:
   void workerLoop() {
+    pthread_setname_np(pthread_self(), "global");
     for (;;) {
       Task task;
       {

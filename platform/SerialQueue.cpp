@@ -36,6 +36,7 @@
 #include "platform/Misuse.h"
 
 #include <fmt/format.h>
+#include <pthread.h>
 
 #include <algorithm>
 #include <atomic>
@@ -115,11 +116,12 @@ struct SerialQueue::State {
   std::atomic<bool> owned{false};
   bool stopping = false;
   // The worker thread exists only while it has work or has had some within
-  // kWorkerLinger: `workerRunning` while its loop runs, `worker` the handle of
-  // the latest one (joined when the next one starts, or by the destructor).
+  // kWorkerLinger: `workerRunning` while its loop runs. It is detached, so a
+  // process that exits while it lingers leaves nothing unjoined; the
+  // destructor waits on `workerEnded` for its loop to end instead.
   bool workerRunning = false;
   std::thread::id workerId;
-  std::thread worker;
+  std::condition_variable workerEnded;
 };
 
 namespace {
@@ -133,6 +135,8 @@ constexpr auto kWorkerLinger = std::chrono::seconds(1);
 
 void SerialQueue::workerLoop() {
   State& state = *state_;
+  // Named after the queue, so `top -H` and /proc show which queue is busy.
+  pthread_setname_np(pthread_self(), state.label.substr(0, 15).c_str());
   std::unique_lock lock(state.mutex);
   for (;;) {
     const bool woken = state.wake.wait_for(lock, kWorkerLinger, [&] {
@@ -162,24 +166,21 @@ void SerialQueue::workerLoop() {
   }
   state.workerRunning = false;
   state.workerId = {};
+  // After this the thread touches nothing of the queue but the unlock.
+  state.workerEnded.notify_all();
 }
 
 void SerialQueue::wakeWorker(std::unique_lock<std::mutex>& lock) {
   State& state = *state_;
+  QV_MISUSE(!lock.owns_lock(), "SerialQueue '{}' woken without its lock", state.label);
   if (state.workerRunning) {
     state.wake.notify_one();
     return;
   }
-  // The previous worker has left its loop; it only has to return.
-  std::thread finished = std::move(state.worker);
   state.workerRunning = true;
-  state.worker = std::thread([this] { workerLoop(); });
-  state.workerId = state.worker.get_id();
-  if (finished.joinable()) {
-    lock.unlock();
-    finished.join();
-    lock.lock();
-  }
+  std::thread worker([this] { workerLoop(); });
+  state.workerId = worker.get_id();
+  worker.detach();
 }
 
 SerialQueue::SerialQueue(std::string label) : state_(std::make_unique<State>()) {
@@ -191,17 +192,13 @@ SerialQueue::~SerialQueue() {
             state_->label);
   // Adopted by this thread: its tasks run now, as the worker would run them.
   if (takeAdopted(this)) runAdopted(*this);
-  std::thread worker;
-  {
-    std::unique_lock lock(state_->mutex);
-    QV_MISUSE(state_->workerRunning && state_->workerId == std::this_thread::get_id(),
-              "SerialQueue '{}' destroyed from its own queue", state_->label);
-    state_->stopping = true;
-    // What is still queued runs before the queue goes, on a worker.
-    if (!state_->items.empty() || state_->workerRunning) wakeWorker(lock);
-    worker = std::move(state_->worker);
-  }
-  if (worker.joinable()) worker.join();
+  std::unique_lock lock(state_->mutex);
+  QV_MISUSE(state_->workerRunning && state_->workerId == std::this_thread::get_id(),
+            "SerialQueue '{}' destroyed from its own queue", state_->label);
+  state_->stopping = true;
+  // What is still queued runs before the queue goes, on a worker.
+  if (!state_->items.empty() || state_->workerRunning) wakeWorker(lock);
+  state_->workerEnded.wait(lock, [this] { return !state_->workerRunning; });
 }
 
 void SerialQueue::async(Task task) { enqueue(std::move(task), false); }

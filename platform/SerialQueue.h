@@ -72,7 +72,7 @@ class SerialQueue final : public DispatchQueue {
   // The worker's loop; it returns once the queue has been idle a while.
   void workerLoop();
   // Wakes the worker, starting one if none runs. Called with the queue's
-  // mutex held through `lock`, which it may release and take again.
+  // mutex held through `lock`.
   void wakeWorker(std::unique_lock<std::mutex>& lock);
   // Runs an adopted queue's tasks on the calling thread (see AdoptionScope).
   static void runAdopted(SerialQueue& queue);

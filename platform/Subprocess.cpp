@@ -6,6 +6,7 @@
 #include "platform/Subprocess.h"
 
 #include <fcntl.h>
+#include <pthread.h>
 #include <signal.h>
 #include <spawn.h>
 #include <string.h>
@@ -42,9 +43,11 @@ class SpawningThread {
       std::lock_guard lock(mutex_);
       tasks_.push_back({std::move(spawn), &ran});
       if (!running_) {
-        if (thread_.joinable()) thread_.join();  // it has left its loop
+        // Detached: once it has left its loop it touches nothing but the
+        // mutex of this never-destroyed instance, and a process that exits
+        // while it lingers has nothing to join.
         running_ = true;
-        thread_ = std::thread([this] { loop(); });
+        std::thread([this] { loop(); }).detach();
       } else {
         wake_.notify_one();
       }
@@ -65,6 +68,7 @@ class SpawningThread {
   };
 
   void loop() {
+    pthread_setname_np(pthread_self(), "spawner");
     std::unique_lock lock(mutex_);
     for (;;) {
       wake_.wait(lock, [this] { return !tasks_.empty() || children_ == 0; });
@@ -85,7 +89,6 @@ class SpawningThread {
   std::deque<Task> tasks_;
   std::size_t children_ = 0;  // spawned here and not yet reaped
   bool running_ = false;
-  std::thread thread_;
 };
 
 std::vector<char*> pointersTo(std::vector<std::string>& strings) {
