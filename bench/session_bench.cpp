@@ -21,19 +21,26 @@
 // it skews rates, and, as a floor for part 2, the grant rate of a bare
 // listener on the daemon's transport that answers the same two calls at once
 // with no session behind them: what the bus, the clients and the transport
-// cost a grant by themselves.
+// cost a grant by themselves. The bare listener runs in a process of its own,
+// as the daemon does: in the clients' process its thread switches would be
+// cheaper than any daemon's process switches, and the floor too high.
 //
 // Usage: session_bench [N]   (prepares per path in part 1; default 5000)
+//        session_bench --bare-listener ADDRESS   (the floor's listener)
 #include <sdbus-c++/sdbus-c++.h>
+#include <sys/prctl.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <atomic>
 #include <chrono>
+#include <csignal>
 #include <cstdio>
 #include <filesystem>
+#include <optional>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <tuple>
 #include <vector>
@@ -44,6 +51,7 @@
 #include "Quorvel/service/RCSSavedRecordingAccessToken.h"
 #include "bench/AcceptAll.h"
 #include "bench/BenchDaemon.h"
+#include "platform/Subprocess.h"
 #include "platform/dbus/BusListener.h"
 #include "tests/support/TestBus.h"
 
@@ -139,6 +147,38 @@ std::unique_ptr<platform::BusListener> startBareListener(const std::string& addr
   return listener;
 }
 
+// The floor's listener process: serves until killed, and dies with the
+// bench.
+int serveBare(const std::string& address) {
+  prctl(PR_SET_PDEATHSIG, SIGKILL);
+  quorvel::bench::AcceptAll acceptAll;
+  auto bare = startBareListener(address, acceptAll);
+  if (!bare) return 1;
+  for (;;) pause();
+}
+
+// Starts the floor's listener process and waits until it answers.
+std::optional<platform::Subprocess> spawnBare(const std::string& address,
+                                              sdbus::IConnection& connection) {
+  auto child =
+      platform::Subprocess::spawn({.arguments = {"/proc/self/exe", "--bare-listener", address}});
+  if (!child) {
+    std::fprintf(stderr, "cannot start the bare listener: %s\n",
+                 child.error().description().c_str());
+    return std::nullopt;
+  }
+  auto proxy = sdbus::createProxy(connection, kBareService, kPath);
+  for (int attempt = 0;; ++attempt) {
+    try {
+      ping(*proxy);
+      return std::move(*child);
+    } catch (const sdbus::Error&) {
+      if (attempt > 500) return std::nullopt;
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));  // its name has no event here
+    }
+  }
+}
+
 double micros(Clock::duration duration) {
   return std::chrono::duration<double, std::micro>(duration).count();
 }
@@ -151,6 +191,7 @@ double percentile(std::vector<double> values, double p) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  if (argc > 2 && std::string_view(argv[1]) == "--bare-listener") return serveBare(argv[2]);
   int n = argc > 1 ? std::atoi(argv[1]) : 5000;
   if (n <= 0) n = 5000;
   platform::testing::TestBus bus;
@@ -218,8 +259,7 @@ int main(int argc, char** argv) {
   constexpr int kClients = 8;
   constexpr int kRounds = 8;
   constexpr auto kWindow = std::chrono::milliseconds(500);
-  quorvel::bench::AcceptAll acceptAll;
-  auto bare = startBareListener(bus.address(), acceptAll);
+  auto bare = spawnBare(bus.address(), *connection);
   if (!bare) return 1;
   std::vector<std::unique_ptr<sdbus::IConnection>> connections;
   std::vector<std::unique_ptr<sdbus::IProxy>> proxies, bareProxies;
@@ -261,10 +301,12 @@ int main(int argc, char** argv) {
   rate(Calls::Pings);
   rate(Calls::BareGrants);
   double floorPingCount = 0, bareCount = 0;
+  const double bareCpuBefore = quorvel::bench::cpuMicroseconds(bare->pid());
   for (int round = 0; round < kRounds; ++round) {
     floorPingCount += rate(Calls::Pings);
     bareCount += rate(Calls::BareGrants);
   }
+  const double bareCpu = quorvel::bench::cpuMicroseconds(bare->pid()) - bareCpuBefore;
   double pingCount = 0, grantCount = 0;
   std::array<double, 3> pingCpu{}, grantCpu{};
   std::vector<double> ratios;
@@ -297,6 +339,7 @@ int main(int argc, char** argv) {
     std::printf("%s CPU time: %.1f us per ping, %.1f us per grant\n", names[i],
                 pingCpu[i] / pingCount, grantCpu[i] / grantCount);
   }
+  std::printf("bare listener CPU time: %.1f us per grant\n", bareCpu / bareCount);
   proxies.clear();
   bareProxies.clear();
   connections.clear();
