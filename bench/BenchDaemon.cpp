@@ -7,6 +7,8 @@
 #include <iterator>
 #include <set>
 #include <sstream>
+#include <string>
+#include <string_view>
 #include <vector>
 
 namespace quorvel::bench {
@@ -28,23 +30,23 @@ BenchDaemon::~BenchDaemon() {
   process_->wait();
 }
 
-long residentKilobytes(pid_t pid) {
+namespace {
+
+// The number after `field` ("VmRSS:", "Threads:") in /proc/PID/status, or -1.
+long statusField(pid_t pid, std::string_view field) {
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
   std::string line;
   while (std::getline(status, line)) {
-    if (line.starts_with("VmRSS:")) return std::stol(line.substr(6));
+    if (line.starts_with(field)) return std::stol(line.substr(field.size()));
   }
   return -1;
 }
 
-int threadCount(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.starts_with("Threads:")) return std::stoi(line.substr(8));
-  }
-  return -1;
-}
+}  // namespace
+
+long residentKilobytes(pid_t pid) { return statusField(pid, "VmRSS:"); }
+
+int threadCount(pid_t pid) { return static_cast<int>(statusField(pid, "Threads:")); }
 
 double cpuMicroseconds(pid_t pid) {
   std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
