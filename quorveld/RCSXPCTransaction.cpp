@@ -1,9 +1,8 @@
 // Keep-alive transactions.
 //
 // A transaction is a name and a random identifier; whether it is active is
-// the controller's business (its table, keyed by identifier). Destruction
-// ends an active transaction: by then no std::shared_ptr to it can be made,
-// so the end goes by identifier (see RCSXPCTransactionController).
+// the controller's business (its list). Destruction ends an active
+// transaction (see RCSXPCTransactionController).
 #include "quorveld/RCSXPCTransaction.h"
 
 #include <fmt/format.h>
@@ -30,10 +29,9 @@ RCSXPCTransaction::RCSXPCTransaction(std::string name)
 
 RCSXPCTransaction::~RCSXPCTransaction() {
   // Nothing can begin a transaction that is being destroyed, so one that the
-  // table no longer holds has nothing left to end.
+  // list no longer holds has nothing left to end.
   if (!_listed.load(std::memory_order_acquire)) return;
-  RCSXPCTransactionController::sharedInstance().removeActiveTransactionWithIdentifier(
-      _uuid, description());
+  RCSXPCTransactionController::sharedInstance().removeDestroyedTransaction(*this);
 }
 
 void RCSXPCTransaction::beginTransaction() {

@@ -52,10 +52,14 @@ class RCSXPCTransaction : public std::enable_shared_from_this<RCSXPCTransaction>
 
   platform::UUID _uuid;
   std::string _name;
-  // Whether the controller's table holds this transaction. Written only on
-  // the controller's queue; read by the destructor, which skips the
-  // controller altogether for a transaction that was already ended.
+  // Whether the controller's list of active transactions holds this one.
+  // Written only on the controller's queue; read by the destructor, which
+  // skips the controller altogether for a transaction that was already ended.
   mutable std::atomic<bool> _listed{false};
+  // The links of that list, which runs through the transactions themselves.
+  // Controller queue only.
+  RCSXPCTransaction* _previousActive = nullptr;
+  RCSXPCTransaction* _nextActive = nullptr;
 };
 
 }  // namespace quorvel

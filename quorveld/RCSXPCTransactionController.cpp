@@ -1,14 +1,13 @@
 // The root transaction.
 //
-// The table maps identifiers to transactions without owning them. Two traps
-// shape the removal path:
-//  - A transaction ends itself in its destructor. By then its weak_ptr in the
-//    table already reads empty, so removal looks up the identifier alone and
-//    never asks whether the transaction still exists.
+// The list of active transactions runs through the transactions, which the
+// controller never owns. Two traps shape the removal path:
+//  - A transaction ends itself in its destructor. Its links are still valid
+//    there, so it is taken out of the list like any other, by address.
 //  - A controller block may hold the last reference to a transaction (for
 //    instance while collecting activeTransactions()). If that reference dies
 //    on the controller's queue, the destructor must not sync onto the queue it
-//    is already on: the removal is queued behind the running block instead.
+//    is already on: it is that queue's running block, and unlinks at once.
 #define QV_LOG_TAG "RCSXPCTransaction"
 #include "quorveld/RCSXPCTransactionController.h"
 
@@ -31,7 +30,13 @@ RCSXPCTransactionController::RCSXPCTransactionController()
 void RCSXPCTransactionController::addActiveTransaction(RCSXPCTransaction& transaction) {
   _serialQueue.sync([&] {
     QV_LOG(platform::kLogLevelDebug, "Activating XPC transaction: {}", transaction.description());
-    _openTransactions.insertOrAssign(transaction._identifier(), transaction.weak_from_this());
+    // Beginning an active transaction logs again and leaves it where it is.
+    if (transaction._listed.load(std::memory_order_relaxed)) return;
+    transaction._previousActive = _openTransactions.last;
+    transaction._nextActive = nullptr;
+    (_openTransactions.last ? _openTransactions.last->_nextActive : _openTransactions.first) =
+        &transaction;
+    _openTransactions.last = &transaction;
     transaction._listed.store(true, std::memory_order_release);
     _onQueueUpdateInternalTransactionState();
   });
@@ -40,53 +45,56 @@ void RCSXPCTransactionController::addActiveTransaction(RCSXPCTransaction& transa
 void RCSXPCTransactionController::removeActiveTransaction(const RCSXPCTransaction& transaction) {
   // A live transaction is never ended from the controller's own queue (only
   // a destructor can run there), so this can always wait for its turn.
-  _serialQueue.sync([&] { _onQueueRemove(transaction._identifier(), &transaction, {}); });
+  auto& listed = const_cast<RCSXPCTransaction&>(transaction);
+  _serialQueue.sync([&] { _onQueueRemove(listed); });
 }
 
-void RCSXPCTransactionController::removeActiveTransactionWithIdentifier(
-    const platform::UUID& identifier, const std::string& description) {
-  if (_serialQueue.isCurrent()) {
-    _serialQueue.async(
-        [this, identifier, description] { _onQueueRemove(identifier, nullptr, description); });
-    return;
-  }
-  _serialQueue.sync([&] { _onQueueRemove(identifier, nullptr, description); });
+void RCSXPCTransactionController::removeDestroyedTransaction(RCSXPCTransaction& transaction) {
+  if (_serialQueue.isCurrent()) return _onQueueRemove(transaction);
+  _serialQueue.sync([&] { _onQueueRemove(transaction); });
 }
 
-void RCSXPCTransactionController::_onQueueRemove(const platform::UUID& identifier,
-                                                 const RCSXPCTransaction* transaction,
-                                                 std::string_view description) {
+void RCSXPCTransactionController::_onQueueRemove(RCSXPCTransaction& transaction) {
   QV_DCHECK_ON_QUEUE(_serialQueue);
-  if (!_openTransactions.erase(identifier)) return;
-  QV_LOG(platform::kLogLevelDebug, "Deactivating XPC transaction: {}",
-         transaction ? transaction->description() : std::string(description));
-  if (transaction) transaction->_listed.store(false, std::memory_order_release);
+  if (!transaction._listed.load(std::memory_order_relaxed)) return;
+  (transaction._previousActive ? transaction._previousActive->_nextActive
+                               : _openTransactions.first) = transaction._nextActive;
+  (transaction._nextActive ? transaction._nextActive->_previousActive : _openTransactions.last) =
+      transaction._previousActive;
+  QV_LOG(platform::kLogLevelDebug, "Deactivating XPC transaction: {}", transaction.description());
+  transaction._previousActive = transaction._nextActive = nullptr;
+  transaction._listed.store(false, std::memory_order_release);
   _onQueueUpdateInternalTransactionState();
 }
 
 bool RCSXPCTransactionController::isTransactionActive(const RCSXPCTransaction& transaction) {
   bool active = false;
-  _serialQueue.sync([&] { active = _openTransactions.contains(transaction._identifier()); });
+  _serialQueue.sync([&] { active = transaction._listed.load(std::memory_order_relaxed); });
   return active;
 }
 
 std::vector<std::shared_ptr<RCSXPCTransaction>> RCSXPCTransactionController::activeTransactions() {
   std::vector<std::shared_ptr<RCSXPCTransaction>> transactions;
   _serialQueue.sync([&] {
-    _openTransactions.forEach([&](const platform::UUID&, const auto& weak) {
-      if (auto transaction = weak.lock()) transactions.push_back(std::move(transaction));
-    });
+    for (RCSXPCTransaction* transaction = _openTransactions.first; transaction;
+         transaction = transaction->_nextActive) {
+      // Empty for one whose destructor waits for this block to end it.
+      if (auto strong = transaction->weak_from_this().lock()) {
+        transactions.push_back(std::move(strong));
+      }
+    }
   });
   return transactions;
 }
 
 void RCSXPCTransactionController::_onQueueUpdateInternalTransactionState() {
   QV_DCHECK_ON_QUEUE(_serialQueue);
-  if (_inTransaction && _openTransactions.empty()) {
+  const bool empty = _openTransactions.first == nullptr;
+  if (_inTransaction && empty) {
     platform::ProcessLifetime::instance().endTransaction();
     _inTransaction = false;
     QV_LOG(platform::kLogLevelDebug, "No XPC transactions remain. Ending root XPC transaction.");
-  } else if (!_inTransaction && !_openTransactions.empty()) {
+  } else if (!_inTransaction && !empty) {
     platform::ProcessLifetime::instance().beginTransaction();
     _inTransaction = true;
     QV_LOG(platform::kLogLevelDebug, "Root XPC transaction began.");

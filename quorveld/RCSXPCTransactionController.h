@@ -16,8 +16,6 @@
 #include <vector>
 
 #include "platform/SerialQueue.h"
-#include "platform/UUID.h"
-#include "platform/UUIDTable.h"
 
 namespace quorvel {
 
@@ -38,26 +36,27 @@ class RCSXPCTransactionController {
   friend class RCSXPCTransaction;
   RCSXPCTransactionController();
 
-  // Removal by identifier: a transaction being destroyed can no longer be
-  // referred to, but its entry must still go.
-  void removeActiveTransactionWithIdentifier(const platform::UUID& identifier,
-                                             const std::string& description);
-  // Controller queue only (checked in debug builds): the bodies of removal
-  // and of every change to the table, which begin or end the root.
-  // `transaction`, when it is still alive, is told it left the table and
-  // describes itself in the log line; else `description` does.
-  void _onQueueRemove(const platform::UUID& identifier, const RCSXPCTransaction* transaction,
-                      std::string_view description);
+  // The end of a transaction being destroyed: no std::shared_ptr to it can
+  // be made any more, but its entry must still go.
+  void removeDestroyedTransaction(RCSXPCTransaction& transaction);
+  // Controller queue only (checked in debug builds): the body of removal,
+  // and the change of the root after every change to the list.
+  void _onQueueRemove(RCSXPCTransaction& transaction);
   void _onQueueUpdateInternalTransactionState();
 
   // Any thread.
   platform::SerialQueue _serialQueue;
 
   // Controller queue only:
-  // Identifier -> transaction, never owning it. A busy daemon keeps tens of
-  // thousands here (every queued request's keep-alive lives a second after
-  // its work), so the table is a flat one.
-  platform::UUIDTable<std::weak_ptr<RCSXPCTransaction>> _openTransactions;
+  // The active transactions, oldest first, linked through the transactions
+  // themselves and never owned. A busy daemon keeps a hundred thousand here
+  // (every queued request's keep-alive lives a second after its work), and
+  // a link costs no allocation, no hashing and no growing table: adding and
+  // removing touch only the transaction and its neighbours.
+  struct OpenTransactions {
+    RCSXPCTransaction* first = nullptr;
+    RCSXPCTransaction* last = nullptr;
+  } _openTransactions;
 
   // Written on the controller queue, read from any thread.
   std::atomic<bool> _inTransaction{false};
