@@ -42,10 +42,12 @@ TEST(MediaProtocolTest, FramesSplitAnywhereComeOutWholeAndOversizedOnesAreRefuse
   EXPECT_EQ(refused.error(), RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
 }
 
-RCMediaRequest throughTheWire(const RCMediaRequest& request) {
-  auto decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(request));
-  EXPECT_TRUE(decoded) << decoded.error();
-  return decoded.value_or(RCMediaRequest{});
+// Every field of a request, comparable.
+auto fields(const RCMediaRequest& r) {
+  std::vector<std::tuple<platform::URL, double, double>> segments;
+  for (const auto& s : r.segments)
+    segments.emplace_back(s.fragmentURL, s.contentStart, s.contentDuration);
+  return std::tuple(r.id, int(r.kind), r.url, r.urls, segments, r.destination, r.title, r.language);
 }
 RCMediaReply decodedReply(const std::string& body) {
   auto decoded = RCMediaDecodeReply(body);
@@ -57,28 +59,21 @@ TEST(MediaProtocolTest, RequestsAndRepliesSurviveTheTrip) {
   // Any byte of a Linux file name, and titles in any script.
   const platform::URL odd = platform::URL::fileURLWithPath("/rec/\xff\x01 Walk %20#?.m4a"),
                       flac = platform::URL::fileURLWithPath("/b.flac");
-  RCMediaRequest compose{.id = 42, .kind = RCMediaJobKind::Compose, .url = odd};
-  compose.segments = {{odd, 0.25, 1.5}, {flac, 0, 0.5}};
-  compose.destination = platform::URL::fileURLWithPath("/rec/Walk.waveform");
-  RCMediaRequest decoded = throughTheWire(compose);
-  EXPECT_EQ(decoded.id, 42u);
-  EXPECT_EQ(decoded.kind, RCMediaJobKind::Compose);
-  EXPECT_EQ(decoded.url, odd);
-  ASSERT_EQ(decoded.segments.size(), 2u);
-  EXPECT_EQ(decoded.segments[0].fragmentURL, odd);
-  EXPECT_EQ(decoded.segments[0].contentStart, 0.25);
-  EXPECT_EQ(decoded.segments[1].contentDuration, 0.5);
-  EXPECT_EQ(decoded.destination, compose.destination);
-
-  decoded = throughTheWire({.kind = RCMediaJobKind::WriteTitle,
-                            .url = odd,
-                            .title = "Spaziergang \xc3\xbc",
-                            .language = "deu"});
-  EXPECT_EQ(decoded.title, "Spaziergang \xc3\xbc");
-  EXPECT_EQ(decoded.language, "deu");
-  decoded = throughTheWire({.kind = RCMediaJobKind::ProbeMany, .urls = {odd, flac}});
-  EXPECT_EQ(decoded.kind, RCMediaJobKind::ProbeMany);
-  EXPECT_EQ(decoded.urls, (std::vector{odd, flac}));
+  using enum RCMediaJobKind;
+  for (const RCMediaRequest& request : std::vector<RCMediaRequest>{
+           {.id = 42,
+         .kind = Compose,
+         .url = odd,
+         .segments = {{odd, 0.25, 1.5}, {flac, 0, 0.5}},
+         .destination = platform::URL::fileURLWithPath("/rec/Walk.waveform")},
+           {.kind = WriteTitle, .url = odd, .title = "Spaziergang \xc3\xbc", .language = "deu"},
+           {.kind = ProbeMany, .urls = {odd, flac}},
+           {.id = 7, .kind = Waveform, .url = flac, .destination = odd},
+       }) {
+    auto decoded = RCMediaDecodeRequest(RCMediaEncodeRequest(request));
+    ASSERT_TRUE(decoded) << decoded.error();
+    EXPECT_EQ(fields(*decoded), fields(request));
+  }
 
   RCMediaProbe probe{.playable = true, .duration = std::nan(""), .containerName = "wav"};
   probe.titleItems = {{"Walk", ""}, {"Spaziergang", "ger"}};
@@ -121,63 +116,51 @@ TEST(MediaProtocolTest, RequestsAndRepliesSurviveTheTrip) {
 }
 
 TEST(MediaProtocolTest, MalformedMessagesAreErrorValues) {
-  for (const char* reply : {
-           "",
-           "[]",
-           "not json",
-           "{\"id\":1}",
-           "{\"id\":-1,\"result\":{}}",
-           "{\"id\":\"1\",\"result\":{}}",
-           "{\"id\":1,\"progress\":\"half\"}",
-           "{\"id\":1,\"result\":[]}",
-           "{\"id\":1,\"result\":{\"playable\":1}}",
-           "{\"id\":1,\"result\":{\"playable\":true,\"duration\":-1,\"container\":\"\","
-           "\"titles\":[],\"created\":null}}",
-           "{\"id\":1,\"result\":{\"playable\":true,\"duration\":1,\"container\":\"\","
-           "\"titles\":[1],\"created\":null}}",
-           "{\"id\":1,\"result\":{\"playable\":true,\"duration\":1,\"container\":\"\","
-           "\"titles\":[],\"created\":1e300}}",
-           "{\"id\":1,\"error\":{\"domain\":\"\",\"code\":1,\"message\":\"\"}}",
-           "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1.5,\"message\":\"\"}}",
-           "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1,\"message\":\"\","
-           "\"underlying\":7}}",
-           "{\"id\":1,\"error\":{\"domain\":\"d\",\"code\":1,\"message\":\"\","
-           "\"underlying\":{\"domain\":\"d\",\"code\":1,\"message\":\"\",\"underlying\":"
-           "{\"domain\":\"d\",\"code\":1,\"message\":\"\"}}}}",
-           "{\"id\":1,\"item\":[]}",
-           "{\"id\":1,\"item\":{\"result\":{}}}",
-           "{\"id\":1,\"item\":{\"index\":-1,\"error\":{\"domain\":\"d\",\"code\":1,"
-           "\"message\":\"\"}}}",
-           "{\"id\":1,\"item\":{\"index\":64,\"error\":{\"domain\":\"d\",\"code\":1,"
-           "\"message\":\"\"}}}",
-           "{\"id\":1,\"item\":{\"index\":0}}",
-           "{\"id\":1,\"item\":{\"index\":0,\"result\":{}}}",
-           "{\"id\":1,\"item\":{\"index\":0,\"result\":{\"playable\":true,\"duration\":1,"
-           "\"container\":\"\",\"titles\":[],\"created\":null},\"error\":{\"domain\":\"d\","
-           "\"code\":1,\"message\":\"\"}}}",
+  const std::string e = R"({"domain":"d","code":1,"message":""})";
+  auto probe = [](const std::string& duration, const std::string& titles,
+                  const std::string& created) {
+    return R"({"playable":true,"duration":)" + duration + R"(,"container":"","titles":)" + titles +
+           R"(,"created":)" + created + "}";
+  };
+  auto withId = [](const std::string& body) { return R"({"id":1,)" + body + "}"; };
+  // clang-format off
+  for (const std::string& reply : std::vector<std::string>{
+           "", "[]", "not json", R"({"id":1})", R"({"id":-1,"result":{}})",
+           R"({"id":"1","result":{}})", withId(R"("progress":"half")"), withId(R"("result":[])"),
+           withId(R"("result":{"playable":1})"),
+           withId(R"("result":)" + probe("-1", "[]", "null")),
+           withId(R"("result":)" + probe("1", "[1]", "null")),
+           withId(R"("result":)" + probe("1", "[]", "1e300")),
+           withId(R"("error":{"domain":"","code":1,"message":""})"),
+           withId(R"("error":{"domain":"d","code":1.5,"message":""})"),
+           withId(R"("error":{"domain":"d","code":1,"message":"","underlying":7})"),
+           // Only one level of underlying error crosses.
+           withId(R"("error":{"domain":"d","code":1,"message":"","underlying":)"
+                  R"({"domain":"d","code":1,"message":"","underlying":)" + e + "}}"),
+           withId(R"("item":[])"), withId(R"("item":{"result":{}})"),
+           withId(R"("item":{"index":-1,"error":)" + e + "}"),
+           withId(R"("item":{"index":64,"error":)" + e + "}"),
+           withId(R"("item":{"index":0})"), withId(R"("item":{"index":0,"result":{}})"),
+           withId(R"("item":{"index":0,"result":)" + probe("1", "[]", "null") +
+                  R"(,"error":)" + e + "}"),
        }) {
+    // clang-format on
     auto decoded = RCMediaDecodeReply(reply);
-    EXPECT_FALSE(decoded) << reply;
-    if (!decoded) {
-      EXPECT_EQ(decoded.error(), RCMediaError(RCMediaErrorCodeWorkerFailed, ""));
-    }
+    EXPECT_TRUE(!decoded && decoded.error() == RCMediaError(RCMediaErrorCodeWorkerFailed, ""))
+        << reply;
   }
-  std::string tooMany = "{\"id\":1,\"job\":\"probeMany\",\"urls\":[\"file:///a\"";
-  for (std::size_t i = 1; i <= kRCMediaMaxProbeBatch; ++i) tooMany += ",\"file:///a\"";
-  tooMany += "]}";
+  std::string tooMany = R"("job":"probeMany","urls":["file:///a")";
+  for (std::size_t i = 1; i <= kRCMediaMaxProbeBatch; ++i) tooMany += R"(,"file:///a")";
+  // clang-format off
   for (const std::string& request : std::vector<std::string>{
-           tooMany,
-           "{\"id\":1,\"job\":\"probeMany\",\"urls\":[]}",
-           "{\"id\":1,\"job\":\"probeMany\",\"urls\":\"file:///a\"}",
-           "{\"id\":1,\"job\":\"probeMany\",\"urls\":[\"file:///a\",1]}",
-           "{\"id\":1,\"job\":\"probeMany\",\"urls\":[\"/a\"]}",
-           "{\"id\":1,\"job\":\"format\",\"url\":\"file:///a\"}",
-           "{\"id\":1,\"job\":\"probe\",\"url\":\"http://host/a.m4a\"}",
-           "{\"id\":1,\"job\":\"probe\",\"url\":\"/a.m4a\"}",
-           "{\"id\":1,\"job\":\"compose\",\"url\":\"file:///a\",\"segments\":{},\"waveform\":null}",
-           "{\"id\":1,\"job\":\"waveform\",\"url\":\"file:///a\"}",
+           tooMany + "]", R"("job":"probeMany","urls":[])", R"("job":"probeMany","urls":"file:///a")",
+           R"("job":"probeMany","urls":["file:///a",1])", R"("job":"probeMany","urls":["/a"])",
+           R"("job":"format","url":"file:///a")", R"("job":"probe","url":"http://host/a.m4a")",
+           R"("job":"probe","url":"/a.m4a")", R"("job":"waveform","url":"file:///a")",
+           R"("job":"compose","url":"file:///a","segments":{},"waveform":null)",
        }) {
-    EXPECT_FALSE(RCMediaDecodeRequest(request)) << request;
+    // clang-format on
+    EXPECT_FALSE(RCMediaDecodeRequest(withId(request))) << request;
   }
 }
 
