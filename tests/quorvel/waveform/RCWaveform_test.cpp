@@ -25,7 +25,7 @@ namespace fs = std::filesystem;
 
 // Little-endian 32-bit words, then 16-bit values.
 std::vector<std::uint8_t> le(std::initializer_list<std::int64_t> words,
-                             std::initializer_list<int> values = {}) {
+                             const std::vector<int>& values = {}) {
   std::vector<std::uint8_t> out;
   for (std::int64_t w : words)
     for (int s = 0; s < 32; s += 8) out.push_back(std::uint8_t(std::uint64_t(w) >> s));
@@ -38,36 +38,26 @@ TEST(RCWaveformFileTest, ReadsHandMadeFilesOfEveryVariant) {
     const char* what;
     std::vector<std::uint8_t> bytes;
     int sampleRate, channels, bits;
-    std::vector<std::int16_t> data;
+    std::vector<int> data;
     bool reencodes;  // to the same bytes: version 1 is written as version 2
   };
-  auto eightBit = le({2, 1, 8000, 64, 1, 1});  // flag bit 0
+  // Values cover sign and byte order; the 8-bit variant is flag bit 0.
+  const std::vector<int> signs = {-32768, 32767, -2, 258, -1, 0, 0, 1};
+  auto eightBit = le({2, 1, 8000, 64, 1, 1});
   eightBit.insert(eightBit.end(), {0x80, 0x7f});
+  // clang-format off
   for (const Case& c : std::vector<Case>{
-           // Values cover sign and byte order.
-           {"v2",
-            le({2, 0, 44100, 256, 2, 2}, {-32768, 32767, -2, 258, -1, 0, 0, 1}),
-            44100,
-            2,
-            16,
-            {-32768, 32767, -2, 258, -1, 0, 0, 1},
-            true},
-           {"8-bit", eightBit, 8000, 1, 8, {-128, 127}, true},
-           {"v1, no channel count",
-            le({1, 0, 48000, 512, 1}, {-5, 5}),
-            48000,
-            1,
-            16,
-            {-5, 5},
-            false},
-           {"empty", le({2, 0, 44100, 256, 0, 1}), 44100, 1, 16, {}, true},
+           {"v2",         le({2, 0, 44100, 256, 2, 2}, signs), 44100, 2, 16, signs,       true},
+           {"8-bit",      eightBit,                            8000,  1, 8,  {-128, 127}, true},
+           {"v1, no channels",le({1, 0, 48000, 512, 1}, {-5, 5}),  48000, 1, 16, {-5, 5},     false},
+           {"empty",      le({2, 0, 44100, 256, 0, 1}),        44100, 1, 16, {},          true},
        }) {
+    // clang-format on
     SCOPED_TRACE(c.what);
     auto parsed = RCDecodeWaveformFile(c.bytes);
     ASSERT_TRUE(parsed) << parsed.error();
-    EXPECT_EQ(parsed->sampleRate(), c.sampleRate);
-    EXPECT_EQ(parsed->channels(), c.channels);
-    EXPECT_EQ(parsed->bits(), c.bits);
+    EXPECT_EQ(std::tuple(parsed->sampleRate(), parsed->channels(), parsed->bits()),
+              std::tuple(c.sampleRate, c.channels, c.bits));
     EXPECT_TRUE(std::ranges::equal(parsed->data(), c.data));
     if (c.reencodes) {
       EXPECT_EQ(RCEncodeWaveformFile(*parsed), std::string(c.bytes.begin(), c.bytes.end()));
