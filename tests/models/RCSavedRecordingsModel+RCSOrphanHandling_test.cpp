@@ -13,7 +13,7 @@
 
 #include <algorithm>
 #include <cstdlib>
-#include <map>
+#include <set>
 
 #include "Models/RCPathOrder.h"
 #include "Quorvel/composition/RCCompositionEditor.h"
@@ -69,11 +69,8 @@ class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
     return model_;
   }
   void tone(const std::string& name, double seconds, double frequency = 440) {
-    testing::ToneOptions options;
-    options.seconds = seconds;
-    options.frequencyHz = frequency;
-    options.format = fs::path(name).extension().string().substr(1);
-    ASSERT_TRUE(testing::writeTone(recordingsPath(name), options));
+    const std::string format = fs::path(name).extension().string().substr(1);
+    ASSERT_TRUE(testing::writeTone(recordingsPath(name), seconds, format, 44100, 1, frequency));
   }
   void copy(const std::string& from, const std::string& to) {
     fs::copy_file(recordingsPath(from), recordingsPath(to));
@@ -91,18 +88,17 @@ class OrphanHandlingTest : public testing::RecordingsDirectoryTest {
     handling.performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs(inUse);
     return handling.statistics();
   }
-  // File name -> title of every database recording.
-  std::map<std::string, std::string> titles() {
-    std::map<std::string, std::string> found;
+  // The file names of the database's recordings.
+  std::set<std::string> recorded() {
+    std::set<std::string> found;
     EXPECT_TRUE(model()->enumerateExistingRecordingsWithBlock([&](const auto& recording, bool&) {
-      found[recording->url() ? recording->url()->lastPathComponent() : ""] =
-          recording->customLabel();
+      found.insert(recording->url() ? recording->url()->lastPathComponent() : "");
     }));
     return found;
   }
   bool present(const std::string& name) const { return fs::exists(recordingsPath(name)); }
-  std::size_t linesContaining(const std::string& text) {
-    return std::ranges::count_if(logLines(), [&](const auto& line) { return line.contains(text); });
+  void expectPresent(std::initializer_list<std::string> names, bool there = true) {
+    for (const std::string& name : names) EXPECT_EQ(present(name), there) << name;
   }
   // Makes every database recording an orphan: a new, empty database.
   void forgetDatabase() {
@@ -167,23 +163,17 @@ TEST_F(OrphanHandlingTest, BareAssetsKeepOneOfEachAndDigestOnlySizeCollisions) {
   auto statistics = run();
 
   EXPECT_EQ(engine->batches, (std::vector<std::vector<std::string>>{{"Noise.m4a", "Unique.m4a"}}));
-  std::map<std::string, std::string> recorded = titles();
-  for (const char* stays :
-       {"Kept.m4a", "Same size.m4a", "Recording.m4a", "9.wav", "12.flac", "Unique.m4a"}) {
-    EXPECT_TRUE(present(stays)) << stays;
-    EXPECT_TRUE(recorded.contains(stays)) << stays;
-  }
-  EXPECT_EQ(recorded.size(), 6u);
-  for (const char* goes :
-       {"Copy of kept.m4a", "Recording 2.m4a", "10.wav", "13.flac", "Empty.m4a", "Noise.m4a"}) {
-    EXPECT_FALSE(present(goes)) << goes;
-  }
-  for (const char* untouched : {"Upper.M4A", "Other.mp3", "Folder.m4a"})
-    EXPECT_TRUE(present(untouched)) << untouched;
-  EXPECT_EQ(linesContaining("orphanPath = Copy of kept.m4a matches existing file = Kept.m4a"), 1u);
-  EXPECT_EQ(linesContaining("orphanPath = Empty.m4a matches"), 0u);
-  EXPECT_EQ(linesContaining("'Empty.m4a' already has a duplicate"), 1u);
-  EXPECT_EQ(linesContaining("'Noise.m4a' unable to load AVURLAsset"), 1u);
+  expectPresent({"Kept.m4a", "Same size.m4a", "Recording.m4a", "9.wav", "12.flac", "Unique.m4a"});
+  EXPECT_EQ(recorded(), (std::set<std::string>{"Kept.m4a", "Same size.m4a", "Recording.m4a",
+                                               "9.wav", "12.flac", "Unique.m4a"}));
+  expectPresent(
+      {"Copy of kept.m4a", "Recording 2.m4a", "10.wav", "13.flac", "Empty.m4a", "Noise.m4a"},
+      false);
+  expectPresent({"Upper.M4A", "Other.mp3", "Folder.m4a"});
+  EXPECT_EQ(log_.count("orphanPath = Copy of kept.m4a matches existing file = Kept.m4a"), 1u);
+  EXPECT_EQ(log_.count("orphanPath = Empty.m4a matches"), 0u);
+  EXPECT_EQ(log_.count("'Empty.m4a' already has a duplicate"), 1u);
+  EXPECT_EQ(log_.count("'Noise.m4a' unable to load AVURLAsset"), 1u);
   // Kept, its copy and the changed copy; each identical pair; nothing else.
   EXPECT_EQ(statistics.filesDigested, 9u);
   EXPECT_EQ(statistics.assetsProbed, 6u);  // the five unique orphans and Noise
@@ -210,7 +200,7 @@ TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
        platform::URL::fileURLWithPath((root_ / "Stray.m4a").string()),
        platform::URL::fileURLWithPath((root_ / "Gone" / "Stray.m4a").string())});
 
-  EXPECT_EQ(titles().size(), 1u);
+  EXPECT_EQ(recorded().size(), 1u);
   auto stray =
       model()->recordingWithURL(platform::URL::fileURLWithPath(recordingsPath("Stray.m4a")));
   ASSERT_TRUE(stray && *stray);
@@ -219,12 +209,10 @@ TEST_F(OrphanHandlingTest, CompositionBundlesAreRecoveredRemovedOrLeftAlone) {
   ASSERT_TRUE(recovered) << recovered.error();
   EXPECT_EQ((*recovered)->savedRecordingURI(), (*stray)->URIRepresentation());
   EXPECT_FALSE(present("Hollow.composition"));
-  for (const char* stays : {"Walk.composition", "Fresh.composition", "Broken.composition",
-                            "Lower.COMPOSITION", "Stray.composition"}) {
-    EXPECT_TRUE(present(stays)) << stays;
-  }
-  EXPECT_EQ(linesContaining("Leaving composition (Broken.composition) alone"), 1u);
-  EXPECT_EQ(linesContaining("(Walk.composition)"), 0u);
+  expectPresent({"Walk.composition", "Fresh.composition", "Broken.composition", "Lower.COMPOSITION",
+                 "Stray.composition"});
+  EXPECT_EQ(log_.count("Leaving composition (Broken.composition) alone"), 1u);
+  EXPECT_EQ(log_.count("(Walk.composition)"), 0u);
 }
 
 // What must survive: a database recording named through another spelling of
@@ -251,14 +239,12 @@ TEST_F(OrphanHandlingTest, NeverDeletesWhatItCouldNotProveOrphaned) {
 
   run();
 
-  for (const char* stays : {"Only.m4a", "Linked.m4a", "Flaky.m4a", ".New.m4a.abcdefgh.tmp"})
-    EXPECT_TRUE(present(stays)) << stays;
-  EXPECT_FALSE(present(".Old.m4a.abcdefgh.tmp"));
+  expectPresent({"Only.m4a", "Linked.m4a", "Flaky.m4a", ".New.m4a.abcdefgh.tmp"});
   // The copy of the file that could not be examined still duplicates it.
-  EXPECT_FALSE(present("Flaky copy.m4a"));
-  EXPECT_EQ(titles().size(), 1u);
-  EXPECT_EQ(linesContaining("'Only.m4a'"), 0u);
-  EXPECT_EQ(linesContaining("'Flaky.m4a' could not be examined"), 1u);
+  expectPresent({".Old.m4a.abcdefgh.tmp", "Flaky copy.m4a"}, false);
+  EXPECT_EQ(recorded().size(), 1u);
+  EXPECT_EQ(log_.count("'Only.m4a'"), 0u);
+  EXPECT_EQ(log_.count("'Flaky.m4a' could not be examined"), 1u);
 }
 
 // What the run finds open, changing, or no file of its own stays, each with
@@ -273,9 +259,7 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
   tone("Kept.m4a", 1.0);
   testing::writeFile(recordingsPath("Target.m4a"), std::string(3000, 't'));
   fs::create_symlink(recordingsPath("Target.m4a"), recordingsPath("Member.m4a"));
-  testing::ToneOptions outside;
-  outside.frequencyHz = 660;
-  ASSERT_TRUE(testing::writeTone((root_ / "outside.m4a").string(), outside));
+  ASSERT_TRUE(testing::writeTone((root_ / "outside.m4a").string(), {.frequencyHz = 660}));
   fs::create_symlink(root_ / "outside.m4a", recordingsPath("Out.m4a"));
   fs::copy_file(root_ / "outside.m4a", recordingsPath("Outside copy.m4a"));
   for (const char* name : {"Kept.m4a", "Member.m4a", "Out.m4a"}) insert(name);
@@ -334,11 +318,11 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
   };
   for (const Row& row : rows) {
     EXPECT_EQ(present(row.name), row.stays) << row.name;
-    EXPECT_EQ(linesContaining(row.line), 1u) << row.line;
+    EXPECT_EQ(log_.count(row.line), 1u) << row.line;
   }
-  EXPECT_EQ(linesContaining("'Null.m4a' alone: it is not a regular file"), device ? 1u : 0u);
+  EXPECT_EQ(log_.count("'Null.m4a' alone: it is not a regular file"), device ? 1u : 0u);
   EXPECT_TRUE(fs::exists(root_ / "outside.m4a"));
-  EXPECT_EQ(linesContaining("matches existing file = Noise A.m4a"), 0u);
+  EXPECT_EQ(log_.count("matches existing file = Noise A.m4a"), 0u);
 
   // Once the writer is done, the next run deletes what it left unplayable.
   ::close(writer);
@@ -351,10 +335,10 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
 // used only without a title; a missing file changes nothing.
 TEST_F(OrphanHandlingTest, RecoveredTitlesAndDatesComeFromTheFile) {
   const auto created = platform::Date::fromISO8601("2020-01-02T03:04:05Z");
-  testing::ToneOptions options;
-  options.metadata = {{"creation_time", "2020-01-02T03:04:05Z"}};
-  for (const char* name : {"Tagged.m4a", "Single.m4a"})
-    ASSERT_TRUE(testing::writeTone(recordingsPath(name), options));
+  for (const char* name : {"Tagged.m4a", "Single.m4a"}) {
+    ASSERT_TRUE(testing::writeTone(recordingsPath(name),
+                                   {.metadata = {{"creation_time", "2020-01-02T03:04:05Z"}}}));
+  }
   auto engine = RCMediaEngine::current();
   auto url = [&](const char* name) { return platform::URL::fileURLWithPath(recordingsPath(name)); };
   ASSERT_TRUE(engine->writeTitle(url("Tagged.m4a"), "Walk", "eng"));
