@@ -131,38 +131,31 @@ TEST_F(CompositionTest, BundlesThatMustNotLoadAreRefusedLoggedAndLeftUntouched) 
   const std::string wrongTypes =
       R"({"formatVersion":1,"composedAVURL":"WrongTypes.m4a","composedDuration":"1",)"
       R"("savedRecordingURI":null,"fragments":[]})";
+  auto withFragment = [&](const char* composed, auto&& make) {
+    return [&, composed, make](const fs::path& b) {
+      writeFile(b / "manifest.json", manifestText(composed, "f.m4a"));
+      make(b / "f.m4a");
+    };
+  };
+  // clang-format off
   for (const Case& c : std::vector<Case>{
            {"NotJSON", "{{{", {}, "not JSON"},
            {"WrongTypes", wrongTypes, {}, "composedDuration is not a number"},
-           {"NoManifest", "", [](const fs::path& b) { fs::create_directories(b); },
-            "manifest.json"},
-           {"OtherRecording",
-            manifestText("Someone Else.m4a", "f.m4a"),
-            {},
+           {"NoManifest", "", [](const fs::path& b) { fs::create_directories(b); }, "manifest.json"},
+           {"OtherRecording", manifestText("Someone Else.m4a", "f.m4a"), {},
             "not the audio file of this bundle"},
-           {"LinkedFragment", "",
-            [&](const fs::path& b) {
-              writeFile(b / "manifest.json", manifestText("LinkedFragment.m4a", "f.m4a"));
-              fs::create_symlink(secret, b / "f.m4a");
-            },
-            "symbolic link"},
-           {"EscapingFragment",
-            manifestText("EscapingFragment.m4a", "../../outside/secret.m4a"),
-            {},
+           {"LinkedFragment", "", withFragment("LinkedFragment.m4a",
+                [&](const fs::path& f) { fs::create_symlink(secret, f); }), "symbolic link"},
+           {"EscapingFragment", manifestText("EscapingFragment.m4a", "../../outside/secret.m4a"), {},
             "not a plain file name"},
-           {"AbsoluteFragment",
-            manifestText("AbsoluteFragment.m4a", secret.string()),
-            {},
+           {"AbsoluteFragment", manifestText("AbsoluteFragment.m4a", secret.string()), {},
             "not a plain file name"},
-           {"DirectoryFragment", "",
-            [&](const fs::path& b) {
-              writeFile(b / "manifest.json", manifestText("DirectoryFragment.m4a", "f.m4a"));
-              fs::create_directories(b / "f.m4a");
-            },
-            "not a regular file"},
+           {"DirectoryFragment", "", withFragment("DirectoryFragment.m4a",
+                [](const fs::path& f) { fs::create_directories(f); }), "not a regular file"},
            {"LinkedManifest", "", linkManifest, "manifest.json"},
            {"LinkedBundle", "", linkBundle, "symbolic link"},
        }) {
+    // clang-format on
     SCOPED_TRACE(c.name);
     const fs::path bundle = recordings_ / (c.name + ".composition");
     c.make ? c.make(bundle) : writeFile(bundle / "manifest.json", c.manifest);
