@@ -39,6 +39,13 @@ std::vector<std::shared_ptr<RCSavedRecording>> allRecordings(RCSavedRecordingsMo
   return recordings;
 }
 
+std::set<std::string> fileNames(RCSavedRecordingsModel& model) {
+  std::set<std::string> names;
+  for (const auto& recording : allRecordings(model))
+    names.insert(recording->url()->lastPathComponent());
+  return names;
+}
+
 using RecordingsModelTest = RecordingsDirectoryTest;
 
 TEST_F(RecordingsModelTest, DirectoryComesFromSettingThenEnvironmentThenXDGThenHomeAndIsCreated) {
@@ -224,11 +231,7 @@ TEST_F(RecordingsModelTest, AWriterHoldingTheLockDelaysButDoesNotLoseAnInsert) {
   writer.join();
   sqlite3_close(other);
   EXPECT_FALSE(model->hasChanges());
-  std::set<std::string> titles;
-  for (const auto& recording : allRecordings(*openModel(recordings_))) {
-    titles.insert(recording->url()->lastPathComponent());
-  }
-  EXPECT_EQ(titles, (std::set<std::string>{"held.m4a", "waiting.m4a"}));
+  EXPECT_EQ(fileNames(*openModel(recordings_)), (std::set<std::string>{"held.m4a", "waiting.m4a"}));
 }
 
 TEST_F(RecordingsModelTest, TwoProcessesInsertingAtOnceBothLand) {
@@ -268,11 +271,9 @@ TEST_F(RecordingsModelTest, TwoProcessesInsertingAtOnceBothLand) {
   ASSERT_EQ(::waitpid(child, &status, 0), child);
   ASSERT_TRUE(WIFEXITED(status));
   EXPECT_EQ(WEXITSTATUS(status), 0);
-  std::set<std::string> names;
-  for (const auto& recording : allRecordings(*model)) names.insert(recording->customLabel());
+  const auto names = fileNames(*model);
   EXPECT_EQ(names.size(), 2u * kEach);
-  EXPECT_TRUE(names.contains("child 149"));
-  EXPECT_TRUE(names.contains("parent 149"));
+  EXPECT_TRUE(names.contains("child 149.m4a") && names.contains("parent 149.m4a"));
 }
 
 }  // namespace
