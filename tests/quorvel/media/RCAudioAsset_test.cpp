@@ -104,10 +104,9 @@ TEST_F(RCAudioAssetTest, TitleItemsAndTheCaptureDateAreTheFilesOwn) {
   };
   for (const Case& c : std::vector<Case>{
            {"one.m4a", {{"Bonjour", "fra"}}, 0, nullptr},
-           {"many.m4a",
-            {{"Plain", ""}, {"Hallo", "deu"}, {"Hello", "eng"}},
-            1,
-            "2021-06-07T08:09:10.000Z"},
+           // clang-format off
+           {"many.m4a", {{"Plain", ""}, {"Hallo", "deu"}, {"Hello", "eng"}}, 1, "2021-06-07T08:09:10.000Z"},
+           // clang-format on
            {"cli.flac", {{"Hallo", "deu"}, {"Servus", "ger"}, {"Plain", ""}}, 2, nullptr},
            {"bare.wav", {}, 0, nullptr},
        }) {

@@ -264,10 +264,7 @@ TEST_F(ComposerTest, BadInputFailsWithoutTouchingTheDestination) {
            {"missing fragment", {{url("good.m4a"), 0, 1}, {url("gone.m4a"), 0, 1}}, old, none},
            {"text renamed", {{url("good.m4a"), 0, 1}, {url("text.m4a"), 0, 1}}, old, 1},
            {"truncated data", {{url("good.wav"), 0, 1}, {url("cut.wav"), 0, 2}}, old, 1},
-           {"truncated audio (copy)",
-            {{url("good.m4a"), 0, 1}, {url("cutdata.m4a"), 0, 2}},
-            old,
-            1},
+           {"truncated audio", {{url("good.m4a"), 0, 1}, {url("cutdata.m4a"), 0, 2}}, old, 1},
            {"movie header cut off", {{url("cut.m4a"), 0, 1}, {url("good.m4a"), 0, 1}}, old, 0},
            {"range past the end (copy)", {{url("good.m4a"), 0.5, 1.5}}, old, 0},
            {"range past the end (re-encode)", {{url("good.wav"), 0, 2}}, old, 0},
@@ -290,8 +287,7 @@ TEST_F(ComposerTest, BadInputFailsWithoutTouchingTheDestination) {
       EXPECT_FALSE(RCIsAudioDataError(status.error())) << status.error();
     }
     EXPECT_EQ(testing::readFile(path("old.m4a")), before);
-    EXPECT_FALSE(fs::exists(path("old.waveform")));
-    EXPECT_FALSE(fs::exists(path("out.mp3")));
+    EXPECT_FALSE(fs::exists(path("old.waveform")) || fs::exists(path("out.mp3")));
     EXPECT_TRUE(hiddenFiles().empty()) << hiddenFiles().front();
   }
   EXPECT_TRUE(logged("ERROR: Composing old.m4a failed: "));
