@@ -23,6 +23,14 @@ struct XmlMethod {
   std::string in, out;
   std::vector<std::string> inNames, outNames;
   bool noReply = false;
+  bool operator==(const XmlMethod&) const = default;
+  friend std::ostream& operator<<(std::ostream& out, const XmlMethod& m) {
+    out << m.name << '(' << m.in;
+    for (const auto& name : m.inNames) out << ' ' << name;
+    out << ") -> (" << m.out;
+    for (const auto& name : m.outNames) out << ' ' << name;
+    return out << ')' << (m.noReply ? " no reply" : "");
+  }
 };
 
 std::vector<XmlMethod> methodsInXML(const std::string& xml, std::vector<std::string>& signals) {
@@ -68,23 +76,17 @@ TEST(ServiceInterfaceTest, PublishedInterfacesMatchThePackagedXML) {
     auto on = [&](const std::string& declaredOn) {
       return (declaredOn.empty() ? published.name : declaredOn) == interface;
     };
-    std::vector<platform::MethodDescription> methods;
-    for (const auto& method : published.methods)
-      if (on(method.interface)) methods.push_back(method);
+    std::vector<XmlMethod> methods;
+    for (const auto& m : published.methods) {
+      if (on(m.interface))
+        methods.push_back(
+            {m.name, m.inputSignature, m.outputSignature, m.inputNames, m.outputNames, m.noReply});
+    }
     std::vector<std::string> publishedSignals;
     for (const auto& signal : published.signals)
       if (on(signal.interface)) publishedSignals.push_back(signal.name);
-    ASSERT_EQ(documented.size(), methodCount);
-    ASSERT_EQ(methods.size(), documented.size());
-    for (std::size_t i = 0; i < documented.size(); ++i) {
-      SCOPED_TRACE(documented[i].name);
-      EXPECT_EQ(methods[i].name, documented[i].name);
-      EXPECT_EQ(methods[i].inputSignature, documented[i].in);
-      EXPECT_EQ(methods[i].outputSignature, documented[i].out);
-      EXPECT_EQ(methods[i].inputNames, documented[i].inNames);
-      EXPECT_EQ(methods[i].outputNames, documented[i].outNames);
-      EXPECT_EQ(methods[i].noReply, documented[i].noReply);
-    }
+    EXPECT_EQ(documented.size(), methodCount);
+    EXPECT_EQ(methods, documented);
     EXPECT_EQ(signals, publishedSignals);
     EXPECT_NE(xml.find("interface name=\"" + interface + "\""), std::string::npos);
     EXPECT_NE(xml.find(RCSSavedRecordingServiceObjectPath), std::string::npos);
