@@ -66,23 +66,18 @@ double toneAt(const DecodedPCM& pcm, double from, double to) {
 // otherwise; either way each used range sounds in its place, the length is
 // what was asked (give or take a frame per join) and the container says so.
 TEST_F(ComposerTest, ComposesAACByCopyWhenTheFragmentsMatchAndByReencodingOtherwise) {
-  for (const auto& [name, seconds, format, rate, channels, hz] :
-       {std::tuple{"a.m4a", 1.0, "m4a", 44100, 1, 300},
-        {"b.m4a", 1.5, "m4a", 44100, 1, 600},
-        {"c.m4a", 0.7, "m4a", 44100, 1, 1200},
-        {"s1.m4a", 2.0, "m4a", 44100, 2, 400},
-        {"s2.m4a", 2.0, "m4a", 44100, 2, 800},
-        {"x.flac", 1.0, "flac", 48000, 2, 600},
-        {"x.wav", 1.0, "wav", 22050, 1, 900},
-        // Same codec, other rate: also not copyable.
-        {"x.m4a", 1.0, "m4a", 32000, 1, 1200},
-        {"rec.m4a", 1.0, "m4a", 44100, 1, 300}}) {
+  // clang-format off
+  for (const auto& [name, seconds, format, rate, channels, hz] : {
+           std::tuple{"a.m4a", 1.0, "m4a", 44100, 1, 300}, {"b.m4a", 1.5, "m4a", 44100, 1, 600},
+           {"c.m4a", 0.7, "m4a", 44100, 1, 1200},          {"rec.m4a", 1.0, "m4a", 44100, 1, 300},
+           {"s1.m4a", 2.0, "m4a", 44100, 2, 400},          {"s2.m4a", 2.0, "m4a", 44100, 2, 800},
+           {"x.flac", 1.0, "flac", 48000, 2, 600},         {"x.wav", 1.0, "wav", 22050, 1, 900},
+           {"x.m4a", 1.0, "m4a", 32000, 1, 1200} /* same codec, other rate: not copyable */}) {
+    // clang-format on
     ASSERT_TRUE(writeTone(path(name), seconds, format, rate, channels, hz));
   }
-  ASSERT_EQ(std::system(("ffmpeg -v error -y -f lavfi -i 'sine=f=600:d=1:r=44100' -c:a aac '" +
-                         path("cli.m4a") + "'")
-                            .c_str()),
-            0);
+  const std::string cli = "ffmpeg -v error -y -f lavfi -i 'sine=f=600:d=1:r=44100' -c:a aac '";
+  ASSERT_EQ(std::system((cli + path("cli.m4a") + "'").c_str()), 0);
   struct Section {
     double from, to, hz, tolerance;
   };
@@ -110,13 +105,12 @@ TEST_F(ComposerTest, ComposesAACByCopyWhenTheFragmentsMatchAndByReencodingOtherw
             {{url("s1.m4a"), 0.5, 0.8}, {url("s2.m4a"), 1.1, 0.6}, {url("s1.m4a"), 1.5, 0.5}},
             {"stream copy", 2, 1.9 + 2 * f - 1e-6, 1.9 + 7 * f, 2},
             {{0.05, 0.75, 400, 4}, {0.9, 1.35, 800, 6}, {1.5, 1.9, 400, 6}}},
+           // clang-format off
            {"mixed.m4a",
-            {{url("a.m4a"), 0.0, 1.0},
-             {url("x.flac"), 0.25, 0.5},
-             {url("x.wav"), 0.0, 1.0},
-             {url("x.m4a"), 0.5, 0.5}},
+            {{url("a.m4a"), 0.0, 1.0}, {url("x.flac"), 0.25, 0.5}, {url("x.wav"), 0.0, 1.0}, {url("x.m4a"), 0.5, 0.5}},
             {"re-encoding", 1, 3.0 - f - 0.002, 3.0 + f + 0.002, 3},
             {{0.1, 0.9, 300, 3}, {1.1, 1.4, 600, 6}, {1.6, 2.4, 900, 4}, {2.6, 2.95, 1200, 8}}},
+           // clang-format on
            // The composed file is itself the first fragment, and the FFmpeg
            // tool made the second.
            {"rec.m4a",
