@@ -12,7 +12,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdlib>
 #include <set>
 
 #include "Models/RCPathOrder.h"

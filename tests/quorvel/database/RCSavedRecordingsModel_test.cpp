@@ -8,7 +8,6 @@
 
 #include <fstream>
 #include <set>
-#include <sstream>
 #include <thread>
 
 #include "Quorvel/database/RCSavedRecordingsModel.h"

@@ -2,8 +2,6 @@
 // through or along a symbolic link; and atomic manifest replacement.
 #include <gtest/gtest.h>
 
-#include <fstream>
-
 #include "Quorvel/errors/RCErrors.h"
 #include "Quorvel/files/RCDurableFile.h"
 #include "Quorvel/files/RCFileConfinement.h"

@@ -5,7 +5,6 @@
 #include "QuorvelMedia/RCMP4Atoms.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
 extern "C" {
 #include <libavformat/avformat.h>
