@@ -65,12 +65,9 @@ TEST(CompositionManifestTest, RefusesEveryMalformedShapeWithAReason) {
     text.replace(text.find(from), from.size(), to);
     return manifestWith(text);
   };
-  struct Case {
-    std::string json;
-    std::string reason;
-  };
+  const std::string range = R"("contentRange":{"start":0,"duration":1})";
   // Which names are plain is the confinement test's; here, that both keys are checked.
-  for (const Case& c : std::vector<Case>{
+  for (const auto& [json, reason] : std::vector<std::pair<std::string, std::string>>{
            {"", "not JSON"},
            {"[]", "not a JSON object"},
            {manifestWith(fragment, "\"W.m4a\"", "2"), "formatVersion 2"},
@@ -80,26 +77,22 @@ TEST(CompositionManifestTest, RefusesEveryMalformedShapeWithAReason) {
            {manifestWith(fragment, "7"), "not a string"},
            {R"({"formatVersion":1,"composedAVURL":"W.m4a","composedDuration":1,"fragments":[]})",
             "savedRecordingURI is missing"},
-           {replaced("\"a.m4a\"", "\"..\""), "not a plain file name"},
-           {replaced("\"a.m4a\"", "\"a.M4A\""), "capture format"},
-           {replaced("\"start\":0,\"duration\":1},\"c", "\"start\":-1,\"duration\":1},\"c"),
+           {replaced(R"("a.m4a")", R"("..")"), "not a plain file name"},
+           {replaced(R"("a.m4a")", R"("a.M4A")"), "capture format"},
+           {replaced(R"("start":0,"duration":1},"c)", R"("start":-1,"duration":1},"c)"),
             "non-negative"},
-           {replaced("\"composed\":false", "\"composed\":0"), "not true or false"},
-           {replaced(",\"composed\":false", ""), "composed is missing"},
-           {replaced("\"contentRange\":{\"start\":0,\"duration\":1}", "\"contentRange\":[0,1]"),
-            "not an object"},
-           {replaced("\"contentRange\":{\"start\":0,\"duration\":1}",
-                     "\"contentRange\":{\"start\":0}"),
-            "contentRange.duration is missing"},
-           {replaced("\"duration\":1},\"composed\"", "\"duration\":1e999},\"composed\""),
-            "not JSON"},
+           {replaced(R"("composed":false)", R"("composed":0)"), "not true or false"},
+           {replaced(R"(,"composed":false)", ""), "composed is missing"},
+           {replaced(range, R"("contentRange":[0,1])"), "not an object"},
+           {replaced(range, R"("contentRange":{"start":0})"), "contentRange.duration is missing"},
+           {replaced(R"("duration":1},"composed")", R"("duration":1e999},"composed")"), "not JSON"},
            {manifestWith("7"), "fragments[0] is not an object"},
        }) {
-    auto parsed = RCCompositionManifest::parse(c.json);
-    ASSERT_FALSE(parsed) << c.json;
+    auto parsed = RCCompositionManifest::parse(json);
+    ASSERT_FALSE(parsed) << json;
     EXPECT_EQ(parsed.error().code(), RCErrorCodeInvalidManifest);
-    EXPECT_NE(parsed.error().localizedDescription().find(c.reason), std::string::npos)
-        << c.json << " -> " << parsed.error().localizedDescription();
+    EXPECT_NE(parsed.error().localizedDescription().find(reason), std::string::npos)
+        << json << " -> " << parsed.error().localizedDescription();
   }
   EXPECT_FALSE(RCCompositionManifest::parse(std::string(5 * 1024 * 1024, ' ')));
 }
