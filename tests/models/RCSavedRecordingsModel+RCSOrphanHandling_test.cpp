@@ -295,29 +295,25 @@ TEST_F(OrphanHandlingTest, LeavesWhatIsOpenChangingOrNotAFileOfItsOwnAndSaysWhy)
 
   run();
 
-  struct Row {
-    const char* name;
-    bool stays;
-    const char* line;  // logged once
-  };
-  const Row rows[] = {
-      {"Pipe.m4a", true, "Leaving 'Pipe.m4a' alone: it is not a regular file"},
-      {"Socket.m4a", true, "Leaving 'Socket.m4a' alone: it is not a regular file"},
-      {"Folder.m4a", true, "Leaving 'Folder.m4a' alone: it is not a regular file"},
-      {"Link.m4a", true, "Leaving 'Link.m4a' alone: it is a symbolic link"},
-      {"Target.m4a", true, "Leaving 'Target.m4a' alone: it is the same file as one in use"},
-      {"Writing.m4a", true, "'Writing.m4a' is open in another process; leaving it"},
-      {"Growing.m4a", true, "'Growing.m4a' changed during the run; leaving it"},
-      {"Replaced.m4a", true, "'Replaced.m4a' changed during the run; leaving it"},
-      {"Noise A.m4a", false, "'Noise A.m4a' unable to load AVURLAsset"},
-      {"Noise B.m4a", false, "'Noise B.m4a' unable to load AVURLAsset"},
-      {"Beta.m4a", false, "orphanPath = Beta.m4a matches existing file = Alpha.m4a"},
-      {"Outside copy.m4a", false, "orphanPath = Outside copy.m4a matches existing file = Out.m4a"},
-      {"Alpha.m4a", true, "orphaned composition (Alpha.composition) with assets"},
-  };
-  for (const Row& row : rows) {
-    EXPECT_EQ(present(row.name), row.stays) << row.name;
-    EXPECT_EQ(log_.count(row.line), 1u) << row.line;
+  // The file, whether it stays, and the line logged once about it.
+  for (const auto& [name, stays, line] : std::vector<std::tuple<const char*, bool, const char*>>{
+           {"Pipe.m4a", true, "Leaving 'Pipe.m4a' alone: it is not a regular file"},
+           {"Socket.m4a", true, "Leaving 'Socket.m4a' alone: it is not a regular file"},
+           {"Folder.m4a", true, "Leaving 'Folder.m4a' alone: it is not a regular file"},
+           {"Link.m4a", true, "Leaving 'Link.m4a' alone: it is a symbolic link"},
+           {"Target.m4a", true, "Leaving 'Target.m4a' alone: it is the same file as one in use"},
+           {"Writing.m4a", true, "'Writing.m4a' is open in another process; leaving it"},
+           {"Growing.m4a", true, "'Growing.m4a' changed during the run; leaving it"},
+           {"Replaced.m4a", true, "'Replaced.m4a' changed during the run; leaving it"},
+           {"Noise A.m4a", false, "'Noise A.m4a' unable to load AVURLAsset"},
+           {"Noise B.m4a", false, "'Noise B.m4a' unable to load AVURLAsset"},
+           {"Beta.m4a", false, "orphanPath = Beta.m4a matches existing file = Alpha.m4a"},
+           {"Outside copy.m4a", false,
+            "orphanPath = Outside copy.m4a matches existing file = Out.m4a"},
+           {"Alpha.m4a", true, "orphaned composition (Alpha.composition) with assets"},
+       }) {
+    EXPECT_EQ(present(name), stays) << name;
+    EXPECT_EQ(log_.count(line), 1u) << line;
   }
   EXPECT_EQ(log_.count("'Null.m4a' alone: it is not a regular file"), device ? 1u : 0u);
   EXPECT_TRUE(fs::exists(root_ / "outside.m4a"));
