@@ -1,7 +1,7 @@
 // Finalization through the service core on real recordings: an export that
-// composes and caches the waveform first, a recording left by a vanished
-// capture client, fragments whose files are damaged, a failing media worker,
-// two spellings of one recording, and an edit whose finalization waits.
+// composes and caches the waveform first, fragments whose files are damaged,
+// a failing media worker, two spellings of one recording, and an edit whose
+// finalization waits.
 #include <gtest/gtest.h>
 
 #include <ranges>
@@ -64,17 +64,6 @@ TEST_F(FinalizationTest, AnExportAnswersOnceItsRecordingIsComposedWithItsWavefor
   EXPECT_TRUE(exists(RCWaveform::waveformURLForAVURL(editor->composedAVURL())));
   EXPECT_EQ(changeSignals(), 4u);  // handed over and answered, for each request
   EXPECT_TRUE(exporting().empty());
-}
-
-TEST_F(FinalizationTest, AVanishedCaptureClientLeavesItsRecordingFinalized) {
-  auto editor = makeRecording("Interview", {0.2});
-  ASSERT_TRUE(editor);
-  token(prepare(":1.1", "PrepareToCapture", "Interview.m4a"));
-  listener_->vanish(":1.1");
-  settle();
-  EXPECT_EQ(openSessions(), 0u);
-  EXPECT_EQ(decomposed(*editor), 0u);
-  EXPECT_TRUE(exists(RCWaveform::waveformURLForAVURL(editor->composedAVURL())));
 }
 
 // A fragment damaged after it was recorded is left out of the export and

@@ -1,11 +1,11 @@
 // The service core without a bus: start-up and its keep-alive timeline, and
 // client connections. Driven through the in-process listener and a manual
-// clock; the requests' entry checks are in ServiceLog_test.
+// clock; the requests' entry checks and the connections' ends are in
+// ServiceLog_test.
 #include <gtest/gtest.h>
 
 #include <latch>
 
-#include "quorveld/RCSAdditions.h"
 #include "tests/quorveld/ServiceFixture.h"
 
 namespace quorvel {
@@ -64,23 +64,6 @@ TEST_P(RootTimelineTest, TheRootIsHeldUntilTwoSecondsOrOneSecondAfterTheFirstPas
   EXPECT_TRUE(controller().isInTransaction());
   advance(1ms);
   EXPECT_FALSE(controller().isInTransaction());
-}
-
-TEST_F(ServiceTest, ConnectionsAreEndedByVanishingOrLosingTheBus) {
-  ASSERT_TRUE(service_->start());
-  call(":1.1", "FetchExportingCompositionAVURLs");
-  call(":1.2", "DisableOrphanHandling");
-  auto first = listener_->connection(":1.1");
-  auto second = listener_->connection(":1.2");
-  ASSERT_TRUE(first && second);
-  EXPECT_TRUE(rcs_isValid(*first));
-  listener_->vanish(":1.1");
-  drainServiceQueue();
-  EXPECT_FALSE(rcs_isValid(*first));
-  EXPECT_TRUE(rcs_isValid(*second));
-  listener_->loseBus();
-  drainServiceQueue();
-  EXPECT_FALSE(rcs_isValid(*second));
 }
 
 }  // namespace

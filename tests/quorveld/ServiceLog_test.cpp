@@ -12,7 +12,9 @@
 #include <fstream>
 
 #include "Quorvel/service/RCSSavedRecordingServiceErrors.h"
+#include "Quorvel/waveform/RCWaveform.h"
 #include "platform/NotificationCenter.h"
+#include "quorveld/RCSAdditions.h"
 #include "quorveld/RCSXPCTransaction.h"
 #include "tests/quorveld/ServiceFixture.h"
 
@@ -51,7 +53,21 @@ std::string missing(const char* connection, const char* parameter, const char* s
       connection, parameter, selector);
 }
 
-const std::string kTransaction = "[RCSXPCTransaction] ";
+// A keep-alive's debug line as it begins or ends.
+Line keepAlive(const char* verb, const char* name) {
+  return {D, fmt::format("[RCSXPCTransaction] {} XPC transaction: <RCSXPCTransaction 0x…, "
+                         "name = \"{}\">",
+                         verb, name)};
+}
+
+// How a preview token of `file` prints.
+std::string preview(const char* file, const char* identifier = "…") {
+  return fmt::format(
+      "<RCSSavedRecordingAccessToken name=preview type=1 (shared) compositionAVURL=file://…/{} "
+      "identifier={}>",
+      file, identifier);
+}
+
 const std::string kExport = "[AssetExportController] ";
 constexpr const char* kCapture = "prepareToCaptureToCompositionAVURL:accessRequestHandler:";
 
@@ -63,17 +79,16 @@ const std::vector<Scenario> kScenarios = {
        t.settle();
      },
      [] {
+       const char* startUp = "Keep-alive for SavedRecordingService initialization";
        const std::vector<Line> once = {
-           {D, kTransaction + "Activating XPC transaction: <RCSXPCTransaction 0x…, name = "
-                              "\"Keep-alive for SavedRecordingService initialization\">"},
-           {D, kTransaction + "Root XPC transaction began."},
+           keepAlive("Activating", startUp),
+           {D, "[RCSXPCTransaction] Root XPC transaction began."},
            {E,
             "[RCSavedRecordingsModel+RCSOrphanHandling] [Orphan-Handling] "
             "performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs: checking for "
             "orphaned recordings."},
-           {D, kTransaction + "Deactivating XPC transaction: <RCSXPCTransaction 0x…, name = "
-                              "\"Keep-alive for SavedRecordingService initialization\">"},
-           {D, kTransaction + "No XPC transactions remain. Ending root XPC transaction."}};
+           keepAlive("Deactivating", startUp),
+           {D, "[RCSXPCTransaction] No XPC transactions remain. Ending root XPC transaction."}};
        std::vector<Line> twice = once;
        twice.insert(twice.begin() + 2, {N, "Starting service 'org.quorvel.SavedRecordingService'"});
        twice.insert(twice.end(), once.begin(), once.end());
@@ -94,19 +109,27 @@ const std::vector<Scenario> kScenarios = {
        scheduled->endTransaction();
        t.advance(0s);
      },
-     {{D, kTransaction + "Activating XPC transaction: <… name = \"Keep-alive for tests\">"},
-      {D, kTransaction + "Deactivating XPC transaction: <… name = \"Keep-alive for tests\">"},
+     {keepAlive("Activating", "Keep-alive for tests"),
+      keepAlive("Deactivating", "Keep-alive for tests"),
       {kNever, "…never begun…"},
-      {D, kTransaction + "Activating XPC transaction: <… name = \"scheduled\">"},
-      {D, kTransaction + "Deactivating XPC transaction: <… name = \"scheduled\">"}}},
+      keepAlive("Activating", "scheduled"),
+      keepAlive("Deactivating", "scheduled")}},
 
     {"ConnectionsAreAcceptedOnceAndEndedByVanishingOrLosingTheBus",
      [](SessionTest& t) {
        t.call(":1.1", "FetchExportingCompositionAVURLs");
        t.call(":1.1", "FetchExportingCompositionAVURLs");
+       auto first = t.listener_->connection(":1.1");
+       ASSERT_TRUE(first && rcs_isValid(*first));
        t.listener_->vanish(":1.1");
        t.call(":1.2", "DisableOrphanHandling");
+       auto second = t.listener_->connection(":1.2");
+       t.drainServiceQueue();
+       EXPECT_FALSE(rcs_isValid(*first));
+       ASSERT_TRUE(second && rcs_isValid(*second));
        t.listener_->loseBus();
+       t.drainServiceQueue();
+       EXPECT_FALSE(rcs_isValid(*second));
      },
      {{N, "Listener accepted new connection <connection :1.1>"},
       {E, "Connection invalidated: <connection :1.1>"},
@@ -171,9 +194,7 @@ const std::vector<Scenario> kScenarios = {
        t.end(":1.1", granted);
        t.end(":1.1", BusValue::structure({"preview", 1, t.url("X.m4a"), "no-uuid"}));
      },
-     {{D,
-       "Ending access session: <RCSSavedRecordingAccessToken name=preview type=1 "
-       "(shared) compositionAVURL=file://…/X.m4a identifier=no-uuid>."},
+     {{D, "Ending access session: " + preview("X.m4a", "no-uuid") + "."},
       {kNever, "…cannot load the composition…"},
       {kNever, "…parameter is required…"}}},
 
@@ -187,20 +208,11 @@ const std::vector<Scenario> kScenarios = {
        t.settle();
      },
      {{D, "Received request to prepare 'A.m4a' for preview..."},
-      {D,
-       "Ending access session: <RCSSavedRecordingAccessToken name=preview type=1 "
-       "(shared) compositionAVURL=file://…/A.m4a identifier=…>."},
-      {N,
-       "Closing access session: <AssetAccessSession 0x…> "
-       "<RCSSavedRecordingAccessToken name=preview type=1 (shared) "
-       "compositionAVURL=file://…/A.m4a identifier=…>."},
+      {D, "Ending access session: " + preview("A.m4a") + "."},
+      {N, "Closing access session: <AssetAccessSession 0x…> " + preview("A.m4a") + "."},
       {N, "Scheduling orphan fragment cleanup for closing session"},
-      {N,
-       "Finally closing access session: <AssetAccessSession 0x…> "
-       "<RCSSavedRecordingAccessToken name=preview …>"},
-      {D,
-       "Ending access session: <RCSSavedRecordingAccessToken name=preview type=1 "
-       "(shared) compositionAVURL=file://…/A.m4a identifier=…>."}}},
+      {N, "Finally closing access session: <AssetAccessSession 0x…> " + preview("A.m4a")},
+      {D, "Ending access session: " + preview("A.m4a") + "."}}},
 
     // Two requests wait behind a closing session: the newest wins.
     {"DeferredRequestsAreSupersededOrReissued",
@@ -220,12 +232,19 @@ const std::vector<Scenario> kScenarios = {
        "running deferred access block for 'trimming' request -- will re-issue "
        "request"}}},
 
-    {"AVanishedClientsSessionsAreTerminated",
+    // The capture's recording is finalized all the same.
+    {"AVanishedClientsSessionsAreTerminatedAndItsCaptureFinalized",
      [](SessionTest& t) {
+       auto editor = t.makeRecording("A", {0.2});
+       ASSERT_TRUE(editor);
        t.token(t.prepare(":1.1", "PrepareToCapture", "A.m4a"));
        t.token(t.prepare(":1.1", "PrepareToPreview", "C.m4a"));
        t.listener_->vanish(":1.1");
        t.settle();
+       EXPECT_EQ(t.openSessions(), 0u);
+       EXPECT_EQ(t.decomposed(*editor), 0u);
+       EXPECT_TRUE(std::filesystem::exists(
+           RCWaveform::waveformURLForAVURL(editor->composedAVURL()).path()));
      },
      {{E, "Connection invalidated: <connection :1.1>"},
       {N, "Terminating access session … for terminated connection: <connection :1.1>"},

@@ -13,6 +13,8 @@
 
 #include <map>
 #include <memory>
+#include <numeric>
+#include <ranges>
 #include <set>
 #include <string>
 #include <thread>
@@ -53,8 +55,7 @@ struct Recorder : ListenerDelegate {
   std::vector<Delivery> deliveries;
 
   bool shouldAcceptNewConnection(Listener&, std::shared_ptr<Connection> connection) override {
-    bool refuse = false;
-    bool resume = false;
+    bool refuse = false, resume = false;
     gate.update([&] {
       offered.push_back(connection);
       connections.push_back(connection);
@@ -74,9 +75,8 @@ struct Recorder : ListenerDelegate {
     gate.update([&] { lostBus = true; });
   }
   int totalInvalidations() {
-    int total = 0;
-    for (const auto& [name, count] : invalidations) total += count;
-    return total;
+    auto counts = invalidations | std::views::values;
+    return std::accumulate(counts.begin(), counts.end(), 0);
   }
   // Echo answers at once; Hold keeps the call for the test to answer; End
   // takes a token and sends no reply.
@@ -251,6 +251,7 @@ class ListenerTest : public ::testing::Test {
 
   Recorder seen;
   Harness harness{seen.interface()};
+  const std::string peer = harness.newPeer();  // calls nothing until a test has it call
 };
 
 using Listeners = ::testing::Types<LocalHarness, BusHarness>;
@@ -265,7 +266,7 @@ TYPED_TEST_SUITE(ListenerTest, Listeners, ListenerNames);
 // A refused peer's calls are denied, and the delegate is not asked again.
 TYPED_TEST(ListenerTest, DeliversCallsWithTheirConnectionOnePerPeerOrDeniesThem) {
   auto& h = this->harness;
-  auto first = h.newPeer();
+  const std::string& first = this->peer;
   auto second = h.newPeer();
   EXPECT_EQ(h.call(first, "Echo", {"a"})().values, BusValues{"a"});
   EXPECT_EQ(h.call(first, "Echo", {"b"})().values, BusValues{"b"});
@@ -292,10 +293,9 @@ TYPED_TEST(ListenerTest, DeliversCallsWithTheirConnectionOnePerPeerOrDeniesThem)
 }
 
 TYPED_TEST(ListenerTest, AnswersOnceFromAnyThreadAndDroppedCallsAnswerWithAnError) {
-  auto peer = this->harness.newPeer();
-  auto held = this->harness.call(peer, "Hold");
-  auto dropped = this->harness.call(peer, "Hold");
-  auto malformed = this->harness.call(peer, "Hold");
+  auto held = this->harness.call(this->peer, "Hold");
+  auto dropped = this->harness.call(this->peer, "Hold");
+  auto malformed = this->harness.call(this->peer, "Hold");
   ASSERT_TRUE(this->waitForHeld(3));
 
   std::thread([call = this->takeHeld(0)]() mutable {
@@ -320,14 +320,13 @@ TYPED_TEST(ListenerTest, AnswersOnceFromAnyThreadAndDroppedCallsAnswerWithAnErro
 // Wrong calls are answered without reaching the delegate; calls without a
 // reply are delivered in order and never answered.
 TYPED_TEST(ListenerTest, WrongCallsAreAnsweredAndNoReplyCallsDeliveredInOrder) {
-  auto& h = this->harness;
-  auto peer = h.newPeer();
-  EXPECT_EQ(h.call(peer, "Echo", {std::int32_t{5}})().errorName, kBusErrorInvalidArgs);
-  EXPECT_EQ(h.call(peer, "Echo")().errorName, kBusErrorInvalidArgs);
-  EXPECT_EQ(h.call(peer, "NoSuchMethod")().errorName, kBusErrorUnknownMethod);
-  EXPECT_FALSE(h.call(peer, "End", {kToken}, /*noReply=*/true)().answered);
-  EXPECT_FALSE(h.call(peer, "Nope", {}, /*noReply=*/true)().answered);
-  EXPECT_EQ(h.call(peer, "Echo", {"after"})().values, BusValues{"after"});
+  auto call = [this](auto... arguments) { return this->harness.call(this->peer, arguments...)(); };
+  EXPECT_EQ(call("Echo", BusValues{std::int32_t{5}}).errorName, kBusErrorInvalidArgs);
+  EXPECT_EQ(call("Echo").errorName, kBusErrorInvalidArgs);
+  EXPECT_EQ(call("NoSuchMethod").errorName, kBusErrorUnknownMethod);
+  EXPECT_FALSE(call("End", BusValues{kToken}, /*noReply=*/true).answered);
+  EXPECT_FALSE(call("Nope", BusValues{}, /*noReply=*/true).answered);
+  EXPECT_EQ(call("Echo", BusValues{"after"}).values, BusValues{"after"});
 
   std::lock_guard lock(this->seen.gate.mutex());
   EXPECT_EQ(this->seen.connections.size(), 1u);
@@ -339,9 +338,8 @@ TYPED_TEST(ListenerTest, WrongCallsAreAnsweredAndNoReplyCallsDeliveredInOrder) {
 
 TYPED_TEST(ListenerTest, CallsWaitForTheConnectionToResumeAndArriveInOrder) {
   this->seen.gate.update([&] { this->seen.resumeImmediately = false; });
-  auto peer = this->harness.newPeer();
-  auto a = this->harness.call(peer, "Echo", {"1"});
-  auto b = this->harness.call(peer, "Echo", {"2"});
+  auto a = this->harness.call(this->peer, "Echo", {"1"});
+  auto b = this->harness.call(this->peer, "Echo", {"2"});
   ASSERT_TRUE(this->seen.gate.waitUntil([&] { return this->seen.connections.size() == 1; }));
   std::shared_ptr<Connection> connection;
   {
@@ -362,7 +360,7 @@ TYPED_TEST(ListenerTest, CallsWaitForTheConnectionToResumeAndArriveInOrder) {
 TYPED_TEST(ListenerTest, VanishingPeersInvalidateOnceAndLosingTheBusInvalidatesTheRest) {
   auto& h = this->harness;
   auto& seen = this->seen;
-  auto gone = h.newPeer();
+  const std::string& gone = this->peer;
   auto second = h.newPeer();
   auto third = h.newPeer();
   for (const auto& peer : {gone, second, third}) h.call(peer, "Echo", {"x"})();
@@ -398,8 +396,7 @@ TYPED_TEST(ListenerTest, VanishingPeersInvalidateOnceAndLosingTheBusInvalidatesT
 }
 
 TYPED_TEST(ListenerTest, ReleasingTheNameAndStoppingKeepHeldAnswers) {
-  auto peer = this->harness.newPeer();
-  auto held = this->harness.call(peer, "Hold");
+  auto held = this->harness.call(this->peer, "Hold");
   ASSERT_TRUE(this->waitForHeld(1));
   ASSERT_TRUE(this->harness.listener().releaseName());
   this->harness.listener().stop();
