@@ -46,7 +46,6 @@ class FinalizationTest : public SessionTest {
 
 TEST_F(FinalizationTest, AnExportAnswersOnceItsRecordingIsComposedWithItsWaveform) {
   auto editor = makeRecording("Walk", {0.3, 0.2});
-  ASSERT_TRUE(editor);
   // Held back, so the exporting set can be seen while the work is pending.
   service_->assetExportController().setMaxConcurrentOperationCountForTesting(0);
   auto exported = call(":1.1", "PrepareToExport", {url("Walk.m4a"), true});
@@ -59,9 +58,9 @@ TEST_F(FinalizationTest, AnExportAnswersOnceItsRecordingIsComposedWithItsWavefor
   advance(0s);
   EXPECT_EQ(accessType(exported), 1);
   EXPECT_EQ(accessType(second), 1);
-  EXPECT_EQ(decomposed(*editor), 0u);
-  EXPECT_TRUE(exists(editor->composedAVURL()));
-  EXPECT_TRUE(exists(RCWaveform::waveformURLForAVURL(editor->composedAVURL())));
+  EXPECT_EQ(decomposed(editor), 0u);
+  EXPECT_TRUE(exists(editor.composedAVURL()));
+  EXPECT_TRUE(exists(RCWaveform::waveformURLForAVURL(editor.composedAVURL())));
   EXPECT_EQ(changeSignals(), 4u);  // handed over and answered, for each request
   EXPECT_TRUE(exporting().empty());
 }
@@ -71,8 +70,7 @@ TEST_F(FinalizationTest, AnExportAnswersOnceItsRecordingIsComposedWithItsWavefor
 // takes it back in and the next export composes it again.
 TEST_F(FinalizationTest, ADamagedFragmentIsLeftOutOfTheExportUntilItReadsAgain) {
   auto editor = makeRecording("Damaged", {0.4, 0.2});
-  ASSERT_TRUE(editor);
-  const std::string fragment = editor->composition()->fragments()[1].AVOutputURL().path();
+  const std::string fragment = editor.composition()->fragments()[1].AVOutputURL().path();
   const std::string bytes = testing::readFile(fragment);
   damage(fragment);
   auto exportAndEnd = [&] {
@@ -82,9 +80,9 @@ TEST_F(FinalizationTest, ADamagedFragmentIsLeftOutOfTheExportUntilItReadsAgain) 
     settle();
   };
   exportAndEnd();
-  EXPECT_NEAR(composedSeconds(*editor), 0.4, 0.03);
-  EXPECT_EQ(unreadable(*editor), (std::vector<bool>{false, true}));
-  auto loaded = RCComposition::load(editor->composition()->bundleURL());
+  EXPECT_NEAR(composedSeconds(editor), 0.4, 0.03);
+  EXPECT_EQ(unreadable(editor), (std::vector<bool>{false, true}));
+  auto loaded = RCComposition::load(editor.composition()->bundleURL());
   ASSERT_TRUE(loaded);
   EXPECT_NEAR((*loaded)->manifest().composedDuration, 0.4, 0.01);
   EXPECT_TRUE(std::filesystem::exists(fragment));
@@ -92,10 +90,10 @@ TEST_F(FinalizationTest, ADamagedFragmentIsLeftOutOfTheExportUntilItReadsAgain) 
   testing::writeFile(fragment, bytes);
   end(":1.2", token(prepare(":1.2", "PrepareToPreview", "Damaged.m4a")));
   settle();
-  EXPECT_EQ(unreadable(*editor), (std::vector<bool>{false, false}));
+  EXPECT_EQ(unreadable(editor), (std::vector<bool>{false, false}));
   exportAndEnd();
-  EXPECT_NEAR(composedSeconds(*editor), 0.6, 0.03);
-  EXPECT_EQ(decomposed(*editor), 0u);
+  EXPECT_NEAR(composedSeconds(editor), 0.6, 0.03);
+  EXPECT_EQ(decomposed(editor), 0u);
   expectNothingLeft();
 }
 
@@ -127,8 +125,7 @@ TEST_F(FinalizationTest, AnExportWithNoReadableFragmentOrNoWorkerFailsAndKeepsTh
        }) {
     SCOPED_TRACE(c.title);
     auto editor = makeRecording(c.title, {0.2, 0.2});
-    ASSERT_TRUE(editor);
-    auto fragments = editor->composition()->fragments();
+    auto fragments = editor.composition()->fragments();
     for (std::size_t i = fragments.size() - c.damaged; i < fragments.size(); ++i)
       damage(fragments[i].AVOutputURL().path());
     RCMediaEngine::setCurrent(c.engine);
@@ -140,16 +137,15 @@ TEST_F(FinalizationTest, AnExportWithNoReadableFragmentOrNoWorkerFailsAndKeepsTh
                          ".m4a failed with error: Error "
                          "Domain=org.quorvel.SavedRecordingService.ErrorDomain Code=401"),
               1u);
-    EXPECT_EQ(unreadable(*editor), c.marked);
+    EXPECT_EQ(unreadable(editor), c.marked);
     for (const auto& fragment : fragments) EXPECT_TRUE(exists(fragment.AVOutputURL()));
-    EXPECT_FALSE(exists(editor->composedAVURL()));
+    EXPECT_FALSE(exists(editor.composedAVURL()));
     settle();
   }
 }
 
 TEST_F(FinalizationTest, TwoSpellingsOfOneRecordingExportTogetherWithOneCompose) {
   auto editor = makeRecording("Walk", {0.3, 0.2});
-  ASSERT_TRUE(editor);
   auto engine = std::make_shared<testing::HeldMediaEngine>();
   engine->holds = [](std::string_view job, const std::string&) { return job == "compose"; };
   RCMediaEngine::setCurrent(engine);
@@ -165,7 +161,7 @@ TEST_F(FinalizationTest, TwoSpellingsOfOneRecordingExportTogetherWithOneCompose)
   EXPECT_EQ(token(first).fields().at(2).asString(), plain);
   EXPECT_EQ(token(second).fields().at(2).asString(), dotted);
   EXPECT_EQ(engine->came(), 1);
-  EXPECT_EQ(decomposed(*editor), 0u);
+  EXPECT_EQ(decomposed(editor), 0u);
   RCUseInProcessMediaEngine();
 }
 
@@ -174,7 +170,6 @@ TEST_F(FinalizationTest, TwoSpellingsOfOneRecordingExportTogetherWithOneCompose)
 // ask for one).
 TEST_F(FinalizationTest, EndingAnEditWhoseFinalizationWaitsStartsNoSecondOne) {
   auto editor = makeRecording("Edit", {0.2});
-  ASSERT_TRUE(editor);
   auto capture = token(prepare(":1.1", "PrepareToCapture", "Edit.m4a"));
   auto held = holdServiceQueue();
   end(":1.1", capture);
@@ -188,7 +183,7 @@ TEST_F(FinalizationTest, EndingAnEditWhoseFinalizationWaitsStartsNoSecondOne) {
   settle();
   EXPECT_EQ(log_.count("Received request to schedule finalization of 'Edit.m4a'"), 2u);
   EXPECT_EQ(changeSignals() - signalsBefore, 2u);
-  EXPECT_EQ(decomposed(*editor), 0u);
+  EXPECT_EQ(decomposed(editor), 0u);
   expectNothingLeft();
 }
 

@@ -64,8 +64,8 @@ class ResponsivenessTest : public SessionTest {
 };
 
 TEST_F(ResponsivenessTest, AStuckFragmentReadHoldsOnlyItsOwnRecording) {
-  ASSERT_TRUE(makeRecording("Stuck", {0.2, 0.2}));
-  ASSERT_TRUE(makeRecording("Other", {0.2}));
+  makeRecording("Stuck", {0.2, 0.2});
+  makeRecording("Other", {0.2});
   engine_->holds = [](std::string_view job, const std::string& path) {
     return job == "probe" && path.find("/Stuck.composition/") != std::string::npos;
   };

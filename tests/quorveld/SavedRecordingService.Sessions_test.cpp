@@ -73,7 +73,7 @@ TEST_F(SessionTest, AVanishedClientTakesItsSessionsAndItsWaitingRequestWithIt) {
   gate->count_down();
   settle();
   EXPECT_FALSE(waiting->isAnswered());
-  auto inUse = onServiceQueue<std::vector<platform::URL>>(
+  auto inUse = onServiceQueue(
       [&] { return service_->_onQueue_composedAVURLsWithActiveSessionsOrScheduledWork(); });
   EXPECT_EQ(std::ranges::count(inUse, *platform::URL::fromFileURLStringOrPath(url("A.m4a"))), 2);
 
@@ -88,13 +88,12 @@ TEST_F(SessionTest, AVanishedClientTakesItsSessionsAndItsWaitingRequestWithIt) {
 
 TEST_F(SessionTest, HoldsKeepOrphanedFragmentsUntilTheLastOneIsReleased) {
   auto editor = makeRecording("Walk", {0.2});
-  ASSERT_TRUE(editor);
-  const std::filesystem::path stray = editor->composition()->bundleURL().path() + "/stray.m4a";
+  const std::filesystem::path stray = editor.composition()->bundleURL().path() + "/stray.m4a";
   auto strew = [&] { std::ofstream(stray) << "audio"; };
   const std::string walk = "Walk.m4a";
   auto holds = [&] {
-    return onServiceQueue<std::size_t>(
-        [&] { return service_->orphanedFragmentCleanupHoldCount(editor->composedAVURL()); });
+    return onServiceQueue(
+        [&] { return service_->orphanedFragmentCleanupHoldCount(editor.composedAVURL()); });
   };
   auto enable = [&](const char* peer) {
     call(peer, "EnableOrphanedFragmentCleanup", {url(walk)}, true);
@@ -117,7 +116,7 @@ TEST_F(SessionTest, HoldsKeepOrphanedFragmentsUntilTheLastOneIsReleased) {
   EXPECT_EQ(holds(), 0u);
   EXPECT_FALSE(std::filesystem::exists(stray));
   EXPECT_TRUE(
-      std::filesystem::exists(editor->composition()->fragments().front().AVOutputURL().path()));
+      std::filesystem::exists(editor.composition()->fragments().front().AVOutputURL().path()));
 
   // A session open on the recording keeps it; opening with no other session
   // cleans before the token is given; a vanished holder releases its hold.

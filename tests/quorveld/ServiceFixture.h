@@ -4,6 +4,7 @@
 // sleeping. Its members are public, so scenario tables can drive it.
 #pragma once
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -11,6 +12,7 @@
 #include <fstream>
 #include <functional>
 #include <latch>
+#include <stdexcept>
 #include <string>
 
 #include "Quorvel/composition/RCComposition.h"
@@ -146,30 +148,27 @@ class SessionTest : public ServiceTest {
     service_->serviceSerialQueue().async([gate] { gate->wait(); });
     return gate;
   }
-  template <class T>
-  T onServiceQueue(std::function<T()> read) {
-    T value{};
+  auto onServiceQueue(auto read) {
+    decltype(read()) value{};
     service_->serviceSerialQueue().sync([&] { value = read(); });
     return value;
   }
   // A recording in the database whose fragments are tones of the given
-  // lengths, not yet composed (nullopt on failure, with the test failed).
-  std::optional<RCCompositionEditor> makeRecording(const std::string& title,
-                                                   std::initializer_list<double> fragmentSeconds) {
-    auto model = RCSavedRecordingsModel::modelWithDirectory(directory_.string());
-    EXPECT_TRUE(model) << model.error();
-    if (!model) return std::nullopt;
-    auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, title);
-    EXPECT_TRUE(editor) << editor.error();
-    if (!editor) return std::nullopt;
+  // lengths, not yet composed. Throws, failing the test, when a step fails.
+  RCCompositionEditor makeRecording(const std::string& title,
+                                    std::initializer_list<double> fragmentSeconds) {
+    auto check = [&](auto&& result) {
+      if (!result) throw std::runtime_error(fmt::format("making {}: {}", title, result.error()));
+      return std::move(*result);
+    };
+    auto model = check(RCSavedRecordingsModel::modelWithDirectory(directory_.string()));
+    auto editor = check(RCCompositionEditor::createCompositionForNewRecording(*model, title));
     const std::string tone = (temp_ / "tone.wav").string();
     for (double seconds : fragmentSeconds) {
-      EXPECT_TRUE(testing::writeTone(tone, seconds, "wav"));
-      auto fragment = editor->appendFragmentFromAudioFile(platform::URL::fileURLWithPath(tone));
-      EXPECT_TRUE(fragment) << fragment.error();
-      if (!fragment) return std::nullopt;
+      if (!testing::writeTone(tone, seconds, "wav")) throw std::runtime_error("no tone");
+      check(editor.appendFragmentFromAudioFile(platform::URL::fileURLWithPath(tone)));
     }
-    return std::move(*editor);
+    return editor;
   }
   // Fragments of the recording not yet composed (999: its bundle does not load).
   std::size_t decomposed(const RCCompositionEditor& editor) {
@@ -183,23 +182,20 @@ class SessionTest : public ServiceTest {
     std::fstream(path, std::ios::binary | std::ios::in | std::ios::out) << std::string(64, 'Z');
   }
   std::size_t openSessions() {
-    return onServiceQueue<std::size_t>(
+    return onServiceQueue(
         [&] { return service_->assetSessionController().activeSessions().size(); });
   }
   std::size_t deferredRequests() {
-    return onServiceQueue<std::size_t>(
-        [&] { return service_->deferredAccessRequestCountForTesting(); });
+    return onServiceQueue([&] { return service_->deferredAccessRequestCountForTesting(); });
   }
   // Recordings waiting for a later close to be finalized.
   std::size_t waitingFinalizations() {
-    return onServiceQueue<std::size_t>(
-        [&] { return service_->compositionAVURLsToFinalizeForTesting().size(); });
+    return onServiceQueue([&] { return service_->compositionAVURLsToFinalizeForTesting().size(); });
   }
   // Nothing open, closing or waiting, and no keep-alive held.
   void expectNothingLeft() {
     EXPECT_EQ(openSessions(), 0u);
-    EXPECT_EQ(
-        onServiceQueue<std::size_t>([&] { return service_->closingSessionCountForTesting(); }), 0u);
+    EXPECT_EQ(onServiceQueue([&] { return service_->closingSessionCountForTesting(); }), 0u);
     EXPECT_EQ(deferredRequests(), 0u);
     EXPECT_EQ(waitingFinalizations(), 0u);
     EXPECT_FALSE(controller().isInTransaction());

@@ -236,15 +236,14 @@ const std::vector<Scenario> kScenarios = {
     {"AVanishedClientsSessionsAreTerminatedAndItsCaptureFinalized",
      [](SessionTest& t) {
        auto editor = t.makeRecording("A", {0.2});
-       ASSERT_TRUE(editor);
        t.token(t.prepare(":1.1", "PrepareToCapture", "A.m4a"));
        t.token(t.prepare(":1.1", "PrepareToPreview", "C.m4a"));
        t.listener_->vanish(":1.1");
        t.settle();
        EXPECT_EQ(t.openSessions(), 0u);
-       EXPECT_EQ(t.decomposed(*editor), 0u);
-       EXPECT_TRUE(std::filesystem::exists(
-           RCWaveform::waveformURLForAVURL(editor->composedAVURL()).path()));
+       EXPECT_EQ(t.decomposed(editor), 0u);
+       EXPECT_TRUE(
+           std::filesystem::exists(RCWaveform::waveformURLForAVURL(editor.composedAVURL()).path()));
      },
      {{E, "Connection invalidated: <connection :1.1>"},
       {N, "Terminating access session … for terminated connection: <connection :1.1>"},
@@ -256,8 +255,7 @@ const std::vector<Scenario> kScenarios = {
     {"OrphanedFragmentsAreNamedWhenCleanedOrWhenTheBundleDoesNotLoad",
      [](SessionTest& t) {
        auto editor = t.makeRecording("Walk", {0.2});
-       ASSERT_TRUE(editor);
-       std::ofstream(editor->composition()->bundleURL().path() + "/stray.m4a") << "audio";
+       std::ofstream(editor.composition()->bundleURL().path() + "/stray.m4a") << "audio";
        t.end(":1.1", t.token(t.prepare(":1.1", "PrepareToPreview", "Walk.m4a")));
        t.token(t.prepare(":1.2", "PrepareToPreview", "Nothing.m4a"));
      },
@@ -272,10 +270,9 @@ const std::vector<Scenario> kScenarios = {
     {"ACaptureEndedNormallyIsFinalizedInTheBackground",
      [](SessionTest& t) {
        auto editor = t.makeRecording("Lecture", {0.2});
-       ASSERT_TRUE(editor);
        t.end(":1.1", t.token(t.prepare(":1.1", "PrepareToCapture", "Lecture.m4a")));
        t.settle();
-       EXPECT_EQ(t.decomposed(*editor), 0u);
+       EXPECT_EQ(t.decomposed(editor), 0u);
        t.end(":1.1", t.token(t.prepare(":1.1", "PrepareToPreview", "Lecture.m4a")));
        t.settle();
        t.expectNothingLeft();
@@ -292,13 +289,12 @@ const std::vector<Scenario> kScenarios = {
     {"ABundleThatDoesNotLoadIsNotExportedAndItsWaveformIsSkipped",
      [](SessionTest& t) {
        auto editor = t.makeRecording("Broken", {0.2});
-       ASSERT_TRUE(editor);
-       std::ofstream(editor->composition()->bundleURL().path() + "/manifest.json") << "{ not json";
+       std::ofstream(editor.composition()->bundleURL().path() + "/manifest.json") << "{ not json";
        auto exported = t.call(":1.1", "PrepareToExport", {t.url("Broken.m4a"), true});
        t.advance(0s);
        EXPECT_EQ(t.accessType(exported), 0);
        EXPECT_EQ(t.openSessions(), 0u);
-       EXPECT_TRUE(std::filesystem::exists(editor->composition()->bundleURL().path()));
+       EXPECT_TRUE(std::filesystem::exists(editor.composition()->bundleURL().path()));
      },
      {{E, kExport +
               "ERROR: <CompositionExportOperation: …> : …/Broken.m4a failed with error: Error "
@@ -310,8 +306,7 @@ const std::vector<Scenario> kScenarios = {
     {"ADamagedFragmentIsNamed",
      [](SessionTest& t) {
        auto editor = t.makeRecording("Damaged", {0.4, 0.2});
-       ASSERT_TRUE(editor);
-       SessionTest::damage(editor->composition()->fragments()[1].AVOutputURL().path());
+       SessionTest::damage(editor.composition()->fragments()[1].AVOutputURL().path());
        auto exported = t.call(":1.1", "PrepareToExport", {t.url("Damaged.m4a"), false});
        t.advance(0s);
        t.end(":1.1", t.token(exported));
@@ -326,9 +321,8 @@ const std::vector<Scenario> kScenarios = {
     {"ARequestWhoseClientVanishedBeforeItsReissueLetsTheFinalizationRun",
      [](SessionTest& t) {
        auto editor = t.makeRecording("Gone", {0.2});
-       ASSERT_TRUE(editor);
        auto capture = t.token(t.prepare(":1.1", "PrepareToCapture", "Gone.m4a"));
-       t.service_->_attemptToRunDeferredFinalizationOfCompositionAVURL(editor->composedAVURL());
+       t.service_->_attemptToRunDeferredFinalizationOfCompositionAVURL(editor.composedAVURL());
        t.drainServiceQueue();
        ASSERT_EQ(t.waitingFinalizations(), 1u);
        // The queue runs the close's first step, the preview's deferral, the
@@ -351,7 +345,7 @@ const std::vector<Scenario> kScenarios = {
        t.listener_->vanish(":1.2");
        marker->count_down();
        t.settle();
-       EXPECT_EQ(t.decomposed(*editor), 0u);
+       EXPECT_EQ(t.decomposed(editor), 0u);
        t.expectNothingLeft();
      },
      {{N,
