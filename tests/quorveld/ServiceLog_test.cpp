@@ -214,7 +214,8 @@ const std::vector<Scenario> kScenarios = {
       {N, "Finally closing access session: <AssetAccessSession 0x…> " + preview("A.m4a")},
       {D, "Ending access session: " + preview("A.m4a") + "."}}},
 
-    // Two requests wait behind a closing session: the newest wins.
+    // Two requests wait behind a closing session: the newest wins, and is
+    // re-issued once the closed session has left the registry.
     {"DeferredRequestsAreSupersededOrReissued",
      [](SessionTest& t) {
        auto preview = t.token(t.prepare(":1.1", "PrepareToPreview", "A.m4a"));
@@ -223,7 +224,8 @@ const std::vector<Scenario> kScenarios = {
        auto capture = t.prepare(":1.3", "PrepareToCapture", "A.m4a");
        auto trim = t.prepare(":1.4", "PrepareToTrim", "A.m4a");
        held->count_down();
-       t.token(trim);
+       EXPECT_EQ(t.refusal(capture), RCSDBusErrorDeferredRequestSuperseded);
+       EXPECT_EQ(t.accessType(trim), 2);
      },
      {{D, "scheduling deferred access for 'capture' request"},
       {D, "running deferred access block for 'capture' request -- was canceled!"},
