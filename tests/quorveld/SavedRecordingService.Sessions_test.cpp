@@ -56,12 +56,14 @@ TEST_F(SessionTest, AVanishedClientTakesItsSessionsAndItsWaitingRequestWithIt) {
   token(prepare(":1.1", "PrepareToCapture", "A.m4a"));
   token(prepare(":1.1", "PrepareToPreview", "C.m4a"));
   auto other = token(prepare(":1.2", "PrepareToPreview", "B.m4a"));
+  settle();  // the opens are signalled before the deferral
   auto gate = holdServiceQueue();
   end(":1.2", other);
   auto waiting = prepare(":1.3", "PrepareToPreview", "A.m4a");  // deferred behind B's close
   gate->count_down();
   settle();
   EXPECT_FALSE(waiting->isAnswered());
+  EXPECT_EQ(changes("A.m4a"), 2);  // the capture's open, the deferral
   auto inUse = onServiceQueue(
       [&] { return service_->_onQueue_composedAVURLsWithActiveSessionsOrScheduledWork(); });
   EXPECT_EQ(std::ranges::count(inUse, *platform::URL::fromFileURLStringOrPath(url("A.m4a"))), 2);
@@ -69,9 +71,11 @@ TEST_F(SessionTest, AVanishedClientTakesItsSessionsAndItsWaitingRequestWithIt) {
   listener_->vanish(":1.3");
   settle();
   EXPECT_EQ(deferredRequests(), 0u);
+  EXPECT_EQ(changes("A.m4a"), 3);
   EXPECT_TRUE(waiting->values().empty());  // never granted
   listener_->vanish(":1.1");
   settle();
+  EXPECT_GE(changes("A.m4a"), 4);
   expectNothingLeft();
 }
 

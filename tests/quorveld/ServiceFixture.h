@@ -12,6 +12,7 @@
 #include <fstream>
 #include <functional>
 #include <latch>
+#include <ranges>
 #include <stdexcept>
 #include <string>
 
@@ -187,6 +188,12 @@ class SessionTest : public ServiceTest {
   }
   std::size_t deferredRequests() {
     return onServiceQueue([&] { return service_->deferredAccessRequestCountForTesting(); });
+  }
+  // The AccessSessionsChanged signals for `recording` so far.
+  long changes(const std::string& recording) {
+    return std::ranges::count(
+        listener_->emittedSignals(),
+        std::pair<std::string, BusValues>{"AccessSessionsChanged", {BusValue(url(recording))}});
   }
   // Recordings waiting for a later close to be finalized.
   std::size_t waitingFinalizations() {
