@@ -75,12 +75,13 @@ TEST(OperationQueueTest, LimitSuspensionAndDestruction) {
   std::thread opener;
   {
     OperationQueue queue;
+    auto add = [&](Operations& into, Latch& gate) {
+      into.push_back(blocking(started, gate));
+      into.back()->setCompletionBlock([&] { finished.increment(); });
+      queue.addOperation(into.back());
+    };
     queue.setMaxConcurrentOperationCount(0);  // starts nothing until raised
-    for (auto& gate : gates) {
-      operations.push_back(blocking(started, gate));
-      operations.back()->setCompletionBlock([&] { finished.increment(); });
-      queue.addOperation(operations.back());
-    }
+    for (auto& gate : gates) add(operations, gate);
     EXPECT_FALSE(operations[0]->isExecuting());
     queue.setMaxConcurrentOperationCount(2);
     started.waitFor(2);
@@ -91,11 +92,7 @@ TEST(OperationQueueTest, LimitSuspensionAndDestruction) {
     EXPECT_TRUE(operations[2]->isExecuting() && operations[1]->isFinished());
 
     queue.setSuspended(true);
-    for (int i = 0; i < 3; ++i) {
-      held.push_back(blocking(started, open));
-      held.back()->setCompletionBlock([&] { finished.increment(); });
-      queue.addOperation(held.back());
-    }
+    for (int i = 0; i < 3; ++i) add(held, open);
     gates[0].open();
     finished.waitFor(2);  // a running one went on while suspended
     EXPECT_EQ(started.value(), 3);

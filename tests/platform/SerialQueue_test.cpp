@@ -160,11 +160,10 @@ struct Adopted {
   Latch scopeEnded;
   std::thread::id caller = std::this_thread::get_id();
 
-  Task task(
-      std::string name, std::function<void()> body = [] {}) {
+  Task task(std::string name, std::function<void()> body = nullptr) {
     return [this, name, body] {
       EXPECT_TRUE(queue.isCurrent()) << name;
-      body();
+      if (body) body();
       log.push_back(name + (std::this_thread::get_id() == caller ? "@caller" : "@worker"));
     };
   }

@@ -31,9 +31,8 @@ TEST(URLTest, ParsingAcceptsOnlyAbsoluteFileURLs) {
   EXPECT_EQ(URL::fileURLFromString("file://localhost/a%2Fb")->path(), "/a/b");
   for (const char* bad :
        {"", "/a/b", "http://x/a", "file:a/b", "file://host/a", "file:///a?x=1", "file:///a#frag",
-        "file:///a%2", "file:///a%zz", "file:///a%00b", "file://"}) {
+        "file:///a%2", "file:///a%zz", "file:///a%00b", "file://"})
     EXPECT_FALSE(URL::fileURLFromString(bad)) << bad;
-  }
   EXPECT_EQ(URL::fromFileURLStringOrPath("/tmp/x y.wav")->absoluteString(),
             "file:///tmp/x%20y.wav");
   EXPECT_FALSE(URL::fromFileURLStringOrPath("relative/path.wav"));
@@ -121,9 +120,8 @@ TEST(DateTest, ParsesAndPrintsISO8601) {
   EXPECT_EQ(date->ISO8601String(), "2024-05-01T10:20:30.500Z");
   EXPECT_EQ(Date::fromISO8601("2024-05-01T12:20:30.5+02:00"), date);
   EXPECT_DOUBLE_EQ(Date::fromISO8601("1970-01-01 00:00:10")->timeIntervalSince1970(), 10.0);
-  for (const char* bad : {"", "yesterday", "2024-13-01T00:00:00Z", "2024-05-01T10:20:30x"}) {
+  for (const char* bad : {"", "yesterday", "2024-13-01T00:00:00Z", "2024-05-01T10:20:30x"})
     EXPECT_FALSE(Date::fromISO8601(bad)) << bad;
-  }
 }
 
 }  // namespace
