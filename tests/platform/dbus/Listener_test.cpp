@@ -434,8 +434,8 @@ using BusListenerTest = ListenerTest<BusHarness>;
 // Peer and Introspectable are answered by the bus library without a
 // connection; another interface of the object is unknown.
 TEST_F(BusListenerTest, TheBusAnswersOtherInterfacesAndIntrospectionAndSignalsReachPeers) {
-  auto peer = sdbus::createSessionBusConnectionWithAddress(harness.bus().address());
-  auto proxy = sdbus::createProxy(*peer, kName, kPath);
+  auto client = sdbus::createSessionBusConnectionWithAddress(harness.bus().address());
+  auto proxy = sdbus::createProxy(*client, kName, kPath);
   auto errorOf = [&](const std::string& interface, const std::string& member) {
     try {
       auto call = proxy->createMethodCall(interface, member);
@@ -467,12 +467,12 @@ TEST_F(BusListenerTest, TheBusAnswersOtherInterfacesAndIntrospectionAndSignalsRe
   Gate gate;
   int received = 0;
   auto match =
-      peer->addMatch(std::string("type='signal',interface='") + kInterface + "',member='Changed'",
-                     [&](sdbus::Message&) { gate.update([&] { ++received; }); });
-  peer->enterEventLoopAsync();
+      client->addMatch(std::string("type='signal',interface='") + kInterface + "',member='Changed'",
+                       [&](sdbus::Message&) { gate.update([&] { ++received; }); });
+  client->enterEventLoopAsync();
   harness.listener().emitSignal("Changed");
   EXPECT_TRUE(gate.waitUntil([&] { return received == 1; }));
-  peer->leaveEventLoop();
+  client->leaveEventLoop();
 }
 
 // An orderly stop first delivers the calls that have reached the listener:
