@@ -230,9 +230,7 @@ const std::vector<Scenario> kScenarios = {
      {{D, "scheduling deferred access for 'capture' request"},
       {D, "running deferred access block for 'capture' request -- was canceled!"},
       {D, "scheduling deferred access for 'trimming' request"},
-      {D,
-       "running deferred access block for 'trimming' request -- will re-issue "
-       "request"}}},
+      {D, "running deferred access block for 'trimming' request -- will re-issue request"}}},
 
     // The capture's recording is finalized all the same.
     {"AVanishedClientsSessionsAreTerminatedAndItsCaptureFinalized",
@@ -280,9 +278,8 @@ const std::vector<Scenario> kScenarios = {
        t.expectNothingLeft();
      },
      {{N, "Received request to schedule finalization of 'Lecture.m4a'..."},
-      {D,
-       kExport +
-           "RUNNING asset finalization operation: <CompositionExportOperation: …> : …/Lecture.m4a"},
+      {D, kExport + "RUNNING asset finalization operation: <CompositionExportOperation: …> : "
+                    "…/Lecture.m4a"},
       {D, kExport + "FINISHED asset finalization operation: <CompositionExportOperation: …> : "
                     "…/Lecture.m4a"}}},
 
@@ -315,8 +312,7 @@ const std::vector<Scenario> kScenarios = {
      },
      {{E,
        "[RCCompositionController] WARNING: leaving fragment '…' of Damaged.composition out of the "
-       "composed audio: it "
-       "cannot be read"}}},
+       "composed audio: it cannot be read"}}},
 
     // A deferred request taken out for re-issue whose client vanishes
     // before it runs hands its turn to the recording's waiting finalization.
@@ -351,8 +347,8 @@ const std::vector<Scenario> kScenarios = {
        t.expectNothingLeft();
      },
      {{N,
-       "Not opening 'preview' access session for 'Gone.m4a': connection "
-       "<connection :1.2> has ended"}}},
+       "Not opening 'preview' access session for 'Gone.m4a': connection <connection :1.2> "
+       "has ended"}}},
 
     // Named launch events are posted in-process on the main queue, not on
     // the delivery thread; one without a name is ignored.
