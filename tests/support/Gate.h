@@ -16,11 +16,11 @@ inline constexpr auto kWait = std::chrono::seconds(20);  // upper bound on any w
 
 class Gate {
  public:
+  // Wakes the waiters with the lock held, so a waiter may destroy the gate
+  // (or the Latch or Counter around it) as soon as its wait returns.
   void update(const std::function<void()>& change) {
-    {
-      std::lock_guard lock(mutex_);
-      change();
-    }
+    std::lock_guard lock(mutex_);
+    change();
     changed_.notify_all();
   }
   bool waitUntil(const std::function<bool()>& predicate) {
@@ -35,47 +35,38 @@ class Gate {
 };
 
 // Latch: a one-shot event. Work that must hold on waits in wait(), which
-// returns whether the test opened it within kWait. open() wakes the waiters
-// with the lock held, so a waiter may destroy the latch as soon as it returns.
+// returns whether the test opened it within kWait.
 class Latch {
  public:
   void open() {
-    std::lock_guard lock(mutex_);
-    open_ = true;
-    opened_.notify_all();
+    gate_.update([this] { open_ = true; });
   }
   bool wait() {
-    std::unique_lock lock(mutex_);
-    return opened_.wait_for(lock, kWait, [this] { return open_; });
+    return gate_.waitUntil([this] { return open_; });
   }
 
  private:
-  std::mutex mutex_;
-  std::condition_variable opened_;
+  Gate gate_;
   bool open_ = false;
 };
 
 // Counter: a count the test waits on; waitFor() returns whether it reached
-// `atLeast` within kWait. Safe to destroy once a wait returned, as Latch.
+// `atLeast` within kWait.
 class Counter {
  public:
   void increment() {
-    std::lock_guard lock(mutex_);
-    ++count_;
-    changed_.notify_all();
+    gate_.update([this] { ++count_; });
   }
   bool waitFor(int atLeast) {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kWait, [&] { return count_ >= atLeast; });
+    return gate_.waitUntil([&] { return count_ >= atLeast; });
   }
   int value() {
-    std::lock_guard lock(mutex_);
+    std::lock_guard lock(gate_.mutex());
     return count_;
   }
 
  private:
-  std::mutex mutex_;
-  std::condition_variable changed_;
+  Gate gate_;
   int count_ = 0;
 };
 

@@ -19,39 +19,9 @@ class LocalResponder final : public IncomingCall::Responder {
 
 }  // namespace
 
-bool LocalReply::isAnswered() const {
-  std::lock_guard lock(mutex_);
-  return count_ > 0;
-}
-
 bool LocalReply::waitFor(std::chrono::milliseconds timeout) const {
   std::unique_lock lock(mutex_);
   return answered_.wait_for(lock, timeout, [this] { return count_ > 0; });
-}
-
-int LocalReply::answerCount() const {
-  std::lock_guard lock(mutex_);
-  return count_;
-}
-
-bool LocalReply::isError() const {
-  std::lock_guard lock(mutex_);
-  return isError_;
-}
-
-std::string LocalReply::errorName() const {
-  std::lock_guard lock(mutex_);
-  return errorName_;
-}
-
-std::string LocalReply::errorMessage() const {
-  std::lock_guard lock(mutex_);
-  return errorMessage_;
-}
-
-BusValues LocalReply::values() const {
-  std::lock_guard lock(mutex_);
-  return values_;
 }
 
 void LocalReply::record(bool isError, BusValues values, std::string errorName,
@@ -136,10 +106,7 @@ std::shared_ptr<LocalReply> LocalListener::receive(const std::string& sender,
   auto reply = std::make_shared<LocalReply>();
   auto responder = std::make_unique<LocalResponder>(reply);
   std::lock_guard lock(stateMutex_);
-  if (!resumed_ || stopped_ || nameReleased_) {
-    if (!noReplyExpected) responder->sendError(kBusErrorServiceUnknown, "no listener");
-    return reply;
-  }
+  if (refusedLocked(*responder, noReplyExpected)) return reply;
   received_.push_back(
       Received{sender, member, std::move(arguments), noReplyExpected, std::move(responder)});
   return reply;
@@ -166,13 +133,16 @@ std::shared_ptr<LocalReply> LocalListener::deliver(const std::string& sender,
   std::lock_guard delivery(deliveryMutex_);
   {
     std::lock_guard lock(stateMutex_);
-    if (!resumed_ || stopped_ || nameReleased_) {
-      if (!noReplyExpected) responder->sendError(kBusErrorServiceUnknown, "no listener");
-      return reply;
-    }
+    if (refusedLocked(*responder, noReplyExpected)) return reply;
   }
   deliverChecked(sender, member, std::move(arguments), noReplyExpected, std::move(responder));
   return reply;
+}
+
+bool LocalListener::refusedLocked(IncomingCall::Responder& responder, bool noReplyExpected) {
+  if (resumed_ && !stopped_ && !nameReleased_) return false;
+  if (!noReplyExpected) responder.sendError(kBusErrorServiceUnknown, "no listener");
+  return true;
 }
 
 void LocalListener::deliverChecked(const std::string& sender, const std::string& member,

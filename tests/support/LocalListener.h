@@ -27,20 +27,26 @@ namespace platform {
 class LocalReply {
  public:
   // Whether an answer (reply or error) has arrived.
-  bool isAnswered() const;
+  bool isAnswered() const { return answerCount() > 0; }
   // Blocks until answered. Returns false if `timeout` passes first.
   bool waitFor(std::chrono::milliseconds timeout) const;
   // How many answers arrived (more than one is a transport bug).
-  int answerCount() const;
-  bool isError() const;
-  std::string errorName() const;
-  std::string errorMessage() const;
-  BusValues values() const;
+  int answerCount() const { return locked(count_); }
+  bool isError() const { return locked(isError_); }
+  std::string errorName() const { return locked(errorName_); }
+  std::string errorMessage() const { return locked(errorMessage_); }
+  BusValues values() const { return locked(values_); }
 
   // Used by the listener's responder.
   void record(bool isError, BusValues values, std::string errorName, std::string message);
 
  private:
+  template <class T>
+  T locked(const T& field) const {
+    std::lock_guard lock(mutex_);
+    return field;
+  }
+
   mutable std::mutex mutex_;
   mutable std::condition_variable answered_;
   int count_ = 0;
@@ -95,6 +101,9 @@ class LocalListener final : public Listener {
 
  private:
   struct Received;
+  // With stateMutex_ held: whether the listener takes no calls now; if so,
+  // answers ServiceUnknown (unless no reply is expected).
+  bool refusedLocked(IncomingCall::Responder& responder, bool noReplyExpected);
   // With deliveryMutex_ held: checks and dispatches one call.
   void deliverChecked(const std::string& sender, const std::string& member, BusValues arguments,
                       bool noReplyExpected, std::unique_ptr<IncomingCall::Responder> responder);

@@ -41,14 +41,6 @@ class LogCapture {
     std::lock_guard lock(gate_.mutex());
     return lines_;
   }
-  // The texts captured so far, and forgets them.
-  std::vector<std::string> take() {
-    std::lock_guard lock(gate_.mutex());
-    std::vector<std::string> texts;
-    for (auto& line : lines_) texts.push_back(std::move(line.text));
-    lines_.clear();
-    return texts;
-  }
   // How many lines contain `text` (of `level`, when given).
   std::size_t count(std::string_view text, int level = -1) {
     std::lock_guard lock(gate_.mutex());

@@ -18,34 +18,28 @@ class ScopedEnvironment {
     for (const auto& [name, value] : values) set(name, value);
   }
   ~ScopedEnvironment() {
-    for (const auto& [name, old] : saved_) {
-      if (old) {
-        ::setenv(name.c_str(), old->c_str(), 1);
-      } else {
-        ::unsetenv(name.c_str());
-      }
-    }
+    for (const auto& [name, old] : saved_) put(name, old ? old->c_str() : nullptr);
   }
   ScopedEnvironment(const ScopedEnvironment&) = delete;
   ScopedEnvironment& operator=(const ScopedEnvironment&) = delete;
 
   // Sets `name` to `value`; a null value unsets it.
   void set(const std::string& name, const char* value) {
-    remember(name);
-    if (value) {
-      ::setenv(name.c_str(), value, 1);
-    } else {
-      ::unsetenv(name.c_str());
+    if (!saved_.contains(name)) {
+      const char* old = ::getenv(name.c_str());
+      saved_[name] = old ? std::optional<std::string>(old) : std::nullopt;
     }
+    put(name, value);
   }
   void set(const std::string& name, const std::string& value) { set(name, value.c_str()); }
   void unset(const std::string& name) { set(name, nullptr); }
 
  private:
-  void remember(const std::string& name) {
-    if (saved_.contains(name)) return;
-    const char* old = ::getenv(name.c_str());
-    saved_[name] = old ? std::optional<std::string>(old) : std::nullopt;
+  static void put(const std::string& name, const char* value) {
+    if (value)
+      ::setenv(name.c_str(), value, 1);
+    else
+      ::unsetenv(name.c_str());
   }
   std::map<std::string, std::optional<std::string>> saved_;
 };
