@@ -9,6 +9,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <functional>
 #include <initializer_list>
 #include <stdexcept>
 
@@ -51,6 +52,16 @@ platform::Result<platform::Subprocess> spawn(const std::vector<std::string>& arg
   return child;
 }
 
+// Hands what `fd` yields to `chunk` until its end, then closes it.
+void readToEnd(int fd, const std::function<void(std::string_view)>& chunk) {
+  char buffer[4096];
+  for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) != 0;) {
+    if (n > 0) chunk({buffer, std::size_t(n)});
+    if (n < 0 && errno != EINTR) break;
+  }
+  close(fd);
+}
+
 }  // namespace
 
 std::string DaemonProcess::programPath(const std::string& name) {
@@ -81,29 +92,19 @@ DaemonProcess::~DaemonProcess() {
 
 void DaemonProcess::capture(int fd) {
   std::string pending;
-  char buffer[4096];
-  while (true) {
-    ssize_t n = read(fd, buffer, sizeof buffer);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) break;
-    pending.append(buffer, static_cast<std::size_t>(n));
-    std::size_t newline;
+  readToEnd(fd, [&](std::string_view chunk) {
+    pending.append(chunk);
     std::lock_guard lock(mutex_);
-    while ((newline = pending.find('\n')) != std::string::npos) {
+    for (std::size_t newline; (newline = pending.find('\n')) != std::string::npos;) {
       lines_.push_back(pending.substr(0, newline));
       pending.erase(0, newline + 1);
     }
     changed_.notify_all();
-  }
-  close(fd);
+  });
   std::lock_guard lock(mutex_);
   if (!pending.empty()) lines_.push_back(pending);
   closed_ = true;
   changed_.notify_all();
-}
-
-bool DaemonProcess::waitForLine(const std::string& text, std::chrono::milliseconds timeout) {
-  return waitForLines(text, 1, timeout);
 }
 
 bool DaemonProcess::waitForLines(const std::string& text, std::size_t count,
@@ -156,12 +157,7 @@ DaemonProcess::CommandResult DaemonProcess::run(const std::vector<std::string>& 
   if (!child)
     return {127, std::string("cannot run ") + argv[0] + ": " + child.error().description()};
   std::string output;
-  char buffer[4096];
-  for (ssize_t n; (n = read(fd, buffer, sizeof buffer)) != 0;) {
-    if (n > 0) output.append(buffer, static_cast<std::size_t>(n));
-    if (n < 0 && errno != EINTR) break;
-  }
-  close(fd);
+  readToEnd(fd, [&](std::string_view chunk) { output.append(chunk); });
   return {platform::Subprocess::exitCode(child->wait()), output};
 }
 

@@ -34,14 +34,11 @@ class DaemonProcess {
   DaemonProcess& operator=(const DaemonProcess&) = delete;
 
   pid_t pid() const { return pid_; }
-  // Waits until a stderr line contains `text`; false on timeout or when the
-  // process's stderr closed first.
-  bool waitForLine(const std::string& text,
-                   std::chrono::milliseconds timeout = std::chrono::seconds(30));
   // Waits until `count` stderr lines contain `text`; false on timeout or when
-  // stderr closed first.
+  // the process's stderr closed first.
   bool waitForLines(const std::string& text, std::size_t count,
                     std::chrono::milliseconds timeout = std::chrono::seconds(30));
+  bool waitForLine(const std::string& text) { return waitForLines(text, 1); }
   // Every line so far that contains `text`.
   std::vector<std::string> linesContaining(const std::string& text) const;
   std::string output() const;
