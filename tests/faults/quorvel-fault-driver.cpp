@@ -24,7 +24,6 @@
 #include <cmath>
 #include <cstdio>
 #include <filesystem>
-#include <fstream>
 #include <functional>
 #include <string>
 #include <vector>
@@ -65,13 +64,18 @@ struct Context {
     if (!condition) problem(std::move(text));
     return condition;
   }
-  std::shared_ptr<RCSavedRecordingsModel> model() {
+  // The database; its error is a problem too.
+  platform::Result<std::shared_ptr<RCSavedRecordingsModel>> model() {
     auto opened = RCSavedRecordingsModel::modelWithDirectory(dir.string());
-    if (!opened) {
-      problem("the database does not open: " + opened.error().description());
-      return nullptr;
-    }
-    return *opened;
+    if (!opened) problem("the database does not open: " + opened.error().description());
+    return opened;
+  }
+  // Whether the files are in the new state; `what` must be in the new state
+  // or the old one, and in the new one when the operation reported success.
+  bool eitherState(bool isNew, bool isOld, bool done, const std::string& what) {
+    if (!isNew && !isOld) problem(what + " is neither the old nor the new");
+    if (isOld && !isNew && done) problem("the operation reported success, but " + what + " is old");
+    return isNew;
   }
 };
 
@@ -104,19 +108,24 @@ platform::Status check(platform::Status status, const char* what) {
   return status;
 }
 
+// Appends a take of `seconds` to `editor`, made outside the directory.
+platform::Status appendTake(Context& context, RCCompositionEditor& editor, double seconds,
+                            double frequency) {
+  const std::string source = context.dir.string() + "-take.wav";
+  TRY(tone(source, seconds, frequency));
+  auto appended = editor.appendFragmentFromAudioFile(URL::fileURLWithPath(source));
+  fs::remove(source);
+  return statusOf(appended);
+}
+
 // A recording "Walk" made as an app makes it, from fragments of `seconds`.
 platform::Status makeRecording(Context& context, const std::vector<double>& seconds) {
   auto model = context.model();
-  if (!model) return platform::fail(platform::posixError(EIO, "no database"));
-  auto editor = RCCompositionEditor::createCompositionForNewRecording(*model, "Walk");
+  TRY(model);
+  auto editor = RCCompositionEditor::createCompositionForNewRecording(**model, "Walk");
   TRY(editor);
-  for (std::size_t i = 0; i < seconds.size(); ++i) {
-    const std::string source = context.dir.string() + "-take" + std::to_string(i) + ".wav";
-    TRY(tone(source, seconds[i], 440 + 110 * i));
-    auto appended = editor->appendFragmentFromAudioFile(URL::fileURLWithPath(source));
-    fs::remove(source);
-    TRY(appended);
-  }
+  for (std::size_t i = 0; i < seconds.size(); ++i)
+    TRY(appendTake(context, *editor, seconds[i], 440 + 110 * i));
   return {};
 }
 
@@ -124,9 +133,9 @@ platform::Status makeRecording(Context& context, const std::vector<double>& seco
 platform::Status makeComposedFile(Context& context, double seconds) {
   TRY(tone(context.path("Walk.m4a"), seconds));
   auto model = context.model();
-  if (!model) return platform::fail(platform::posixError(EIO, "no database"));
-  model->insertRecordingWithAudioFile(context.path("Walk.m4a"), seconds, platform::Date::now());
-  return model->saveIfNecessary();
+  TRY(model);
+  (*model)->insertRecordingWithAudioFile(context.path("Walk.m4a"), seconds, platform::Date::now());
+  return (*model)->saveIfNecessary();
 }
 
 std::shared_ptr<RCComposition> loadWalk(Context& context) {
@@ -162,7 +171,7 @@ void checkDirectory(Context& context, bool temporaryFilesAllowed) {
   }
   auto model = context.model();
   if (!model) return;
-  auto walked = model->enumerateExistingRecordingsWithBlock([&](const auto& recording, bool&) {
+  auto walked = (*model)->enumerateExistingRecordingsWithBlock([&](const auto& recording, bool&) {
     auto url = recording->url();
     if (!url) return context.problem("a record without a file");
     if (fs::exists(url->path())) return;
@@ -178,7 +187,7 @@ void checkDirectory(Context& context, bool temporaryFilesAllowed) {
 std::shared_ptr<RCSavedRecording> recordOf(Context& context, const std::string& name) {
   auto model = context.model();
   if (!model) return nullptr;
-  auto found = model->recordingWithURL(context.url(name));
+  auto found = (*model)->recordingWithURL(context.url(name));
   return found ? *found : nullptr;
 }
 
@@ -209,11 +218,7 @@ const std::vector<Operation>& operations() {
          TRY(RCMediaEngine::current()->writeTitle(c.url("Walk.m4a"), "Gang", "deu"));
          auto editor = RCCompositionEditor::editorForComposedAVURL(c.url("Walk.m4a"));
          TRY(editor);
-         const std::string source = c.dir.string() + "-take.wav";
-         TRY(tone(source, 0.5, 880));
-         auto appended = editor->appendFragmentFromAudioFile(URL::fileURLWithPath(source));
-         fs::remove(source);
-         return statusOf(appended);
+         return appendTake(c, *editor, 0.5, 880);
        },
        [](Context& c) {
          return RCCompositionController::compositionControllerForComposedAVURL(c.url("Walk.m4a"))
@@ -271,10 +276,8 @@ const std::vector<Operation>& operations() {
          for (const auto& item : *items)
            (item.language.empty() ? untagged : german) = item.stringValue;
          c.expect(untagged == "Walk", "the untagged title changed: '" + untagged + "'");
-         const bool newState = german == "Spaziergang";
-         c.expect(newState || german == "Gang", "the German title is neither: '" + german + "'");
-         if (done && !newState) c.problem("the title write reported success without writing");
-         return newState;
+         return c.eitherState(german == "Spaziergang", german == "Gang", done,
+                              "the German title '" + german + "'");
        }},
       // A manifest saved with a fragment trimmed.
       {"manifest", [](Context& c) { return makeRecording(c, {1.0}); },
@@ -290,36 +293,20 @@ const std::vector<Operation>& operations() {
          auto composition = loadWalk(c);
          if (!composition) return false;
          const double seconds = composition->composedDuration();
-         const bool newState = near(seconds, 0.5);
-         c.expect(newState || near(seconds, 1.0), "the manifest is neither the old nor the new");
-         if (done && !newState) c.problem("the save reported success without saving");
-         return newState;
+         return c.eitherState(near(seconds, 0.5), near(seconds, 1.0), done, "the manifest");
        }},
       // The orphan run over a bundle and a file the database lacks, a copy of
       // that file, and a file without audio.
       {"recovery",
        [](Context& c) -> platform::Status {
-         if (!c.model()) return platform::fail(platform::posixError(EIO, "no database"));
-         fs::create_directories(c.dir / "Lost.composition");
-         TRY(tone(c.path("Lost.composition/Lost-1.wav"), 1.0));
-         RCCompositionManifest manifest;
-         manifest.composedName = "Lost.m4a";
-         manifest.fragments.push_back({.file = "Lost-1.wav", .contentDuration = 1.0});
-         manifest.recomputeTimeRanges();
-         std::ofstream(c.path("Lost.composition/manifest.json")) << manifest.serialize();
-         testing::ToneOptions options;
-         options.frequencyHz = 660;
-         options.metadata = {{"title", "Found on a card"}};
-         TRY(testing::writeTone(c.path("Found.m4a"), options));
-         fs::copy_file(c.path("Found.m4a"), c.path("Found again.m4a"));
-         std::ofstream(c.path("Noise.wav")) << std::string(4096, 'x');
-         return {};
+         TRY(c.model());  // made before the orphans
+         return testing::writeOrphans(c.dir.string());
        },
        [](Context& c) -> platform::Status {
          auto model = c.model();
-         if (!model) return platform::fail(platform::posixError(EIO, "no database"));
-         RCSOrphanHandling(*model).performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs(
-             {});
+         TRY(model);
+         RCSOrphanHandling(**model)
+             .performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs({});
          return {};
        },
        [](Context& c, bool) {
@@ -411,7 +398,7 @@ void restart(Context& context) {
       fs::last_write_time(it->path(), fs::last_write_time(it->path()) - age, error);
   }
   if (auto model = context.model())
-    RCSOrphanHandling(*model).performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs({});
+    RCSOrphanHandling(**model).performOrphanRecoveryAndCleanupWithExternallyInUseComposedAVURLs({});
 }
 
 int usage() {

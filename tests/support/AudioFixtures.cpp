@@ -20,6 +20,7 @@
 
 #include <fmt/format.h>
 
+#include "Quorvel/composition/RCCompositionManifest.h"
 #include "platform/Subprocess.h"
 
 namespace quorvel::testing {
@@ -126,6 +127,23 @@ platform::Status writeDamagedAudio(const std::string& dir) {
   return {};
 }
 
+platform::Status writeOrphans(const std::string& dir) {
+  const std::filesystem::path at(dir);
+  std::filesystem::create_directories(at / "Lost.composition");
+  if (auto written = writeTone((at / "Lost.composition/Lost-1.wav").string(), 1.0, "wav"); !written)
+    return written;
+  RCCompositionManifest manifest;
+  manifest.composedName = "Lost.m4a";
+  manifest.fragments.push_back({.file = "Lost-1.wav", .contentDuration = 1.0});
+  manifest.recomputeTimeRanges();
+  std::ofstream(at / "Lost.composition/manifest.json") << manifest.serialize();
+  ToneOptions found{.frequencyHz = 660, .metadata = {{"title", "Found on a card"}}};
+  if (auto written = writeTone((at / "Found.m4a").string(), found); !written) return written;
+  std::filesystem::copy_file(at / "Found.m4a", at / "Found again.m4a");
+  std::ofstream(at / "Noise.wav") << std::string(4096, 'x');
+  return {};
+}
+
 platform::Result<DecodedPCM> decodeToPCM(const std::string& path) {
   auto probe = words(
       "ffprobe -v error -select_streams a:0 -show_entries "
@@ -148,17 +166,8 @@ platform::Result<DecodedPCM> decodeToPCM(const std::string& path) {
   return pcm;
 }
 
-namespace {
-std::pair<std::size_t, std::size_t> frameRange(const DecodedPCM& pcm, std::size_t begin,
-                                               std::size_t end) {
-  const std::size_t frames = pcm.frames();
-  if (end == 0 || end > frames) end = frames;
-  return {std::min(begin, end), end};
-}
-}  // namespace
-
-double estimatedFrequencyHz(const DecodedPCM& pcm, std::size_t beginFrame, std::size_t endFrame) {
-  auto [begin, end] = frameRange(pcm, beginFrame, endFrame);
+double estimatedFrequencyHz(const DecodedPCM& pcm, std::size_t begin, std::size_t end) {
+  if (end == 0 || end > pcm.frames()) end = pcm.frames();
   if (end <= begin + 1 || pcm.sampleRate <= 0) return 0.0;
   std::size_t first = 0, last = 0, crossings = 0;
   for (std::size_t i = begin + 1; i < end; ++i) {

@@ -52,6 +52,12 @@ struct DecodedPCM {
 // (2 s, header declares more than is there) and video.m4a (no audio stream).
 platform::Status writeDamagedAudio(const std::string& dir);
 
+// Writes what an orphan run finds in `dir`: a bundle the database lacks
+// (Lost.composition, one 1 s fragment, composed name Lost.m4a), a file it
+// lacks (Found.m4a, 660 Hz, titled "Found on a card"), a copy of that file
+// (Found again.m4a) and a file without audio (Noise.wav).
+platform::Status writeOrphans(const std::string& dir);
+
 // Decodes the first audio stream of `path` to interleaved float at the
 // stream's own rate and channel count. Fails for files FFmpeg cannot open or
 // that hold no audio stream.
