@@ -4,6 +4,7 @@
 // call to the service name must start the installed daemon, which must find
 // the installed media worker, and the daemon must leave the bus again once
 // idle. The test waits on NameOwnerChanged, never on time.
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sdbus-c++/sdbus-c++.h>
 
@@ -15,7 +16,6 @@
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/Gate.h"
 #include "tests/support/ScopedEnvironment.h"
-#include "tests/support/ScopedTempDir.h"
 #include "tests/support/TempDirectory.h"
 #include "tests/support/TestBus.h"
 
@@ -23,6 +23,7 @@ namespace quorvel {
 namespace {
 
 using testing::DaemonProcess;
+using ::testing::HasSubstr;
 using testing::readFile;
 namespace fs = std::filesystem;
 
@@ -89,32 +90,30 @@ class ActivationTest : public ::testing::Test {
 
 testing::ScopedTempDir* ActivationTest::root_ = nullptr;
 
-TEST_F(ActivationTest, InstalledFilesPointIntoThePrefix) {
-  const std::string activation = readFile(prefix(kActivationFile));
-  EXPECT_NE(activation.find("Exec=" + prefix("bin/quorveld") + "\n"), std::string::npos)
-      << activation;
-  EXPECT_NE(activation.find("SystemdService=quorveld.service"), std::string::npos);
-  const std::string unit = readFile(prefix("share/systemd/user/quorveld.service"));
-  EXPECT_NE(unit.find("ExecStart=" + prefix("bin/quorveld") + "\n"), std::string::npos) << unit;
-  EXPECT_TRUE(fs::exists(prefix("libexec/quorvel/quorvel-media")));
-  EXPECT_FALSE(fs::exists(prefix("bin/quorvel-media")));  // the daemon must look in libexec
-  const std::string pc = readFile(prefix("lib/pkgconfig/quorvel.pc"));
-  EXPECT_NE(pc.find("prefix=" + prefix() + "\n"), std::string::npos) << pc;
-  EXPECT_TRUE(fs::exists(prefix("include/quorvel/Quorvel/service/SavedRecordingServiceClient.h")));
-}
+// Each installed file names the prefix it went to, the worker is where the
+// daemon looks for it, and the user unit stays hardened: the directives the
+// daemon relies on are there, and the offline analysis (as a user manager
+// would run it) rates its exposure 3.0 or less.
+TEST_F(ActivationTest, InstalledFilesPointIntoThePrefixAndTheUnitStaysHardened) {
+  const std::string quorveld = prefix("bin/quorveld"), unit = "share/systemd/user/quorveld.service";
+  const std::pair<std::string, std::string> contents[] = {
+      {kActivationFile, "Exec=" + quorveld + "\n"},
+      {kActivationFile, "SystemdService=quorveld.service"},
+      {"lib/pkgconfig/quorvel.pc", "prefix=" + prefix() + "\n"},
+      {unit, "ExecStart=" + quorveld + "\n"},
+      {unit, "Type=dbus\n"},
+      {unit, "BusName=org.quorvel.SavedRecordingService\n"},
+      {unit, "Environment=SQLITE_AUTO_TRACE=1\n"},
+      {unit, "ReadWritePaths=-%h/.local/share/quorvel\n"},
+      {unit, "RestrictAddressFamilies=AF_UNIX\n"},
+      {unit, "SystemCallFilter=@system-service\n"}};
+  for (const auto& [file, text] : contents) EXPECT_THAT(readFile(prefix(file)), HasSubstr(text));
+  for (const auto& [file, installed] :
+       {std::pair{"libexec/quorvel/quorvel-media", true},
+        {"bin/quorvel-media", false},  // the daemon must look in libexec
+        {"include/quorvel/Quorvel/service/SavedRecordingServiceClient.h", true}})
+    EXPECT_EQ(fs::exists(prefix(file)), installed) << file;
 
-// The installed user unit stays hardened: the offline analysis (as a user
-// manager would run it) rates its exposure 3.0 or less, and the directives
-// the daemon relies on are there.
-TEST_F(ActivationTest, InstalledUnitExposureIsAtMostThree) {
-  const std::string unit = prefix("share/systemd/user/quorveld.service");
-  const std::string text = readFile(unit);
-  for (const char* directive :
-       {"Type=dbus\n", "BusName=org.quorvel.SavedRecordingService\n",
-        "Environment=SQLITE_AUTO_TRACE=1\n", "ReadWritePaths=-%h/.local/share/quorvel\n",
-        "RestrictAddressFamilies=AF_UNIX\n", "SystemCallFilter=@system-service\n"}) {
-    EXPECT_NE(text.find(directive), std::string::npos) << directive;
-  }
   if (DaemonProcess::run({"sh", "-c", "command -v systemd-analyze"}).status != 0)
     GTEST_SKIP() << "systemd-analyze is not installed";
   // The offline analysis still wants a runtime directory for the user.
@@ -123,9 +122,9 @@ TEST_F(ActivationTest, InstalledUnitExposureIsAtMostThree) {
   fs::permissions(runtime, fs::perms::owner_all);
   auto analysed =
       DaemonProcess::run({"env", "XDG_RUNTIME_DIR=" + runtime.string(), "systemd-analyze",
-                          "security", "--offline=true", "--user", "--threshold=30", unit});
+                          "security", "--offline=true", "--user", "--threshold=30", prefix(unit)});
   EXPECT_EQ(analysed.status, 0) << analysed.output;
-  EXPECT_NE(analysed.output.find("Overall exposure level"), std::string::npos) << analysed.output;
+  EXPECT_THAT(analysed.output, HasSubstr("Overall exposure level"));
 }
 
 // The first call starts the installed daemon; an export through it composes
@@ -159,7 +158,7 @@ TEST_F(ActivationTest, FirstCallStartsTheInstalledDaemonWhichExitsWhenIdle) {
                           "--object-path", "/org/quorvel/SavedRecordingService", "--method",
                           "org.quorvel.SavedRecordingService1.FetchExportingCompositionAVURLs"});
   ASSERT_EQ(fetched.status, 0) << fetched.output;
-  EXPECT_NE(fetched.output.find("[]"), std::string::npos) << fetched.output;
+  EXPECT_THAT(fetched.output, HasSubstr("[]"));
   auto owner = watch.waitForChange(1);
   ASSERT_TRUE(owner && !owner->empty());
   // The start-up work keeps the daemon on the bus for a while, long enough
