@@ -14,6 +14,13 @@ namespace platform::testing {
 
 inline constexpr auto kWait = std::chrono::seconds(20);  // upper bound on any wait for an event
 
+// A copy of `field`, read with `mutex` held.
+template <class T>
+T readLocked(std::mutex& mutex, const T& field) {
+  std::lock_guard lock(mutex);
+  return field;
+}
+
 class Gate {
  public:
   // Wakes the waiters with the lock held, so a waiter may destroy the gate
@@ -60,10 +67,7 @@ class Counter {
   bool waitFor(int atLeast) {
     return gate_.waitUntil([&] { return count_ >= atLeast; });
   }
-  int value() {
-    std::lock_guard lock(gate_.mutex());
-    return count_;
-  }
+  int value() { return readLocked(gate_.mutex(), count_); }
 
  private:
   Gate gate_;

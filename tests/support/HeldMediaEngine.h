@@ -45,8 +45,8 @@ class HeldMediaEngine : public DelegatingMediaEngine {
   bool waitForInside(int count) {
     return gate_.waitUntil([&] { return inside_ >= count; });
   }
-  int came() { return read(came_); }
-  int mostInside() { return read(mostInside_); }
+  int came() { return platform::testing::readLocked(gate_.mutex(), came_); }
+  int mostInside() { return platform::testing::readLocked(gate_.mutex(), mostInside_); }
 
  private:
   // Counts a held job in and, once the gate is open, out.
@@ -66,10 +66,6 @@ class HeldMediaEngine : public DelegatingMediaEngine {
     HeldMediaEngine& engine;
     const bool held;
   };
-  int read(const int& field) {
-    std::lock_guard lock(gate_.mutex());
-    return field;
-  }
 
   platform::testing::Gate gate_;
   bool open_ = false;  // the fields are guarded by gate_

@@ -180,21 +180,6 @@ void LocalListener::loseBus() {
   busLost();
 }
 
-std::vector<std::pair<std::string, BusValues>> LocalListener::emittedSignals() const {
-  std::lock_guard lock(stateMutex_);
-  return signals_;
-}
-
-bool LocalListener::isNameReleased() const {
-  std::lock_guard lock(stateMutex_);
-  return nameReleased_;
-}
-
-bool LocalListener::isStopped() const {
-  std::lock_guard lock(stateMutex_);
-  return stopped_;
-}
-
 void LocalListener::deliverSignal(const std::string& interface, const std::string& member,
                                   const BusValues& arguments) {
   std::lock_guard delivery(deliveryMutex_);

@@ -20,6 +20,7 @@
 #include <vector>
 
 #include "platform/dbus/Listener.h"
+#include "tests/support/Gate.h"
 
 namespace platform {
 
@@ -31,22 +32,16 @@ class LocalReply {
   // Blocks until answered. Returns false if `timeout` passes first.
   bool waitFor(std::chrono::milliseconds timeout) const;
   // How many answers arrived (more than one is a transport bug).
-  int answerCount() const { return locked(count_); }
-  bool isError() const { return locked(isError_); }
-  std::string errorName() const { return locked(errorName_); }
-  std::string errorMessage() const { return locked(errorMessage_); }
-  BusValues values() const { return locked(values_); }
+  int answerCount() const { return testing::readLocked(mutex_, count_); }
+  bool isError() const { return testing::readLocked(mutex_, isError_); }
+  std::string errorName() const { return testing::readLocked(mutex_, errorName_); }
+  std::string errorMessage() const { return testing::readLocked(mutex_, errorMessage_); }
+  BusValues values() const { return testing::readLocked(mutex_, values_); }
 
   // Used by the listener's responder.
   void record(bool isError, BusValues values, std::string errorName, std::string message);
 
  private:
-  template <class T>
-  T locked(const T& field) const {
-    std::lock_guard lock(mutex_);
-    return field;
-  }
-
   mutable std::mutex mutex_;
   mutable std::condition_variable answered_;
   int count_ = 0;
@@ -95,9 +90,11 @@ class LocalListener final : public Listener {
   // The bus is gone: every connection is invalidated.
   void loseBus();
 
-  std::vector<std::pair<std::string, BusValues>> emittedSignals() const;
-  bool isNameReleased() const;
-  bool isStopped() const;
+  std::vector<std::pair<std::string, BusValues>> emittedSignals() const {
+    return testing::readLocked(stateMutex_, signals_);
+  }
+  bool isNameReleased() const { return testing::readLocked(stateMutex_, nameReleased_); }
+  bool isStopped() const { return testing::readLocked(stateMutex_, stopped_); }
 
  private:
   struct Received;

@@ -37,10 +37,7 @@ class LogCapture {
   LogCapture(const LogCapture&) = delete;
   LogCapture& operator=(const LogCapture&) = delete;
 
-  std::vector<LogLine> lines() {
-    std::lock_guard lock(gate_.mutex());
-    return lines_;
-  }
+  std::vector<LogLine> lines() { return platform::testing::readLocked(gate_.mutex(), lines_); }
   // How many lines contain `text` (of `level`, when given).
   std::size_t count(std::string_view text, int level = -1) {
     std::lock_guard lock(gate_.mutex());
