@@ -279,22 +279,6 @@ const std::vector<Operation>& operations() {
          return c.eitherState(german == "Spaziergang", german == "Gang", done,
                               "the German title '" + german + "'");
        }},
-      // A manifest saved with a fragment trimmed.
-      {"manifest", [](Context& c) { return makeRecording(c, {1.0}); },
-       [](Context& c) -> platform::Status {
-         auto loaded = RCComposition::load(c.url("Walk.composition"));
-         TRY(loaded);
-         RCCompositionManifest manifest = (*loaded)->manifest();
-         manifest.fragments.at(0).contentDuration = 0.5;
-         manifest.recomputeTimeRanges();
-         return RCComposition(c.url("Walk.composition"), manifest).saveMetadataToDefaultLocation();
-       },
-       [](Context& c, bool done) {
-         auto composition = loadWalk(c);
-         if (!composition) return false;
-         const double seconds = composition->composedDuration();
-         return c.eitherState(near(seconds, 0.5), near(seconds, 1.0), done, "the manifest");
-       }},
       // The orphan run over a bundle and a file the database lacks, a copy of
       // that file, and a file without audio.
       {"recovery",
