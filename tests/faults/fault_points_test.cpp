@@ -18,6 +18,7 @@
 #include <optional>
 #include <sstream>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
@@ -41,12 +42,9 @@ struct Point {
   std::string line;
 };
 
-struct Fault {
-  const char* name;
-  const char* inject;  // strace's inject= action
-};
-constexpr Fault kFaults[] = {
-    {"SIGKILL", "signal=SIGKILL"}, {"EIO", "error=EIO"}, {"ENOSPC", "error=ENOSPC"}};
+// The faults, as strace's inject= actions.
+constexpr std::string_view kKill = "signal=SIGKILL";
+constexpr std::string_view kFaults[] = {kKill, "error=EIO", "error=ENOSPC"};
 
 // A strace log line "PID name(args...": the name and whether the call works
 // on `dir` (its file descriptor, as -y shows it, or its path does).
@@ -135,12 +133,12 @@ class FaultPointsTest : public ::testing::TestWithParam<const char*> {
   }
 
   // Replays `point` with `fault`; the problems found, empty when none.
-  std::string replay(int n, const Point& point, const Fault& fault) {
+  std::string replay(int n, const Point& point, std::string_view fault) {
     const fs::path dir = directoryOf(n);
     if (auto failed = copyTemplate(dir)) return *failed;
     const fs::path log = dir.parent_path() / "strace.log";
     auto ran = traced(dir, log, point.syscall,
-                      {"-e", "inject=" + point.syscall + ":" + fault.inject +
+                      {"-e", "inject=" + point.syscall + ":" + std::string(fault) +
                                  ":when=" + std::to_string(point.index)});
     const char* outcome = ran.status == 0     ? "succeeded"
                           : ran.status == 1   ? "failed"
@@ -159,8 +157,7 @@ class FaultPointsTest : public ::testing::TestWithParam<const char*> {
     if (!call || !call->inDirectory || call->syscall != point.syscall)
       return std::string("the fault went into another call than ") + point.line + ": '" + hit +
              "' (the calls are not counted the same in every run)";
-    if (std::string(fault.name) == "SIGKILL" && std::string(outcome) != "killed")
-      return "not killed";
+    if (fault == kKill && std::string(outcome) != "killed") return "not killed";
     std::vector<std::string> after{driver(), "after", GetParam(), dir.string(), outcome};
     if (point.syscall.starts_with("unlink")) after.push_back("unlink");
     auto checked = DaemonProcess::run(after);
@@ -187,11 +184,11 @@ TEST_P(FaultPointsTest, EveryCallFailedOrKilledLeavesTheRecordingsIntact) {
   auto worker = [&] {
     for (std::size_t job; (job = next++) < jobs;) {
       const Point& point = points[job / std::size(kFaults)];
-      const Fault& fault = kFaults[job % std::size(kFaults)];
+      const std::string_view fault = kFaults[job % std::size(kFaults)];
       std::string problems = replay(int(job) + 2, point, fault);
       if (problems.empty()) continue;
       std::lock_guard lock(mutex);
-      failures.push_back(std::string(fault.name) + " at " + point.syscall + " #" +
+      failures.push_back(std::string(fault) + " at " + point.syscall + " #" +
                          std::to_string(point.index) + " " + point.line + "\n  " + problems);
     }
   };

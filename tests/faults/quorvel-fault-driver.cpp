@@ -20,12 +20,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <cstdio>
 #include <filesystem>
 #include <functional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "Models/RCSavedRecordingsModel+RCSOrphanHandling.h"
@@ -196,7 +198,7 @@ std::shared_ptr<RCSavedRecording> recordOf(Context& context, const std::string& 
 // all of its work); otherwise the state may be the old one or the new one,
 // and `check` says which it is.
 struct Operation {
-  const char* name;
+  std::string_view name;
   std::function<platform::Status(Context&)> prepare;
   std::function<platform::Status(Context&)> run;
   // Checks the operation's own files; returns whether the new state is there.
@@ -362,12 +364,6 @@ const std::vector<Operation>& operations() {
   return table;
 }
 
-const Operation* operationNamed(const std::string& name) {
-  for (const Operation& operation : operations())
-    if (name == operation.name) return &operation;
-  return nullptr;
-}
-
 // What the daemon does when it starts after a crash: the orphan run, which
 // removes the leftovers of interrupted atomic replaces once they are old
 // enough not to be a write in progress (here aged past that limit, as if
@@ -395,8 +391,8 @@ int usage() {
 int driverMain(int argc, char** argv) {
   if (argc < 4) return usage();
   const std::string command = argv[1];
-  const Operation* operation = operationNamed(argv[2]);
-  if (!operation) return usage();
+  const auto operation = std::ranges::find(operations(), argv[2], &Operation::name);
+  if (operation == operations().end()) return usage();
   platform::setConsoleLogging(false);
   RCUseInProcessMediaEngine();
   Context context{fs::absolute(argv[3])};
