@@ -24,6 +24,7 @@
 #include <nlohmann/json.hpp>
 #include <thread>
 #include <tuple>
+#include <utility>
 
 #include "Quorvel/composition/RCComposition.h"
 #include "Quorvel/composition/RCCompositionEditor.h"
@@ -52,7 +53,7 @@ namespace fs = std::filesystem;
 class DaemonTest : public ::testing::Test {
  protected:
   void TearDown() override {
-    for (pid_t command : commands_) ::kill(command, SIGKILL);
+    endCommands();
     holders_.clear();
     RCSavedRecordingsModel::resetSharedModelsForTesting();
     RCSavedRecordingsModel::setSavedRecordingsDirectory(std::nullopt);
@@ -89,8 +90,8 @@ class DaemonTest : public ::testing::Test {
     return client ? std::move(*client) : nullptr;
   }
   // quorvelctl holding a `kind` session of `recording` in the background,
-  // once granted. Its command says its pid, so TearDown can end it: it would
-  // otherwise keep quorvelctl's stderr open.
+  // once granted. Its command says its pid, so endCommands() can end it: it
+  // would otherwise keep quorvelctl's stderr open.
   DaemonProcess& hold(const std::string& kind, const std::string& recording) {
     auto& holder = *holders_.emplace_back(std::make_unique<DaemonProcess>(
         DaemonProcess::programPath("quorvelctl"),
@@ -100,6 +101,9 @@ class DaemonTest : public ::testing::Test {
     for (const auto& line : holder.linesContaining("held "))
       commands_.push_back(std::stoi(line.substr(5)));
     return holder;
+  }
+  void endCommands() {
+    for (pid_t command : std::exchange(commands_, {})) ::kill(command, SIGKILL);
   }
 
   platform::testing::TestBus bus_;
@@ -148,7 +152,7 @@ TEST_F(DaemonTest, QuorvelctlHoldsSessionsWhileItsCommandRunsAndReportsByExitSta
   const std::string recording = path("Held.m4a");
   DaemonProcess& holder = hold("capture", recording);
   holder.sendSignal(SIGKILL);
-  for (pid_t command : commands_) ::kill(command, SIGKILL);
+  endCommands();
   EXPECT_EQ(holder.waitForExit(), -SIGKILL);
   EXPECT_TRUE(daemon->waitForLine("for terminated connection")) << daemon->output();
 
