@@ -161,9 +161,9 @@ TEST_F(DaemonTest, QuorvelctlHoldsSessionsWhileItsCommandRunsAndReportsByExitSta
 }
 
 // Who holds a recording, seen from real client processes: the listing names
-// each holder as the bus knows it, and a --wait that runs out says who holds
-// it.
-TEST_F(DaemonTest, SessionsNameTheirHoldersAsTheBusKnowsThem) {
+// each holder as the bus knows it, a --wait that runs out says who holds it,
+// and one without a limit asks again on the recording's change signal.
+TEST_F(DaemonTest, SessionsNameTheirHoldersAndWaitingEndsWhenTheHolderGoes) {
   auto daemon = serve();
   const std::string walk = path("Walk.m4a"), memo = path("Memo.m4a");
   const DaemonProcess& capturing = hold("capture", walk);
@@ -194,6 +194,17 @@ TEST_F(DaemonTest, SessionsNameTheirHoldersAsTheBusKnowsThem) {
                                  "quorvelctl: gave up after 0.2 s waiting for Walk.m4a: held by "
                                  "quorvelctl (pid {}) for capture since ",
                                  capturing.pid())));
+
+  DaemonProcess waiting(DaemonProcess::programPath("quorvelctl"),
+                        {"--bus-address", bus_.address(), "preview", "--wait", walk, "--", "sh",
+                         "-c", "echo granted >&2"});
+  // Refused first (after the one that gave up), then granted once the
+  // capture's client is gone.
+  ASSERT_TRUE(daemon->waitForLines("Received request to prepare 'Walk.m4a' for preview...", 2))
+      << daemon->output();
+  capturing.sendSignal(SIGKILL);
+  EXPECT_TRUE(waiting.waitForLine("granted")) << waiting.output() << daemon->output();
+  EXPECT_EQ(waiting.waitForExit(), 0) << waiting.output();
 }
 
 TEST_F(DaemonTest, ForeignClientsGetTheInterfaceAndItsErrors) {
