@@ -31,7 +31,7 @@ RCSXPCTransaction::~RCSXPCTransaction() {
   // Nothing can begin a transaction that is being destroyed, so one that the
   // list no longer holds has nothing left to end.
   if (!_listed.load(std::memory_order_acquire)) return;
-  RCSXPCTransactionController::sharedInstance().removeDestroyedTransaction(*this);
+  RCSXPCTransactionController::sharedInstance().removeActiveTransaction(*this);
 }
 
 void RCSXPCTransaction::beginTransaction() {

@@ -56,10 +56,11 @@ class RCSXPCTransaction : public std::enable_shared_from_this<RCSXPCTransaction>
   // Written only on the controller's queue; read by the destructor, which
   // skips the controller altogether for a transaction that was already ended.
   mutable std::atomic<bool> _listed{false};
-  // The links of that list, which runs through the transactions themselves.
-  // Controller queue only.
-  RCSXPCTransaction* _previousActive = nullptr;
-  RCSXPCTransaction* _nextActive = nullptr;
+  // The links of that list, which runs through the transactions themselves:
+  // the controller's bookkeeping, not the transaction's state. Controller
+  // queue only.
+  mutable RCSXPCTransaction* _previousActive = nullptr;
+  mutable RCSXPCTransaction* _nextActive = nullptr;
 };
 
 }  // namespace quorvel

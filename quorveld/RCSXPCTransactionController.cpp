@@ -43,18 +43,13 @@ void RCSXPCTransactionController::addActiveTransaction(RCSXPCTransaction& transa
 }
 
 void RCSXPCTransactionController::removeActiveTransaction(const RCSXPCTransaction& transaction) {
-  // A live transaction is never ended from the controller's own queue (only
-  // a destructor can run there), so this can always wait for its turn.
-  auto& listed = const_cast<RCSXPCTransaction&>(transaction);
-  _serialQueue.sync([&] { _onQueueRemove(listed); });
-}
-
-void RCSXPCTransactionController::removeDestroyedTransaction(RCSXPCTransaction& transaction) {
+  // Only a destructor can end a transaction from the controller's own queue
+  // (see above); it is that queue's running block and cannot wait for a turn.
   if (_serialQueue.isCurrent()) return _onQueueRemove(transaction);
   _serialQueue.sync([&] { _onQueueRemove(transaction); });
 }
 
-void RCSXPCTransactionController::_onQueueRemove(RCSXPCTransaction& transaction) {
+void RCSXPCTransactionController::_onQueueRemove(const RCSXPCTransaction& transaction) {
   QV_DCHECK_ON_QUEUE(_serialQueue);
   if (!transaction._listed.load(std::memory_order_relaxed)) return;
   (transaction._previousActive ? transaction._previousActive->_nextActive

@@ -33,15 +33,11 @@ class RCSXPCTransactionController {
   bool isInTransaction() const { return _inTransaction.load(std::memory_order_relaxed); }
 
  private:
-  friend class RCSXPCTransaction;
   RCSXPCTransactionController();
 
-  // The end of a transaction being destroyed: no std::shared_ptr to it can
-  // be made any more, but its entry must still go.
-  void removeDestroyedTransaction(RCSXPCTransaction& transaction);
   // Controller queue only (checked in debug builds): the body of removal,
   // and the change of the root after every change to the list.
-  void _onQueueRemove(RCSXPCTransaction& transaction);
+  void _onQueueRemove(const RCSXPCTransaction& transaction);
   void _onQueueUpdateInternalTransactionState();
 
   // Any thread.
