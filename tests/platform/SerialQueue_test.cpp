@@ -75,19 +75,29 @@ std::size_t threadCount(const std::string& name = "test.lazy") {
   return count;
 }
 
+// Opens its latch when the thread it belongs to ends.
+struct OnThreadExit {
+  std::shared_ptr<Latch> latch;
+  ~OnThreadExit() {
+    if (latch) latch->open();
+  }
+};
+thread_local OnThreadExit tOnExit;
+
 // A queue entered only synchronously costs no thread; a worker started for
-// asynchronous work ends once the queue has been idle a while.
+// asynchronous work ends by itself once the queue has been idle a while.
 TEST(SerialQueueTest, NeedsAThreadOnlyWhileAsyncWorkIsQueued) {
   SerialQueue queue("test.lazy");
   for (int i = 0; i < 100; ++i) queue.sync([] {});
   EXPECT_EQ(threadCount(), 0u);
   std::promise<std::size_t> during;
-  queue.async([&] { during.set_value(threadCount()); });
+  auto ended = std::make_shared<Latch>();
+  queue.async([&, ended] {
+    tOnExit.latch = ended;
+    during.set_value(threadCount());
+  });
   EXPECT_EQ(during.get_future().get(), 1u);
-  const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-  while (threadCount() > 0 && std::chrono::steady_clock::now() < until)
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));  // the worker's end has no event
-  EXPECT_EQ(threadCount(), 0u);
+  EXPECT_TRUE(ended->wait());
   // A new worker takes what comes later.
   std::promise<void> again;
   queue.async([&] { again.set_value(); });
