@@ -245,6 +245,15 @@ void SerialQueue::sync(Task task) {
         spun = true;
         continue;
       }
+      if (!tAdoption.queues.empty()) {
+        // About to wait for another thread, which may itself be waiting for
+        // a queue this thread adopted: hand those to their workers first, so
+        // the wait ends as it would have had the worker taken them.
+        lock.unlock();
+        handOffAdopted();
+        lock.lock();
+        continue;
+      }
       SyncGate gate;
       // No wake-up: whoever owns the queue passes it on when done.
       if (atHead) {
@@ -325,20 +334,22 @@ SerialQueue::AdoptionScope::AdoptionScope() {
 SerialQueue::AdoptionScope::~AdoptionScope() {
   // What the adopted tasks queue elsewhere goes to those queues' workers.
   tAdoption.open = false;
-  const bool unwinding = std::uncaught_exceptions() > 0;
+  // Leaving through an exception: hand the work to the workers instead of
+  // running tasks in the middle of unwinding.
+  if (std::uncaught_exceptions() > 0) handOffAdopted();
   while (!tAdoption.queues.empty()) {
     SerialQueue* queue = tAdoption.queues.front();
     tAdoption.queues.erase(tAdoption.queues.begin());
-    if (!unwinding) {
-      runAdopted(*queue);
-      continue;
-    }
-    // Leaving through an exception: hand the work to the worker instead of
-    // running tasks in the middle of unwinding.
+    runAdopted(*queue);
+  }
+}
+
+void SerialQueue::handOffAdopted() {
+  for (SerialQueue* queue : std::exchange(tAdoption.queues, {})) {
     State& state = *queue->state_;
     std::unique_lock lock(state.mutex);
     state.owned = false;
-    if (!state.items.empty() || state.stopping) queue->wakeWorker(lock);
+    if (!state.items.empty() || (state.stopping && state.workerRunning)) queue->wakeWorker(lock);
   }
 }
 

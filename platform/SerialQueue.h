@@ -49,7 +49,8 @@ class SerialQueue final : public DispatchQueue {
   // kAdoptedRunBudget has passed (the rest then goes to the worker). Tasks
   // queued meanwhile by other threads wait for it as they would for the
   // worker's current task. A sync() onto an adopted queue from the adopting
-  // thread first runs what the queue holds.
+  // thread first runs what the queue holds; a sync() from it that has to
+  // wait for another thread first hands its adopted queues to their workers.
   //
   // Meant for an event loop around each delivery: the work a delivered
   // message queues then runs right after it on the loop's thread, which
@@ -76,6 +77,8 @@ class SerialQueue final : public DispatchQueue {
   void wakeWorker(std::unique_lock<std::mutex>& lock);
   // Runs an adopted queue's tasks on the calling thread (see AdoptionScope).
   static void runAdopted(SerialQueue& queue);
+  // Gives every queue the calling thread has adopted back to its worker.
+  static void handOffAdopted();
   std::unique_ptr<State> state_;
 };
 

@@ -225,6 +225,21 @@ TEST(SerialQueueTest, AnAdoptingThreadRunsWhatItQueuedOnAnIdleQueueWhenTheScopeE
          a.queue.async(a.task("after"));
        },
        {"short@caller", "long@worker", "after@worker"}},
+      // The other queue's task waits for the adopted one, and the sync waits
+      // for that task: the adopted work must not wait for the scope's end.
+      {"a sync that has to wait hands what the thread adopted to the worker",
+       [](Adopted& a) {
+         SerialQueue other("test.other");
+         Latch adopted;
+         other.asyncOnWorker([&] {
+           adopted.wait();
+           a.queue.sync(a.task("synced by other"));
+         });
+         a.queue.async(a.task("x"));
+         adopted.open();
+         other.sync([] {});
+       },
+       {"x@worker", "synced by other@worker"}},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
