@@ -301,10 +301,7 @@ void SerialQueue::runAdopted(SerialQueue& queue) {
   for (bool first = true;; first = false) {
     if (state.items.empty() || state.items.front().workerOnly ||
         (!first && std::chrono::steady_clock::now() - start > kAdoptedRunBudget)) {
-      state.owned = false;
-      // Signalled with the lock held: a stopping queue may be freed as soon
-      // as its worker, woken by this, has left.
-      if (!state.items.empty() || (state.stopping && state.workerRunning)) queue.wakeWorker(lock);
+      queue.giveBackToWorker(lock);
       return;
     }
     Item item = std::move(state.items.front());
@@ -344,12 +341,18 @@ SerialQueue::AdoptionScope::~AdoptionScope() {
   }
 }
 
+void SerialQueue::giveBackToWorker(std::unique_lock<std::mutex>& lock) {
+  State& state = *state_;
+  state.owned = false;
+  // Signalled with the lock held: a stopping queue may be freed as soon as
+  // its worker, woken by this, has left.
+  if (!state.items.empty() || (state.stopping && state.workerRunning)) wakeWorker(lock);
+}
+
 void SerialQueue::handOffAdopted() {
   for (SerialQueue* queue : std::exchange(tAdoption.queues, {})) {
-    State& state = *queue->state_;
-    std::unique_lock lock(state.mutex);
-    state.owned = false;
-    if (!state.items.empty() || (state.stopping && state.workerRunning)) queue->wakeWorker(lock);
+    std::unique_lock lock(queue->state_->mutex);
+    queue->giveBackToWorker(lock);
   }
 }
 

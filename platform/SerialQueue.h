@@ -75,6 +75,10 @@ class SerialQueue final : public DispatchQueue {
   // Wakes the worker, starting one if none runs. Called with the queue's
   // mutex held through `lock`.
   void wakeWorker(std::unique_lock<std::mutex>& lock);
+  // Ends an adopted run: the queue is no longer owned, and the worker is
+  // woken if work is left or the queue is stopping. Called with the queue's
+  // mutex held through `lock`.
+  void giveBackToWorker(std::unique_lock<std::mutex>& lock);
   // Runs an adopted queue's tasks on the calling thread (see AdoptionScope).
   static void runAdopted(SerialQueue& queue);
   // Gives every queue the calling thread has adopted back to its worker.
